@@ -1,0 +1,28 @@
+# Compiler settings shared by every target of the project.
+add_library(cvdb_options INTERFACE)
+target_compile_options(cvdb_options INTERFACE -Wall -Wextra -Wpedantic -Wshadow
+  -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Woverloaded-virtual
+  -Wimplicit-fallthrough)
+if(CVDB_WERROR)
+  target_compile_options(cvdb_options INTERFACE -Werror)
+endif()
+target_compile_definitions(cvdb_options INTERFACE
+  CVDB_VERSION="${PROJECT_VERSION}" BOOST_ASIO_NO_DEPRECATED)
+if(CVDB_SANITIZE)
+  target_compile_options(cvdb_options INTERFACE -fsanitize=address,undefined
+    -fno-omit-frame-pointer -fno-sanitize-recover=undefined)
+  target_link_options(cvdb_options INTERFACE -fsanitize=address,undefined)
+endif()
+
+# cvdb_add_test(<name> SOURCES ... LIBS ...): one GoogleTest executable,
+# registered with CTest test by test.
+function(cvdb_add_test name)
+  cmake_parse_arguments(T "" "TIMEOUT" "SOURCES;LIBS;LABELS" ${ARGN})
+  add_executable(${name} ${T_SOURCES})
+  target_link_libraries(${name} PRIVATE ${T_LIBS} cvdb_testing GTest::gtest GTest::gmock cvdb_options)
+  if(NOT T_TIMEOUT)
+    set(T_TIMEOUT 300)
+  endif()
+  gtest_discover_tests(${name} DISCOVERY_TIMEOUT 60
+    PROPERTIES TIMEOUT ${T_TIMEOUT} LABELS "${T_LABELS}")
+endfunction()

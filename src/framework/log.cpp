@@ -1,0 +1,143 @@
+#include "framework/log.h"
+
+#include <spdlog/logger.h>
+#include <spdlog/sinks/rotating_file_sink.h>
+#include <spdlog/sinks/stdout_sinks.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <map>
+#include <memory>
+#include <mutex>
+
+#include "framework/platform.h"
+
+std::atomic<bool> g_LogVerbose{false};
+
+namespace Log {
+namespace {
+
+struct State {
+  std::mutex mutex;
+  std::shared_ptr<spdlog::logger> logger;  // guarded by mutex
+  bool console = false;                    // guarded by mutex
+  bool reportedFailure = false;            // guarded by mutex
+  std::mutex observerMutex;
+  std::map<std::uint64_t, Observer> observers;  // guarded by observerMutex
+  std::uint64_t nextObserver = 1;               // guarded by observerMutex
+};
+
+State& state() {
+  static State s;
+  return s;
+}
+
+const char* priorityName(LogPriority p) {
+  switch (p) {
+    case Error: return "error";
+    case Warning: return "warning";
+    case Notice: return "notice";
+    case Debug: return "debug";
+  }
+  return "other";
+}
+
+spdlog::level::level_enum levelOf(LogPriority p) {
+  switch (p) {
+    case Error: return spdlog::level::err;
+    case Warning: return spdlog::level::warn;
+    case Notice: return spdlog::level::info;
+    case Debug: return spdlog::level::debug;
+  }
+  return spdlog::level::info;
+}
+
+// Builds the logger for the current log folder. Called with the mutex held.
+std::shared_ptr<spdlog::logger> makeLogger(State& s) {
+  std::vector<spdlog::sink_ptr> sinks;
+  try {
+    const auto dir = Platform::inst().logDir();
+    std::filesystem::create_directories(dir);
+    sinks.push_back(std::make_shared<spdlog::sinks::rotating_file_sink_mt>(
+        (dir / kLogFileName).string(), kRecycleLogFileSize, kKeptLogFiles));
+  } catch (const std::exception& e) {
+    if (!s.reportedFailure) {
+      s.reportedFailure = true;
+      std::fprintf(stderr, "cvdbserver: cannot open log file: %s\n", e.what());
+    }
+  }
+  if (s.console) sinks.push_back(std::make_shared<spdlog::sinks::stderr_sink_mt>());
+  auto logger = std::make_shared<spdlog::logger>("cvdb", sinks.begin(), sinks.end());
+  logger->set_pattern("[%Y-%m-%d %H:%M:%S.%e] [%t] %v");
+  logger->set_level(spdlog::level::debug);
+  logger->flush_on(spdlog::level::warn);
+  return logger;
+}
+
+std::shared_ptr<spdlog::logger> currentLogger() {
+  State& s = state();
+  std::lock_guard lock(s.mutex);
+  if (!s.logger) s.logger = makeLogger(s);
+  return s.logger;
+}
+
+}  // namespace
+
+Lock::Lock(LogPriority priority) : priority_(priority) {}
+
+Lock::~Lock() {
+  if (priority_ == Debug && !g_LogVerbose) return;
+  try {
+    std::string text = std::move(text_).str();
+    auto logger = currentLogger();
+    logger->log(levelOf(priority_), "[{}] {}", priorityName(priority_), text);
+    State& s = state();
+    std::lock_guard lock(s.observerMutex);
+    for (auto& [id, observer] : s.observers) observer(priority_, text);
+  } catch (...) {
+    // A log entry must never take its caller down.
+  }
+}
+
+void setConsole(bool on) {
+  State& s = state();
+  std::lock_guard lock(s.mutex);
+  s.console = on;
+  s.logger.reset();
+}
+
+void reopen() {
+  State& s = state();
+  std::shared_ptr<spdlog::logger> old;
+  {
+    std::lock_guard lock(s.mutex);
+    old.swap(s.logger);
+  }
+  if (old) old->flush();
+}
+
+void flush() {
+  State& s = state();
+  std::shared_ptr<spdlog::logger> logger;
+  {
+    std::lock_guard lock(s.mutex);
+    logger = s.logger;
+  }
+  if (logger) logger->flush();
+}
+
+std::uint64_t addObserver(Observer observer) {
+  State& s = state();
+  std::lock_guard lock(s.observerMutex);
+  const std::uint64_t id = s.nextObserver++;
+  s.observers.emplace(id, std::move(observer));
+  return id;
+}
+
+void removeObserver(std::uint64_t id) {
+  State& s = state();
+  std::lock_guard lock(s.observerMutex);
+  s.observers.erase(id);
+}
+
+}  // namespace Log

@@ -1,0 +1,60 @@
+#pragma once
+// The command server: accepts TCP connections, reads request frames, builds
+// commands through the factory and hands them to their processor.
+//
+// Serving starts in the constructor (which throws std::runtime_error when the
+// port cannot be bound) and lasts until signalStop(); waitToFinish() then
+// returns once every connection is closed and every command that was being
+// processed has ended.
+//
+// Threads: socket I/O runs on a few I/O threads; commands run on an elastic
+// pool of worker threads, one command of a connection at a time, so a
+// command that blocks stalls neither its I/O thread nor other connections.
+// Every member may be called from any thread.
+// Failures: malformed frames, stalled frames and exhausted resources end the
+// connection concerned (or refuse it) and are reported through the IPC error
+// handler; they never affect other connections.
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+
+#include "framework/cmd.h"
+
+namespace Ipc {
+
+// Builds a command for a tag, or returns null for an unknown tag.
+using CmdFactory = std::function<std::shared_ptr<CmdI>(std::uint8_t tag)>;
+// Receives the transport's problem reports (a null socket for problems that
+// belong to no connection).
+using IpcErrorHandler = std::function<void(const std::shared_ptr<Socket>&, const std::string&)>;
+
+class SvcStub {
+ public:
+  // port 0 binds a free port (see port()). With forceIp4 false the server
+  // listens on IPv6 and IPv4 (a dual-stack socket), else on IPv4 only.
+  SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError = {});
+  ~SvcStub();
+  SvcStub(const SvcStub&) = delete;
+  SvcStub& operator=(const SvcStub&) = delete;
+
+  // The bound port.
+  std::uint16_t port() const noexcept;
+
+  // Stops accepting and closes every connection. Returns false when the
+  // server was already stopping.
+  bool signalStop();
+  // Blocks until the server has stopped after signalStop().
+  void waitToFinish();
+
+  // Sends the answer of a processed command and lets its connection go on
+  // with the next request. For progress commands the answer is their
+  // progress stream, so this only marks the processing as done.
+  void onRespReady(const std::shared_ptr<CmdI>& cmd);
+
+ private:
+  class Impl;
+  std::unique_ptr<Impl> impl_;
+};
+
+}  // namespace Ipc

@@ -1,0 +1,100 @@
+#include "framework/wire.h"
+
+#include <gtest/gtest.h>
+
+#include "framework/frame.h"
+
+namespace {
+
+TEST(Wire, RoundTripOfEveryFieldKind) {
+  std::string out;
+  wire::Writer w(out);
+  w.u8(0xAB);
+  w.boolean(true);
+  w.u32(0xDEADBEEF);
+  w.i32(-5);
+  w.u64(0x0102030405060708ULL);
+  w.i64(-1);
+  w.str(std::string("a\0b", 3));
+  w.bytes("xyz", 3);
+  w.strList({"", "one", "two"});
+
+  wire::Reader r(out);
+  EXPECT_EQ(r.u8(), 0xAB);
+  EXPECT_TRUE(r.boolean());
+  EXPECT_EQ(r.u32(), 0xDEADBEEFu);
+  EXPECT_EQ(r.i32(), -5);
+  EXPECT_EQ(r.u64(), 0x0102030405060708ULL);
+  EXPECT_EQ(r.i64(), -1);
+  EXPECT_EQ(r.str(), std::string("a\0b", 3));
+  EXPECT_EQ(r.bytes(), "xyz");
+  EXPECT_EQ(r.strList(), (std::vector<std::string>{"", "one", "two"}));
+  EXPECT_NO_THROW(r.expectEnd());
+}
+
+TEST(Wire, IntegersAreLittleEndian) {
+  std::string out;
+  wire::Writer w(out);
+  w.u32(0x01020304);
+  EXPECT_EQ(out, std::string("\x04\x03\x02\x01", 4));
+}
+
+TEST(Wire, LengthsBeyondTheMessageAreRefusedBeforeAllocating) {
+  // A string that claims 4 GiB, a byte string that claims 2^63 bytes and a
+  // list that claims 2^32-1 entries, each in a message of a few bytes.
+  const std::string bigString("\xff\xff\xff\xff" "ab", 6);
+  const std::string bigBytes("\0\0\0\0\0\0\0\x80" "ab", 10);
+  const std::string bigList("\xff\xff\xff\xff", 4);
+  wire::Reader a(bigString), b(bigBytes), c(bigList);
+  EXPECT_THROW(a.str(), wire::DecodeError);
+  EXPECT_THROW(b.bytes(), wire::DecodeError);
+  EXPECT_THROW(c.strList(), wire::DecodeError);
+}
+
+TEST(Wire, TruncatedIntegersBadBooleansAndTrailingBytesAreMalformed) {
+  wire::Reader shortInt(std::string("\x01\x02\x03", 3));
+  EXPECT_THROW(shortInt.u32(), wire::DecodeError);
+  wire::Reader badBool(std::string("\x02", 1));
+  EXPECT_THROW(badBool.boolean(), wire::DecodeError);
+  wire::Reader trailing(std::string("\x01\x02", 2));
+  trailing.u8();
+  EXPECT_THROW(trailing.expectEnd(), wire::DecodeError);
+}
+
+TEST(Wire, SharedBytesTravelWithoutACopy) {
+  std::string head;
+  SharedMemBuffer tail;
+  wire::Writer w(head, tail);
+  SharedMemBuffer content(MemBuffer::copyOf("payload"));
+  w.sharedBytes(content);
+  EXPECT_EQ(tail.data(), content.data());
+  EXPECT_EQ(head.size(), 8u);  // only the length went into the head
+  EXPECT_THROW(w.sharedBytes(content), std::logic_error);
+
+  // A reader with an owner hands out views that keep the owner alive.
+  std::string msg;
+  wire::Writer m(msg);
+  m.bytes("abc", 3);
+  std::shared_ptr<unsigned char> owner(ExportedUCharAlloc::alloc(msg.size()), ExportedUCharAlloc());
+  std::memcpy(owner.get(), msg.data(), msg.size());
+  wire::Reader r(owner, msg.size());
+  SharedMemBuffer b = r.sharedBytes();
+  EXPECT_EQ(b.view(), "abc");
+  EXPECT_EQ(b.data(), owner.get() + 8);
+  owner.reset();
+  EXPECT_EQ(b.view(), "abc");
+}
+
+TEST(Frame, HeaderCarriesLengthTagAndKind) {
+  wire::OutFrame f;
+  wire::beginFrame(f.head, 7, wire::FrameKind::Answer);
+  wire::Writer w(f.head, f.tail);
+  w.str("hi");
+  wire::endFrame(f);
+  ASSERT_EQ(f.head.size(), wire::kHeaderSize + 6);
+  EXPECT_EQ(wire::frameLength(reinterpret_cast<const unsigned char*>(f.head.data())), 8u);
+  EXPECT_EQ(f.head[4], 7);
+  EXPECT_EQ(f.head[5], static_cast<char>(wire::FrameKind::Answer));
+}
+
+}  // namespace
