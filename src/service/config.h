@@ -1,0 +1,66 @@
+#pragma once
+// The server's settings, read once from config.json in the default
+// database root and printed to the log.
+//
+// DBConfig::inst() loads the record on its first call (from whichever
+// thread; concurrent first callers wait) and returns the same read-only
+// record afterwards. A missing file, a file that is not JSON or a value of
+// the wrong type never stops the server: the record always ends up
+// complete, with defaults where the file gave nothing usable.
+//
+// Folder texts use "/" as separator and always end with one "/".
+
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <string>
+
+class DBConfig {
+ public:
+  std::string DBRoot;
+  std::string DBLogRoot;
+  std::string BackupFolder;
+  std::uint16_t ServerPort = 45678;
+  bool ForceIP4 = false;
+  std::uint64_t MaxActiveDBs = 100;
+  std::uint64_t MaxActiveClientsPerDB = 100;
+  std::uint64_t MaxActiveClients = 512;
+  std::string DBFilesPrefix = "cvd";
+  std::string DBFileName = "cvdb.edb";
+  std::int32_t MaxWaitMaintenanceOpSecs = 10;
+  bool EnableEngineLogging = false;
+
+  // The process-wide record; loads and prints it on the first call.
+  static const DBConfig& inst();
+
+  // Loads a record from defaultRoot + "config.json" without touching the
+  // process-wide one: every rule of the load (defaults, key order, type
+  // errors, limits, the backup-folder rule) applies, and the printout is
+  // logged. defaultRoot must end with "/".
+  static DBConfig load(const std::string& defaultRoot);
+
+  // The default database root: the platform's system configuration folder
+  // joined with "db", followed by "/".
+  static std::string defaultRoot();
+
+  // The fifteen-line settings printout, without the log entry around it.
+  std::string printout() const;
+
+  // For tests: makes inst() return the given record while the object lives.
+  // Not for concurrent use with other overrides.
+  class TestOverride {
+   public:
+    explicit TestOverride(DBConfig config);
+    ~TestOverride();
+    TestOverride(const TestOverride&) = delete;
+    TestOverride& operator=(const TestOverride&) = delete;
+
+   private:
+    std::unique_ptr<DBConfig> config_;
+    const DBConfig* previous_;
+  };
+};
+
+// Every "\" becomes "/"; a non-empty text gets one trailing "/" unless it
+// already ends with one. An empty text stays empty.
+std::string normaliseFolder(std::string text);

@@ -1,0 +1,54 @@
+#pragma once
+// Database names, database keys and the paths derived from them.
+//
+// A client names a database with free text in which "\" separates the
+// levels of a hierarchy. folderName() turns that text into the database key:
+// the one string under which the engine pool, the store and maintenance know
+// the database, and under which it is listed and backed up. Keys keep "\" as
+// their separator; only the path functions below turn it into "/".
+//
+// All functions are pure functions of their input and of the settings
+// (DBConfig::inst()); they touch no file and may run on any thread.
+
+#include <string>
+#include <string_view>
+
+namespace DB {
+
+inline constexpr const char* kRootDbName = "root.db";
+inline constexpr const char* kBackupSubfolder = "db.backup/";
+inline constexpr const char* kTempSubfolder = "db.temp/";
+inline constexpr const char* kDataSubfolder = "d/";
+inline constexpr const char* kBackupExtension = ".cvbak";
+inline constexpr const char* kOriginFileName = "originDB.txt";
+
+// The database key of a client-given name. Total: every text gives a key.
+std::string folderName(std::string_view name);
+
+// Whether a client-given database name may be used at all: false for a
+// name that would leave the database root (a component "." or "..") or
+// that holds a NUL byte. why, when given, receives the reason.
+bool isValidDatabaseName(std::string_view name, std::string* why = nullptr);
+
+// Paths of a database, from its key; every folder ends with "/".
+std::string databaseFolder(std::string_view key);  // DBRoot + key + "/"
+std::string logFolder(std::string_view key);       // DBLogRoot + key + "/"
+std::string tempFolder(std::string_view key);      // DBRoot + "db.temp/" + key + "/"
+std::string mainFile(std::string_view key);        // databaseFolder + DBFileName
+std::string dataFolder(std::string_view key);      // databaseFolder + "d/"
+
+// The backup file name of a key (no folder), and the key read back from a
+// backup file name ("" when the name is not a backup file's).
+std::string backupFileName(std::string_view key);
+std::string backupFile(std::string_view key);  // BackupFolder + backupFileName
+std::string nameFromBackupFile(std::string_view fileName);
+
+// Whether a folder directly below DBRoot may hold databases.
+bool isDBFolderName(std::string_view entryName);
+
+// The key of a database found on disk from its folder's path relative to
+// DBRoot (components joined with "/"): components joined with "\", passed
+// through folderName.
+std::string nameFromRelativeFolder(std::string_view relativePath);
+
+}  // namespace DB
