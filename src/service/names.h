@@ -27,10 +27,21 @@ std::string folderName(std::string_view name);
 
 // Whether a client-given database name may be used at all: false for a
 // name that would leave the database root (a component "." or "..") or
-// that holds a NUL byte. why, when given, receives the reason.
+// that holds a NUL byte; false as well for a name with an empty component
+// (a leading separator, doubled separators, more than one trailing one),
+// which would give a second key for an existing database's folder, and for
+// a name whose first component is one of the server's own folders
+// (see isDBFolderName). "\" and "/" both separate components; the empty
+// name and a lone separator are valid (the root database). Names read back
+// from backup files must pass this test too. why, when given, receives the
+// reason.
 bool isValidDatabaseName(std::string_view name, std::string* why = nullptr);
 
-// Paths of a database, from its key; every folder ends with "/".
+// Paths of a database, from its key; every folder ends with "/". Each "\"
+// of the key becomes "/", and empty components are dropped, so that a
+// leading separator never makes the path absolute. The key must come from
+// folderName() of a valid name (or from nameFromRelativeFolder): these
+// functions do not check for "." and "..".
 std::string databaseFolder(std::string_view key);  // DBRoot + key + "/"
 std::string logFolder(std::string_view key);       // DBLogRoot + key + "/"
 std::string tempFolder(std::string_view key);      // DBRoot + "db.temp/" + key + "/"

@@ -1,0 +1,185 @@
+#include "service/config.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <sstream>
+
+#include "framework/json.h"
+#include "framework/log.h"
+#include "framework/platform.h"
+#include "service/names.h"
+#include "service/network_path.h"
+
+namespace {
+
+constexpr const char* kConfigFileName = "config.json";
+constexpr std::uint64_t kMaxActiveDBsLimit = 1024;
+constexpr std::uint64_t kMaxActiveClientsPerDBLimit = 30000;
+constexpr std::size_t kPrefixLength = 3;
+
+// Set while a test installs its own record; inst() must stay a single load
+// on the hot path, hence an atomic pointer rather than a lock.
+std::atomic<const DBConfig*> g_override{nullptr};
+
+class FileDescriptor {
+ public:
+  explicit FileDescriptor(int fd) noexcept : fd_(fd) {}
+  ~FileDescriptor() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  FileDescriptor(const FileDescriptor&) = delete;
+  FileDescriptor& operator=(const FileDescriptor&) = delete;
+  int get() const noexcept { return fd_; }
+
+ private:
+  int fd_;
+};
+
+// Reads the whole configuration file. False when it is missing or cannot be
+// read (a folder of that name included): the settings then keep their
+// defaults without a message, as an absent file does.
+bool readConfigFile(const std::string& path, std::string& text) {
+  const FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (fd.get() < 0) return false;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
+  text.clear();
+  char buffer[8192];
+  while (true) {
+    const ssize_t n = ::read(fd.get(), buffer, sizeof buffer);
+    if (n == 0) return true;
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    text.append(buffer, static_cast<std::size_t>(n));
+  }
+}
+
+// The folder keys treat a value of another type as an empty text.
+std::string stringOrEmpty(const json::Value& v) { return v.isString() ? v.asString() : std::string(); }
+
+std::uint64_t limited(std::int64_t value, std::uint64_t limit) {
+  // Taken as unsigned on purpose: a negative value ends up at the limit.
+  return std::min(static_cast<std::uint64_t>(value), limit);
+}
+
+// Reads the keys in their fixed order. A key of the wrong type throws
+// json::Exc from asInteger/asString; the caller logs it, and every field set
+// before it keeps its new value.
+void readKeys(const json::Object& obj, DBConfig& c) {
+  if (const auto root = stringOrEmpty(obj.get("DBRoot")); !root.empty()) {
+    c.DBRoot = normaliseFolder(root);
+    c.DBLogRoot = c.DBRoot;
+  }
+  if (DB::isNetworkPath(c.DBRoot)) {
+    Log::Lock(Log::Warning).logStreamLine()
+        << "WARNING: Network location specified for base path. Database on remote location is NOT "
+           "recommended - use at your own risk! Contact customer support if you need help "
+           "configuring the database server.";
+  }
+  if (const auto logRoot = stringOrEmpty(obj.get("DBLogRoot")); !logRoot.empty()) {
+    c.DBLogRoot = normaliseFolder(logRoot);
+  }
+  if (const auto v = obj.get("BackupFolder"); !v.empty()) c.BackupFolder = stringOrEmpty(v);
+  if (const auto v = obj.get("ServerPort"); !v.empty()) {
+    c.ServerPort = static_cast<std::uint16_t>(v.asInteger());
+  }
+  if (const auto v = obj.get("ForceIP4"); !v.empty()) c.ForceIP4 = v.isTrue();
+  if (const auto v = obj.get("MaxActiveDBs"); !v.empty()) {
+    c.MaxActiveDBs = limited(v.asInteger(), kMaxActiveDBsLimit);
+  }
+  if (const auto v = obj.get("MaxActiveClientsPerDB"); !v.empty()) {
+    c.MaxActiveClientsPerDB = limited(v.asInteger(), kMaxActiveClientsPerDBLimit);
+  }
+  if (const auto v = obj.get("MaxActiveClients"); !v.empty()) {
+    c.MaxActiveClients = static_cast<std::uint64_t>(v.asInteger());
+  }
+  if (const auto v = obj.get("DBFilesPrefix"); !v.empty()) {
+    std::string prefix = v.asString();
+    prefix.resize(kPrefixLength, '_');
+    c.DBFilesPrefix = std::move(prefix);
+  }
+  if (const auto v = obj.get("DBFileName"); !v.empty()) c.DBFileName = v.asString();
+  if (obj.get("ExtraLog").isTrue()) g_LogVerbose = true;
+  if (const auto v = obj.get("MaxWaitMaintenanceOpSecs"); !v.empty()) {
+    c.MaxWaitMaintenanceOpSecs = static_cast<std::int32_t>(static_cast<std::uint32_t>(v.asInteger()));
+  }
+  if (const auto v = obj.get("EnableEngineLogging"); !v.empty()) c.EnableEngineLogging = v.isTrue();
+}
+
+const DBConfig& loadedRecord() {
+  static const DBConfig record = DBConfig::load(DBConfig::defaultRoot());
+  return record;
+}
+
+}  // namespace
+
+std::string normaliseFolder(std::string text) {
+  std::replace(text.begin(), text.end(), '\\', '/');
+  if (!text.empty() && text.back() != '/') text.push_back('/');
+  return text;
+}
+
+std::string DBConfig::defaultRoot() {
+  return (Platform::inst().corvinaSystemConfigDir() / "db").string() + "/";
+}
+
+const DBConfig& DBConfig::inst() {
+  if (const DBConfig* o = g_override.load(std::memory_order_acquire)) return *o;
+  return loadedRecord();
+}
+
+DBConfig DBConfig::load(const std::string& defaultRoot) {
+  DBConfig c;
+  c.DBRoot = defaultRoot;
+  c.DBLogRoot = defaultRoot;
+  try {
+    std::string text;
+    if (readConfigFile(defaultRoot + kConfigFileName, text)) {
+      const json::Object obj = json::strToObject(text);
+      if (obj.size() > 0) readKeys(obj, c);
+    }
+  } catch (const std::exception& e) {
+    Log::Lock(Log::Error).logStreamLine() << "Configuration initialization error: " << e.what();
+  }
+  if (c.BackupFolder.empty() || c.BackupFolder == c.DBRoot) {
+    c.BackupFolder = c.DBRoot + DB::kBackupSubfolder;
+  } else {
+    c.BackupFolder = normaliseFolder(c.BackupFolder);
+  }
+  Log::Lock(Log::Notice).logStreamLine() << c.printout();
+  return c;
+}
+
+std::string DBConfig::printout() const {
+  const auto onOff = [](bool on) { return on ? "enabled" : "disabled"; };
+  std::ostringstream out;
+  out << "Starting with:\n"
+      << "\tversion: " << CVDB_VERSION << '\n'
+      << "\tdb root folder: \"" << DBRoot << "\"\n"
+      << "\tdb log root folder: \"" << DBLogRoot << "\"\n"
+      << "\tdb backup folder: \"" << BackupFolder << "\"\n"
+      << "\tTCP listening port: " << ServerPort << '\n'
+      << "\tmaximum active dbs: " << MaxActiveDBs << '\n'
+      << "\tmaximum active clients per db: " << MaxActiveClientsPerDB << '\n'
+      << "\tmaximum total active clients: " << MaxActiveClients << '\n'
+      << "\tmeta db files prefix: \"" << DBFilesPrefix << "\"\n"
+      << "\tmeta db main file name: \"" << DBFileName << "\"\n"
+      << "\textra logging: " << onOff(g_LogVerbose) << '\n'
+      << "\trecycle log file size: " << Log::kRecycleLogFileSize << '\n'
+      << "\tmaximum wait time maintenance operation: " << MaxWaitMaintenanceOpSecs << '\n'
+      << "\tdb engine event logging: " << onOff(EnableEngineLogging) << '\n';
+  return out.str();
+}
+
+DBConfig::TestOverride::TestOverride(DBConfig config)
+    : config_(std::make_unique<DBConfig>(std::move(config))),
+      previous_(g_override.exchange(config_.get(), std::memory_order_acq_rel)) {}
+
+DBConfig::TestOverride::~TestOverride() { g_override.store(previous_, std::memory_order_release); }
