@@ -1,0 +1,260 @@
+#include "service/config.h"
+
+#include <gtest/gtest.h>
+#include <linux/magic.h>
+
+#include <barrier>
+#include <filesystem>
+#include <limits>
+#include <thread>
+#include <vector>
+
+#include "framework/platform.h"
+#include "service/network_path.h"
+#include "support/log_capture.h"
+#include "support/temp_dir.h"
+
+namespace {
+
+using testing_support::LogCapture;
+using testing_support::TempDir;
+using testing_support::VerboseLog;
+using testing_support::writeFile;
+
+constexpr const char* kInitError = "Configuration initialization error: ";
+
+// A default root in a temporary folder with the given config.json (none
+// when text is null).
+class ConfigFile {
+ public:
+  explicit ConfigFile(const char* text) : root_(dir_.path().string() + "/db/") {
+    std::filesystem::create_directories(root_);
+    if (text) writeFile(root_ + "config.json", text);
+  }
+  const std::string& root() const { return root_; }
+  DBConfig load() const { return DBConfig::load(root_); }
+
+ private:
+  TempDir dir_;
+  std::string root_;
+};
+
+DBConfig loadWith(const char* text) { return ConfigFile(text).load(); }
+
+TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
+  VerboseLog quiet(false);
+  LogCapture log;
+  const ConfigFile file(nullptr);
+  const DBConfig c = file.load();
+  const std::string& r = file.root();
+
+  const std::string expected = std::string("Starting with:\n") +
+                               "\tversion: " + CVDB_VERSION + "\n"
+                               "\tdb root folder: \"" + r + "\"\n"
+                               "\tdb log root folder: \"" + r + "\"\n"
+                               "\tdb backup folder: \"" + r + "db.backup/\"\n"
+                               "\tTCP listening port: 45678\n"
+                               "\tmaximum active dbs: 100\n"
+                               "\tmaximum active clients per db: 100\n"
+                               "\tmaximum total active clients: 512\n"
+                               "\tmeta db files prefix: \"cvd\"\n"
+                               "\tmeta db main file name: \"cvdb.edb\"\n"
+                               "\textra logging: disabled\n"
+                               "\trecycle log file size: 10485760\n"
+                               "\tmaximum wait time maintenance operation: 10\n"
+                               "\tdb engine event logging: disabled\n";
+  const auto entries = log.entries();
+  ASSERT_EQ(entries.size(), 1u);
+  EXPECT_EQ(entries[0].priority, Log::Notice);
+  EXPECT_EQ(entries[0].text, expected);
+  EXPECT_FALSE(c.ForceIP4);
+}
+
+TEST(Config, UnusableFilesKeepDefaults) {
+  struct Case {
+    const char* text;
+    bool logsError;
+  };
+  for (const Case& k : {Case{"{}", false}, Case{"{\"DBRoot\": ", true}, Case{"", true},
+                        Case{"[1, 2]", true}, Case{"{} trailing", true}}) {
+    LogCapture log;
+    const DBConfig c = loadWith(k.text);
+    EXPECT_EQ(c.ServerPort, 45678) << k.text;
+    EXPECT_EQ(c.MaxActiveDBs, 100u) << k.text;
+    EXPECT_EQ(log.count(Log::Error, kInitError), k.logsError ? 1u : 0u) << k.text;
+    EXPECT_EQ(log.count(Log::Notice, "Starting with:"), 1u) << k.text;
+  }
+
+  // Unreadable (here a folder in its place) counts as missing: no message.
+  LogCapture log;
+  const ConfigFile file(nullptr);
+  std::filesystem::create_directories(file.root() + "config.json");
+  EXPECT_EQ(file.load().ServerPort, 45678);
+  EXPECT_EQ(log.count(Log::Error, kInitError), 0u);
+}
+
+TEST(Config, WrongTypeStopsReadingInKeyOrderNotFileOrder) {
+  LogCapture log;
+  // The file lists the late key first: reading follows the fixed key order,
+  // so MaxActiveDBs (read after ServerPort) keeps its default.
+  const DBConfig c = loadWith(R"({"MaxActiveDBs": 5, "ServerPort": "4000",
+      "BackupFolder": "/bak", "DBRoot": "/data", "MaxActiveClients": 9})");
+  EXPECT_EQ(c.DBRoot, "/data/");
+  EXPECT_EQ(c.BackupFolder, "/bak/");
+  EXPECT_EQ(c.ServerPort, 45678);
+  EXPECT_EQ(c.MaxActiveDBs, 100u);
+  EXPECT_EQ(c.MaxActiveClients, 512u);
+  EXPECT_EQ(log.count(Log::Error, "Configuration initialization error: JSON error: Wrong type: string. "
+                                  "Expected type: integer"),
+            1u);
+
+  log.clear();
+  const DBConfig d = loadWith(R"({"MaxActiveClients": 9, "DBFilesPrefix": 12, "DBFileName": "x.db"})");
+  EXPECT_EQ(d.MaxActiveClients, 9u);
+  EXPECT_EQ(d.DBFileName, "cvdb.edb");
+  EXPECT_EQ(log.count(Log::Error, "Wrong type: integer. Expected type: string"), 1u);
+}
+
+TEST(Config, LooselyTypedKeysNeverStopReading) {
+  LogCapture log;
+  VerboseLog quiet(false);
+  const DBConfig c = loadWith(R"({"DBRoot": 5, "DBLogRoot": [], "BackupFolder": null,
+      "ForceIP4": "yes", "ExtraLog": 1, "EnableEngineLogging": 1, "ServerPort": 1})");
+  EXPECT_EQ(log.count(Log::Error, kInitError), 0u);
+  EXPECT_EQ(c.ServerPort, 1);
+  EXPECT_FALSE(c.ForceIP4);
+  EXPECT_FALSE(c.EnableEngineLogging);
+  EXPECT_FALSE(g_LogVerbose);
+  EXPECT_EQ(c.BackupFolder, c.DBRoot + "db.backup/");
+  EXPECT_EQ(c.DBLogRoot, c.DBRoot);
+}
+
+TEST(Config, NumbersAreLimitedAndTruncatedAsStored) {
+  const DBConfig a = loadWith(R"({"ServerPort": 70000, "MaxActiveDBs": 5000,
+      "MaxActiveClientsPerDB": 40000, "MaxActiveClients": -1,
+      "MaxWaitMaintenanceOpSecs": 4294967306})");
+  EXPECT_EQ(a.ServerPort, 4464);
+  EXPECT_EQ(a.MaxActiveDBs, 1024u);
+  EXPECT_EQ(a.MaxActiveClientsPerDB, 30000u);
+  EXPECT_EQ(a.MaxActiveClients, std::numeric_limits<std::uint64_t>::max());
+  EXPECT_EQ(a.MaxWaitMaintenanceOpSecs, 10);
+
+  // Negative counts are taken as huge unsigned numbers and so hit the limit.
+  const DBConfig b = loadWith(R"({"ServerPort": -1, "MaxActiveDBs": -1,
+      "MaxActiveClientsPerDB": -7, "MaxWaitMaintenanceOpSecs": 4294967295})");
+  EXPECT_EQ(b.ServerPort, 65535);
+  EXPECT_EQ(b.MaxActiveDBs, 1024u);
+  EXPECT_EQ(b.MaxActiveClientsPerDB, 30000u);
+  EXPECT_EQ(b.MaxWaitMaintenanceOpSecs, -1);
+  EXPECT_NE(b.printout().find("\tmaximum wait time maintenance operation: -1\n"), std::string::npos);
+}
+
+TEST(Config, PrefixIsPaddedOrCutToThreeCharactersAndFileNameKeptAsIs) {
+  EXPECT_EQ(loadWith(R"({"DBFilesPrefix": "abcdef"})").DBFilesPrefix, "abc");
+  EXPECT_EQ(loadWith(R"({"DBFilesPrefix": "x"})").DBFilesPrefix, "x__");
+  EXPECT_EQ(loadWith(R"({"DBFilesPrefix": ""})").DBFilesPrefix, "___");
+  EXPECT_EQ(loadWith(R"({"DBFileName": ""})").DBFileName, "");
+  EXPECT_EQ(loadWith(R"({"DBFileName": "Main DB.edb"})").DBFileName, "Main DB.edb");
+}
+
+TEST(Config, SwitchesTakeOnlyTheLiteralTrue) {
+  {
+    VerboseLog quiet(false);
+    const DBConfig c = loadWith(R"({"ForceIP4": true, "ExtraLog": true, "EnableEngineLogging": true})");
+    EXPECT_TRUE(c.ForceIP4);
+    EXPECT_TRUE(c.EnableEngineLogging);
+    EXPECT_TRUE(g_LogVerbose);
+    EXPECT_NE(c.printout().find("\textra logging: enabled\n"), std::string::npos);
+    EXPECT_NE(c.printout().find("\tdb engine event logging: enabled\n"), std::string::npos);
+  }
+  {
+    // ExtraLog false leaves a flag that is already on alone.
+    VerboseLog verbose(true);
+    loadWith(R"({"ExtraLog": false})");
+    EXPECT_TRUE(g_LogVerbose);
+  }
+  for (const char* text : {R"({"ForceIP4": 1})", R"({"ForceIP4": "true"})", R"({"ForceIP4": false})"}) {
+    EXPECT_FALSE(loadWith(text).ForceIP4) << text;
+  }
+}
+
+TEST(Config, FoldersAreNormalisedAndTheBackupFolderFollowsTheRoot) {
+  const DBConfig a = loadWith(R"({"DBRoot": "/srv\\cvdb"})");
+  EXPECT_EQ(a.DBRoot, "/srv/cvdb/");
+  EXPECT_EQ(a.DBLogRoot, "/srv/cvdb/");
+  EXPECT_EQ(a.BackupFolder, "/srv/cvdb/db.backup/");
+
+  const DBConfig b = loadWith(R"({"DBRoot": "/data/", "DBLogRoot": "/logs", "BackupFolder": "/data/"})");
+  EXPECT_EQ(b.DBLogRoot, "/logs/");
+  EXPECT_EQ(b.BackupFolder, "/data/db.backup/");
+
+  EXPECT_EQ(loadWith(R"({"BackupFolder": "\\mnt\\bak"})").BackupFolder, "/mnt/bak/");
+  EXPECT_EQ(normaliseFolder(""), "");
+  const ConfigFile empty(R"({"DBRoot": "", "DBLogRoot": "", "BackupFolder": ""})");
+  const DBConfig d = empty.load();
+  EXPECT_EQ(d.DBRoot, empty.root());
+  EXPECT_EQ(d.DBLogRoot, empty.root());
+  EXPECT_EQ(d.BackupFolder, empty.root() + "db.backup/");
+
+  // Compared byte for byte before normalising: "/data" is not "/data/", so
+  // the backup folder is the root itself, as it always has been.
+  const DBConfig c = loadWith(R"({"DBRoot": "/data", "BackupFolder": "/data"})");
+  EXPECT_EQ(c.BackupFolder, "/data/");
+}
+
+TEST(Config, LocalRootGivesNoNetworkWarning) {
+  LogCapture log;
+  TempDir data;
+  const ConfigFile file(
+      (std::string(R"({"DBRoot": ")") + data.path().string() + R"(/not/yet/created"})").c_str());
+  file.load();
+  EXPECT_EQ(log.count(Log::Warning, "Network location"), 0u);
+}
+
+TEST(NetworkPath, RemoteFileSystemsAreRecognised) {
+  EXPECT_TRUE(DB::isNetworkFileSystem(NFS_SUPER_MAGIC, ""));
+  EXPECT_TRUE(DB::isNetworkFileSystem(SMB2_SUPER_MAGIC, ""));
+  EXPECT_TRUE(DB::isNetworkFileSystem(FUSE_SUPER_MAGIC, "fuse.sshfs"));
+  EXPECT_FALSE(DB::isNetworkFileSystem(FUSE_SUPER_MAGIC, "fuse.ntfs-3g"));
+  EXPECT_FALSE(DB::isNetworkFileSystem(EXT4_SUPER_MAGIC, "fuse.sshfs"));
+  EXPECT_FALSE(DB::isNetworkPath(""));
+}
+
+TEST(Config, InstOverrideNestsAndRestores) {
+  DBConfig a;
+  a.DBRoot = "/a/";
+  DBConfig b;
+  b.DBRoot = "/b/";
+  {
+    DBConfig::TestOverride first(a);
+    EXPECT_EQ(DBConfig::inst().DBRoot, "/a/");
+    {
+      DBConfig::TestOverride second(b);
+      EXPECT_EQ(DBConfig::inst().DBRoot, "/b/");
+    }
+    EXPECT_EQ(DBConfig::inst().DBRoot, "/a/");
+  }
+}
+
+// The only test that loads the process-wide record: it must happen once,
+// whichever thread comes first.
+TEST(Config, InstLoadsOnceForConcurrentFirstCallers) {
+  LogCapture log;
+  constexpr int kThreads = 8;
+  std::vector<const DBConfig*> seen(kThreads);
+  std::barrier start(kThreads);
+  {
+    std::vector<std::jthread> threads;
+    for (int i = 0; i < kThreads; ++i) {
+      threads.emplace_back([&, i] {
+        start.arrive_and_wait();
+        seen[static_cast<std::size_t>(i)] = &DBConfig::inst();
+      });
+    }
+  }
+  for (const auto* p : seen) EXPECT_EQ(p, seen[0]);
+  EXPECT_EQ(log.count(Log::Notice, "Starting with:"), 1u);
+  EXPECT_EQ(seen[0]->DBRoot, (Platform::inst().corvinaSystemConfigDir() / "db").string() + "/");
+}
+
+}  // namespace

@@ -1,0 +1,183 @@
+#include "service/names.h"
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <iterator>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "service/config.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using testing_support::LogCapture;
+
+DBConfig testConfig() {
+  DBConfig c;
+  c.DBRoot = "/srv/root/";
+  c.DBLogRoot = "/srv/logs/";
+  c.BackupFolder = "/srv/bak/";
+  c.DBFileName = "main.edb";
+  return c;
+}
+
+class Names : public ::testing::Test {
+ protected:
+  DBConfig::TestOverride config_{testConfig()};
+};
+
+TEST(FolderName, NamesBecomeLowerCaseKeysWithDataFoldersEscaped) {
+  const std::vector<std::pair<std::string, std::string>> cases = {
+      {"", "root.db"},
+      {"\\", "root.db"},
+      {"/", "root.db"},
+      {"Sales", "sales"},
+      {"Sales\\", "sales"},
+      {"Sales\\\\", "sales\\"},
+      {"x\\d", "x\\d_"},
+      {"x\\D\\y", "x\\d_\\y"},
+      {"x\\d\\d", "x\\d_\\d_"},
+      {"d\\x", "d\\x"},
+      {"d", "d"},
+      {"x\\dd", "x\\dd"},
+      {"x\\d_", "x\\d_"},
+      {"x\\\\d", "x\\\\d_"},
+      // "/" separates levels as "\" does, so it cannot reach a data folder.
+      {"x/d", "x\\d_"},
+      {"X/D/y", "x\\d_\\y"},
+      {"a/b\\c/", "a\\b\\c"},
+      // Only A to Z change; UTF-8 bytes stay as they are.
+      {"\xC3\x84rger", "\xC3\x84rger"},
+  };
+  for (const auto& [name, key] : cases) EXPECT_EQ(DB::folderName(name), key) << name;
+}
+
+TEST(ValidName, RefusesNamesThatLeaveTheRootOrAliasAnotherKey) {
+  for (const std::string name : {"", "\\", "/", "Sales", "a\\b", "a/b", "sales\\", "x\\d", "..x",
+                                 "a.b", "root.db", "...", "x\\db.temp", "DB.temp2"}) {
+    EXPECT_TRUE(DB::isValidDatabaseName(name)) << name;
+  }
+  for (const std::string name :
+       {"..", ".", "a\\..\\b", "a/../b", "./a", "a\\.", "A/..", "\\sales", "/sales", "a\\\\b",
+        "a//b", "sales\\\\", "db.temp\\x", "DB.Backup", ".config/x", "db.backup"}) {
+    std::string why;
+    EXPECT_FALSE(DB::isValidDatabaseName(name, &why)) << name;
+    EXPECT_FALSE(why.empty()) << name;
+  }
+  EXPECT_FALSE(DB::isValidDatabaseName(std::string("a\0b", 3)));
+  EXPECT_FALSE(DB::isValidDatabaseName(std::string("\0", 1)));
+}
+
+TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRoots) {
+  const std::string key = DB::folderName("Team\\Sales");
+  EXPECT_EQ(DB::databaseFolder(key), "/srv/root/team/sales/");
+  EXPECT_EQ(DB::logFolder(key), "/srv/logs/team/sales/");
+  EXPECT_EQ(DB::tempFolder(key), "/srv/root/db.temp/team/sales/");
+  EXPECT_EQ(DB::mainFile(key), "/srv/root/team/sales/main.edb");
+  EXPECT_EQ(DB::dataFolder(key), "/srv/root/team/sales/d/");
+  EXPECT_EQ(DB::backupFile(key), "/srv/bak/team_sales.cvbak");
+  EXPECT_EQ(DB::databaseFolder("root.db"), "/srv/root/root.db/");
+}
+
+TEST_F(Names, KeysWithEmptyComponentsStayBelowTheRoot) {
+  // Such keys come from refused names only, but a path must never turn
+  // absolute or gain "//" on the way.
+  EXPECT_EQ(DB::databaseFolder("\\sales"), "/srv/root/sales/");
+  EXPECT_EQ(DB::databaseFolder("sales\\"), "/srv/root/sales/");
+  EXPECT_EQ(DB::tempFolder("a\\\\b"), "/srv/root/db.temp/a/b/");
+}
+
+// For any name a client may use, the database's folder lies below DBRoot,
+// is no other database's data folder, and the database found there on disk
+// has the same key again.
+TEST_F(Names, ValidNamesStayInsideTheirOwnFolder) {
+  std::mt19937 random(20240611);
+  const std::string alphabet = "aD./\\\\d..-_x";
+  std::uniform_int_distribution<std::size_t> length(0, 10);
+  std::uniform_int_distribution<std::size_t> pick(0, alphabet.size() - 1);
+  const std::filesystem::path root = DBConfig::inst().DBRoot;
+  int valid = 0;
+  for (int i = 0; i < 20000; ++i) {
+    std::string name;
+    for (std::size_t n = length(random); n > 0; --n) name += alphabet[pick(random)];
+    if (!DB::isValidDatabaseName(name)) continue;
+    ++valid;
+    const std::string key = DB::folderName(name);
+    const std::string folder = DB::databaseFolder(key);
+    ASSERT_EQ(std::filesystem::path(folder).lexically_normal().string(), folder) << name;
+    const std::filesystem::path relative = std::filesystem::path(folder).lexically_relative(root);
+    ASSERT_FALSE(relative.empty()) << name;
+    ASSERT_NE(*relative.begin(), "..") << name;
+    ASSERT_TRUE(DB::isDBFolderName(relative.begin()->string())) << name;
+    for (auto part = std::next(relative.begin()); part != relative.end(); ++part) {
+      ASSERT_NE(*part, "d") << name;
+    }
+    ASSERT_EQ(DB::nameFromRelativeFolder(relative.string()), key) << name;
+  }
+  EXPECT_GT(valid, 1000);
+}
+
+TEST(BackupFileName, EscapesWithTheHyphenAndReadsBack) {
+  const std::vector<std::pair<std::string, std::string>> cases = {
+      {"sales", "sales.cvbak"}, {"a-b", "a--b.cvbak"},      {"a_b", "a-_b.cvbak"},
+      {"a\\b", "a_b.cvbak"},    {"a-\\b", "a--_b.cvbak"},   {"a_\\b", "a-__b.cvbak"},
+      {"x\\d_", "x_d-_.cvbak"}, {"root.db", "root.db.cvbak"},
+  };
+  LogCapture log;
+  for (const auto& [key, file] : cases) {
+    EXPECT_EQ(DB::backupFileName(key), file) << key;
+    EXPECT_EQ(DB::nameFromBackupFile(file), key) << file;
+  }
+  EXPECT_EQ(log.count("Old backup filename"), 0u);
+}
+
+TEST(BackupFileName, RoundTripOverRandomKeys) {
+  std::mt19937 random(77);
+  const std::string alphabet = "--__\\\\ab.d";
+  std::uniform_int_distribution<std::size_t> length(0, 16);
+  std::uniform_int_distribution<std::size_t> pick(0, alphabet.size() - 1);
+  LogCapture log;
+  for (int i = 0; i < 5000; ++i) {
+    std::string key;
+    for (std::size_t n = length(random); n > 0; --n) key += alphabet[pick(random)];
+    const std::string file = DB::backupFileName(key);
+    ASSERT_EQ(file.find('\\'), std::string::npos) << key;
+    ASSERT_EQ(DB::nameFromBackupFile(file), key) << key;
+  }
+  EXPECT_EQ(log.count("Old backup filename"), 0u);
+}
+
+TEST(BackupFileName, ForeignAndOldFileNames) {
+  LogCapture log;
+  EXPECT_EQ(DB::nameFromBackupFile("SALES.CVBAK"), "SALES");
+  EXPECT_EQ(DB::folderName(DB::nameFromBackupFile("SALES.CVBAK")), "sales");
+  EXPECT_EQ(DB::nameFromBackupFile("notes.txt"), "");
+  EXPECT_EQ(DB::nameFromBackupFile("cvbak"), "");
+  EXPECT_EQ(DB::nameFromBackupFile("x.cvbak.tmp"), "");
+  EXPECT_EQ(log.count("Old backup filename"), 0u);
+
+  EXPECT_EQ(DB::nameFromBackupFile("old-name.cvbak"), "old-name");
+  EXPECT_EQ(log.count(Log::Notice, "Old backup filename ('-' not escaped). Ignored"), 1u);
+
+  log.clear();
+  // One line per unescaped hyphen, a trailing one included.
+  EXPECT_EQ(DB::nameFromBackupFile("a-b---.cvbak"), "a-b--");
+  EXPECT_EQ(log.count(Log::Notice, "Old backup filename ('-' not escaped). Ignored"), 2u);
+}
+
+TEST(FolderNames, ServerFoldersAreNoDatabases) {
+  for (const char* name : {"db.backup", "db.temp", ".config"}) EXPECT_FALSE(DB::isDBFolderName(name)) << name;
+  for (const char* name : {"DB.backup", "db.backup2", "sales", "root.db", ".configx"}) {
+    EXPECT_TRUE(DB::isDBFolderName(name)) << name;
+  }
+}
+
+TEST(FolderNames, NameFromRelativeFolder) {
+  EXPECT_EQ(DB::nameFromRelativeFolder("Team/sales/"), "team\\sales");
+  EXPECT_EQ(DB::nameFromRelativeFolder("x/d"), "x\\d_");
+}
+
+}  // namespace
