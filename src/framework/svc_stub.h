@@ -15,11 +15,15 @@
 // connection concerned (or refuse it) and are reported through the IPC error
 // handler; they never affect other connections.
 
+#include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
 
 #include "framework/cmd.h"
+#include "framework/frame.h"
+#include "framework/worker_pool.h"
 
 namespace Ipc {
 
@@ -31,9 +35,23 @@ using IpcErrorHandler = std::function<void(const std::shared_ptr<Socket>&, const
 
 class SvcStub {
  public:
+  // Tuning of the transport; the defaults are the server's.
+  struct Options {
+    // A frame that makes no progress in either direction for this long ends
+    // its connection.
+    std::chrono::milliseconds stallTimeout{wire::kStallTimeoutSeconds * 1000};
+    // How long a closing connection waits for its Bye frame to go out and
+    // for the peer to close before the socket is closed anyway.
+    std::chrono::milliseconds closeGrace{500};
+    // Socket I/O threads; 0 means as many as cores, at least 2.
+    unsigned ioThreads = 0;
+    WorkerPool::Options workers{4, 2048, std::chrono::milliseconds(30000)};
+  };
+
   // port 0 binds a free port (see port()). With forceIp4 false the server
   // listens on IPv6 and IPv4 (a dual-stack socket), else on IPv4 only.
   SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError = {});
+  SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError, Options options);
   ~SvcStub();
   SvcStub(const SvcStub&) = delete;
   SvcStub& operator=(const SvcStub&) = delete;
@@ -46,6 +64,9 @@ class SvcStub {
   bool signalStop();
   // Blocks until the server has stopped after signalStop().
   void waitToFinish();
+
+  // Connections currently open (for diagnostics and tests).
+  std::size_t connectionCount() const;
 
   // Sends the answer of a processed command and lets its connection go on
   // with the next request. For progress commands the answer is their

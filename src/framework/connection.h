@@ -1,0 +1,158 @@
+#pragma once
+// Internal to the transport: one client connection.
+//
+// Reads request frames, turns each into a command through the factory and
+// hands it to a worker (or answers it at once when it has no processor),
+// reading no further request until the command is done; queues outgoing
+// frames and writes them with gather writes; ends itself on malformed or
+// stalled frames, on a processor's request, on the peer's end and when the
+// server stops.
+//
+// Ownership: always owned by shared pointers: the I/O operations in flight,
+// the commands that came from the connection (which may outlive the server,
+// a maintenance thread for example) and, weakly, the server's registry.
+// Thread safety: the Socket members may be called from any thread; they
+// hand their work to the connection's strand, where all of its state lives.
+// After the connection has finished, they do nothing.
+// Failures: problems are reported through the server's error handler and
+// end this connection only; nothing here throws to its caller.
+
+#include <array>
+#include <atomic>
+#include <boost/asio/buffer.hpp>
+#include <boost/asio/io_context.hpp>
+#include <boost/asio/ip/tcp.hpp>
+#include <boost/asio/steady_timer.hpp>
+#include <boost/asio/strand.hpp>
+#include <chrono>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "framework/buffers.h"
+#include "framework/cmd.h"
+
+namespace Ipc::detail {
+
+class ServerCore;
+
+using Strand = boost::asio::strand<boost::asio::io_context::executor_type>;
+using StrandSocket = boost::asio::basic_stream_socket<boost::asio::ip::tcp, Strand>;
+using StrandTimer = boost::asio::basic_waitable_timer<std::chrono::steady_clock,
+                                                      boost::asio::wait_traits<std::chrono::steady_clock>, Strand>;
+
+class Connection final : public Socket, public std::enable_shared_from_this<Connection> {
+ public:
+  // Bytes of answers waiting to be sent above which the connection reads no
+  // further request (a client that does not read its answers is not served
+  // more of them).
+  static constexpr std::uint64_t kOutHighWater = 256 * 1024;
+  // Reading buffer of a connection; frames that fit are read with one call.
+  static constexpr std::size_t kStageSize = 4096;
+  // First allocation for a frame that does not fit; grows as bytes arrive.
+  static constexpr std::size_t kFirstBodyChunk = 64 * 1024;
+
+  Connection(std::shared_ptr<ServerCore> core, StrandSocket socket);
+  ~Connection() override;
+  Connection(const Connection&) = delete;
+  Connection& operator=(const Connection&) = delete;
+
+  // Registers with the server and starts reading; closes the socket when the
+  // server is stopping already.
+  void start();
+
+  void send(wire::OutFrame frame) override;
+  void close(const std::string& reason) override;
+  void commandDone() override;
+  std::string peer() const override { return peer_; }
+  bool isOpen() const override { return open_.load(); }
+
+  // The answer of cmd is under way (SvcStub::onRespReady).
+  void markAnswered(const CmdI* cmd) noexcept;
+  // True while cmd is this open connection's running command and nothing
+  // has answered it.
+  bool unanswered(const CmdI* cmd) const noexcept;
+  // Sends the answer of the running command and lets the connection go on
+  // with the next request (send and commandDone in one step).
+  void respond(wire::OutFrame answer);
+  // Reports the text through the server's error handler and ends the
+  // connection with a Bye frame carrying byeReason.
+  void fail(const std::string& text, const std::string& byeReason);
+
+ private:
+  // Runs f on the strand: at once when already there, else queued. Does
+  // nothing once the connection has finished.
+  template <typename F>
+  void onStrand(F&& f);
+
+  // Strand only, from here on.
+  bool partialFrame() const noexcept { return inBody_ || stageEnd_ > stageBegin_; }
+  bool mayTakeRequest() const noexcept {
+    return !busy_ && !closing_ && !finished_ && outBytes_ <= kOutHighWater;
+  }
+  void endCommand();
+  void goOn();
+  void startRead();
+  void onRead(const boost::system::error_code& ec, std::size_t n);
+  void parse();
+  void handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size);
+  void runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
+  void runOnWorker(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
+  void settleAfterEof();
+
+  void enqueue(wire::OutFrame frame);
+  void startWrite();
+  void onWrite(const boost::system::error_code& ec, std::size_t n);
+
+  void beginClose(const std::string& reason);
+  void startDrain();
+  void finish();
+
+  void armStallTimer();
+  void onStallTimer(const boost::system::error_code& ec);
+
+  const std::shared_ptr<ServerCore> core_;
+  StrandSocket socket_;
+  StrandTimer stallTimer_;
+  StrandTimer closeTimer_;
+  const std::string peer_;
+
+  std::mutex postMutex_;
+  bool accepting_ = true;  // guarded by postMutex_: false once finished
+  std::atomic<bool> open_{true};
+  std::atomic<const CmdI*> inFlight_{nullptr};
+  std::atomic<bool> answered_{false};
+
+  // Reading.
+  std::unique_ptr<unsigned char[]> stage_;
+  std::size_t stageBegin_ = 0;
+  std::size_t stageEnd_ = 0;
+  MemBuffer body_;  // a frame larger than the stage, as far as received
+  std::uint32_t bodyLen_ = 0;
+  std::uint64_t bodyGot_ = 0;
+  bool inBody_ = false;
+
+  // Writing.
+  std::deque<wire::OutFrame> out_;
+  std::uint64_t frontSent_ = 0;  // bytes of out_.front() already written
+  std::uint64_t outBytes_ = 0;   // bytes queued and not yet written
+  std::array<boost::asio::const_buffer, 32> gather_;
+
+  bool reading_ = false;
+  bool writing_ = false;
+  bool busy_ = false;        // a command is running; no further request is read
+  bool peerDone_ = false;    // the peer sent its end (or the socket broke)
+  bool closing_ = false;     // a Bye is queued; nothing else goes out
+  bool byeFlushed_ = false;  // the Bye is written; draining until the peer closes
+  bool finished_ = false;    // the socket is closed
+  bool stallArmed_ = false;
+  std::chrono::steady_clock::time_point readSince_;
+  std::chrono::steady_clock::time_point writeSince_;
+
+  std::weak_ptr<CmdProcessorI> processor_;  // the last processor seen, for onDisconnect
+};
+
+}  // namespace Ipc::detail

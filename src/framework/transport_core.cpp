@@ -1,0 +1,72 @@
+#include "framework/transport_core.h"
+
+#include "framework/log.h"
+
+namespace Ipc::detail {
+
+ServerCore::ServerCore(const SvcStub::Options& opts, CmdFactory f, IpcErrorHandler onError)
+    : options(opts),
+      factory(std::move(f)),
+      workers(opts.workers, [this](const std::string& text) { report(nullptr, text); }),
+      onError_(std::move(onError)) {}
+
+void ServerCore::report(const std::shared_ptr<Socket>& socket, const std::string& text) const noexcept {
+  try {
+    if (onError_) {
+      onError_(socket, text);
+    } else {
+      Log::Lock entry(Log::Warning);
+      entry.logStreamLine() << "Ipc " << text;
+    }
+  } catch (...) {
+    // Reporting is best effort: the connection concerned ends anyway.
+  }
+}
+
+bool ServerCore::add(const std::shared_ptr<Connection>& connection) {
+  std::lock_guard lock(mutex_);
+  if (stopping_) return false;
+  connections_.emplace(connection.get(), connection);
+  return true;
+}
+
+void ServerCore::remove(const Connection* connection) {
+  {
+    std::lock_guard lock(mutex_);
+    if (connections_.erase(connection) == 0) return;
+  }
+  changed_.notify_all();
+}
+
+std::vector<std::shared_ptr<Connection>> ServerCore::beginStop(bool* first) {
+  std::vector<std::shared_ptr<Connection>> open;
+  {
+    std::lock_guard lock(mutex_);
+    *first = !stopping_;
+    if (stopping_) return open;
+    stopping_ = true;
+    open.reserve(connections_.size());
+    for (const auto& [key, weak] : connections_) {
+      if (auto c = weak.lock()) open.push_back(std::move(c));
+    }
+  }
+  changed_.notify_all();
+  return open;
+}
+
+bool ServerCore::stopping() const {
+  std::lock_guard lock(mutex_);
+  return stopping_;
+}
+
+void ServerCore::waitUntilEmpty() {
+  std::unique_lock lock(mutex_);
+  changed_.wait(lock, [this] { return stopping_ && connections_.empty(); });
+}
+
+std::size_t ServerCore::connectionCount() const {
+  std::lock_guard lock(mutex_);
+  return connections_.size();
+}
+
+}  // namespace Ipc::detail

@@ -1,0 +1,62 @@
+#pragma once
+// Internal to the transport: the state that the command server, its
+// connections and its threads share.
+//
+// Ownership: shared by the SvcStub, by every connection and by every I/O
+// thread, so a connection that a command keeps after the server has gone
+// (a maintenance thread) still finds a valid I/O context (where nothing
+// runs any more; its sends are dropped).
+// Thread safety: every member may be called from any thread.
+
+#include <boost/asio/io_context.hpp>
+#include <condition_variable>
+#include <cstddef>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "framework/svc_stub.h"
+#include "framework/worker_pool.h"
+
+namespace Ipc::detail {
+
+class Connection;
+
+class ServerCore {
+ public:
+  ServerCore(const SvcStub::Options& options, CmdFactory factory, IpcErrorHandler onError);
+  ServerCore(const ServerCore&) = delete;
+  ServerCore& operator=(const ServerCore&) = delete;
+
+  boost::asio::io_context io;
+  const SvcStub::Options options;
+  const CmdFactory factory;
+  WorkerPool workers;
+
+  // Hands a problem to the error handler (or logs it when there is none).
+  // Never throws.
+  void report(const std::shared_ptr<Socket>& socket, const std::string& text) const noexcept;
+
+  // Adds an accepted connection; false once the server is stopping.
+  bool add(const std::shared_ptr<Connection>& connection);
+  // Removes a connection whose socket has been closed.
+  void remove(const Connection* connection);
+  // Marks the server as stopping and returns the open connections. Returns
+  // nothing when it was stopping already (then *first is false).
+  std::vector<std::shared_ptr<Connection>> beginStop(bool* first);
+  bool stopping() const;
+  // Blocks until the server is stopping and every connection is removed.
+  void waitUntilEmpty();
+  std::size_t connectionCount() const;
+
+ private:
+  const IpcErrorHandler onError_;
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  std::unordered_map<const Connection*, std::weak_ptr<Connection>> connections_;  // guarded by mutex_
+  bool stopping_ = false;                                                         // guarded by mutex_
+};
+
+}  // namespace Ipc::detail
