@@ -4,24 +4,115 @@
 // server for the answer, and turns a failed handler into a log line and the
 // end of that client's connection.
 //
-// Always owned by a shared pointer (use create()); commands keep it alive.
-// Holds no mutable state of its own and takes no lock: commands of one
-// connection run one after another, so a connection's state is touched by
-// one thread at a time.
+// Always owned by a shared pointer (use createListener); commands keep it
+// alive, and the command server's factory reaches it only through that
+// ownership (once the Listener is no longer owned, the factory throws
+// std::bad_weak_ptr). Holds no mutable state of its own and takes no lock:
+// commands of one connection run one after another, so a connection's
+// state is touched by one thread at a time.
+// Failures: a handler that throws a standard exception ends its connection
+// (see processCmd); nothing a client sends can make the Listener throw.
 
 #include <cstdint>
+#include <functional>
 #include <memory>
+#include <string>
 
 #include "framework/svc_stub.h"
+#include "protocol/commands.h"
+#include "protocol/processor.h"
 
 namespace Ipc::DB {
 
-class Listener;  // completed by the command-processing layer
+class Listener final : public CmdProcessorDBI {
+ public:
+  // The database binding of one connection, kept in the connection's
+  // connInf slot. Created by Connect; destroyed with the connection or when
+  // a Connect for another database replaces it. It will own the
+  // connection's store object (its member db).
+  class ConnDB : public Ipc::ConnInf {
+   public:
+    ~ConnDB() override;
+  };
+
+  // Where a processed command goes for its answer: the command server's
+  // onRespReady.
+  using Responder = std::function<void(const std::shared_ptr<Ipc::CmdI>&)>;
+
+  // For tests: a Listener without a command server whose processed commands
+  // go to respond instead.
+  static std::shared_ptr<Listener> createDetached(Responder respond);
+
+  ~Listener() override;
+  Listener(const Listener&) = delete;
+  Listener& operator=(const Listener&) = delete;
+
+  // A new command for the tag, built with this Listener as its processor
+  // (PingPong without one); null, and the line "Ipc attempt to generate
+  // command with unknown tag: " + the tag byte (priority 3), for any tag
+  // that is not a command.
+  std::shared_ptr<Ipc::CmdI> makeCmd(std::uint8_t tag);
+
+  // Runs the command's handler and hands the command to the command server
+  // for its answer. A standard exception is logged as "Dispatching command "
+  // + name + " failed with " + what() (priority 3) and ends the connection
+  // with "Terminating client connection due to processing error"; no answer
+  // is sent. Other exceptions propagate.
+  void processCmd(std::shared_ptr<Ipc::CmdI> cmd) override;
+
+  // Logs "Ipc " + text (priority 4).
+  void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
+
+  // The database binding of the command's connection; throws
+  // std::runtime_error "No database associated with current connection.
+  // Connect command failed?" when the connection has none.
+  static ConnDB& dbOfConn(const Ipc::CmdI& cmd);
+
+  // Handlers, grouped as their source files are: maintenance, packs,
+  // configuration and data.
+  void process(DBNames& cmd) override;
+  void process(Cleanup& cmd) override;
+  void process(Restore& cmd) override;
+  void process(Backup& cmd) override;
+  void process(ErasePack& cmd) override;
+  void process(GetPack& cmd) override;
+  void process(ChangeDocId& cmd) override;
+  void process(SavePack& cmd) override;
+  void process(UpdatePackInfo& cmd) override;
+  void process(GetPackInfo& cmd) override;
+  void process(GetPackInfos& cmd) override;
+  void process(SetData& cmd) override;
+  void process(GetData& cmd) override;
+  void process(CfgIds& cmd) override;
+  void process(SetCfgPart& cmd) override;
+  void process(GetCfgPart& cmd) override;
+  void process(Connect& cmd) override;
+
+ private:
+  // Only the Listener's own factories can build one (make_shared needs a
+  // public constructor).
+  class Passkey {
+    explicit Passkey() = default;
+    friend class Listener;
+    friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+  };
+
+ public:
+  Listener(Passkey, Responder respond);
+
+ private:
+  friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+  friend Ipc::SvcStub& serverOf(Listener& listener);
+
+  Responder respond_;
+  std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
+};
 
 // Builds the Listener and its command server on the port (0: any free
 // port); throws std::runtime_error when the port cannot be bound.
 std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
-// The Listener's command server.
+// The Listener's command server; throws std::logic_error for a detached
+// Listener.
 Ipc::SvcStub& serverOf(Listener& listener);
 
 }  // namespace Ipc::DB

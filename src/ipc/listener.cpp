@@ -1,0 +1,56 @@
+#include "ipc/listener.h"
+
+#include <stdexcept>
+
+#include "framework/log.h"
+
+namespace Ipc::DB {
+
+Listener::ConnDB::~ConnDB() = default;
+
+Listener::Listener(Passkey, Responder respond) : respond_(std::move(respond)) {}
+
+Listener::~Listener() = default;
+
+std::shared_ptr<Listener> Listener::createDetached(Responder respond) {
+  return std::make_shared<Listener>(Passkey(), std::move(respond));
+}
+
+std::shared_ptr<Ipc::CmdI> Listener::makeCmd(std::uint8_t tag) {
+  // The commands share ownership of this Listener; shared_from_this throws
+  // bad_weak_ptr once nobody owns it any more.
+  auto self = std::static_pointer_cast<Listener>(shared_from_this());
+  auto cmd = makeCommand(tag, std::move(self));
+  if (!cmd) {
+    Log::Lock entry(Log::Error);
+    entry.logStreamLine() << "Ipc attempt to generate command with unknown tag: " << static_cast<char>(tag);
+  }
+  return cmd;
+}
+
+void Listener::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
+  try {
+    cmd->accept(*this);
+    respond_(cmd);
+  } catch (const std::exception& e) {
+    {
+      Log::Lock entry(Log::Error);
+      entry.logStreamLine() << "Dispatching command " << cmd->name() << " failed with " << e.what();
+    }
+    cmd->onTransferError("Terminating client connection due to processing error");
+  }
+}
+
+void Listener::onIpcError(const std::shared_ptr<Ipc::Socket>&, const std::string& text) {
+  Log::Lock entry(Log::Warning);
+  entry.logStreamLine() << "Ipc " << text;
+}
+
+Listener::ConnDB& Listener::dbOfConn(const Ipc::CmdI& cmd) {
+  if (const auto& socket = cmd.socket()) {
+    if (auto* conn = dynamic_cast<ConnDB*>(socket->connInf().get())) return *conn;
+  }
+  throw std::runtime_error("No database associated with current connection. Connect command failed?");
+}
+
+}  // namespace Ipc::DB

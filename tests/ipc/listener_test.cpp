@@ -1,0 +1,160 @@
+// The Listener's factory, its dispatch and failure path, and the handlers
+// that need no store, on connections without a network.
+
+#include "ipc/listener.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+
+#include "protocol/fake_socket.h"
+#include "service/config.h"
+#include "support/log_capture.h"
+#include "support/temp_dir.h"
+
+namespace {
+
+using namespace Ipc::DB;
+using testing_support::FakeSocket;
+using testing_support::LogCapture;
+
+constexpr const char* kNoDatabase = "No database associated with current connection. Connect command failed?";
+constexpr const char* kTerminating = "Terminating client connection due to processing error";
+
+struct Fixture : ::testing::Test {
+  std::vector<std::shared_ptr<Ipc::CmdI>> answered;
+  std::shared_ptr<Listener> listener =
+      Listener::createDetached([this](const std::shared_ptr<Ipc::CmdI>& cmd) { answered.push_back(cmd); });
+  std::shared_ptr<FakeSocket> socket = std::make_shared<FakeSocket>();
+  LogCapture log;
+
+  std::shared_ptr<Ipc::CmdI> received(std::uint8_t tag) {
+    auto cmd = listener->makeCmd(tag);
+    if (cmd) cmd->attachSocket(socket);
+    return cmd;
+  }
+};
+
+using ListenerTest = Fixture;
+
+TEST_F(ListenerTest, UnknownTagsLogTheTagAsACharacterAndBuildNothing) {
+  for (const int tag : {0, 2, 20, 65, 255}) {
+    log.clear();
+    EXPECT_EQ(listener->makeCmd(static_cast<std::uint8_t>(tag)), nullptr) << tag;
+    const std::string line = std::string("Ipc attempt to generate command with unknown tag: ") + static_cast<char>(tag);
+    const auto entries = log.entries();
+    ASSERT_EQ(entries.size(), 1u) << tag;
+    EXPECT_EQ(entries[0].priority, Log::Error);
+    EXPECT_EQ(entries[0].text.substr(entries[0].text.size() - line.size()), line);
+  }
+}
+
+TEST_F(ListenerTest, KnownTagsBuildCommandsThatShareTheListener) {
+  for (const CmdEntry& e : kCommandTable) {
+    auto cmd = listener->makeCmd(e.tag);
+    ASSERT_NE(cmd, nullptr) << e.name;
+    EXPECT_EQ(cmd->name(), e.name);
+    if (e.tag == Ipc::PingPong::kTag) {
+      EXPECT_EQ(cmd->processor(), nullptr);
+    } else {
+      EXPECT_EQ(cmd->processor(), listener);
+    }
+  }
+  EXPECT_EQ(log.count("unknown tag"), 0u);
+}
+
+TEST_F(ListenerTest, CommandsThatNeedADatabaseEndTheirConnectionBeforeAnyConnect) {
+  for (const std::uint8_t tag : {4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15}) {
+    socket = std::make_shared<FakeSocket>();
+    log.clear();
+    auto cmd = received(tag);
+    listener->processCmd(cmd);
+    EXPECT_TRUE(log.contains(Log::Error, "Dispatching command " + cmd->name() + " failed with " + kNoDatabase))
+        << cmd->name();
+    EXPECT_FALSE(socket->isOpen());
+    EXPECT_EQ(socket->closeReason(), kTerminating);
+    EXPECT_TRUE(socket->frames().empty());
+  }
+  EXPECT_TRUE(answered.empty());
+}
+
+TEST_F(ListenerTest, OnlyTheListenersOwnBindingCountsAsADatabase) {
+  struct Foreign : Ipc::ConnInf {};
+  auto cmd = received(GetData::kTag);
+  EXPECT_THROW(Listener::dbOfConn(*cmd), std::runtime_error);
+  socket->connInf() = std::make_unique<Foreign>();
+  try {
+    Listener::dbOfConn(*cmd);
+    FAIL() << "a foreign record was taken for a database binding";
+  } catch (const std::runtime_error& e) {
+    EXPECT_STREQ(e.what(), kNoDatabase);
+  }
+  auto binding = std::make_unique<Listener::ConnDB>();
+  Listener::ConnDB* raw = binding.get();
+  socket->connInf() = std::move(binding);
+  EXPECT_EQ(&Listener::dbOfConn(*cmd), raw);
+
+  GetData unattached;
+  EXPECT_THROW(Listener::dbOfConn(unattached), std::runtime_error);
+}
+
+TEST_F(ListenerTest, AFailureWhileAnsweringEndsTheConnectionAndOtherExceptionsPropagate) {
+  // A handler that succeeds (DBNames over an empty root) but whose answer
+  // cannot be handed on.
+  testing_support::TempDir root;
+  DBConfig config;
+  config.DBRoot = (root / "none").string() + "/";
+  DBConfig::TestOverride override(config);
+
+  auto failing = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw std::runtime_error("send"); });
+  auto cmd = failing->makeCmd(DBNames::kTag);
+  cmd->attachSocket(socket);
+  failing->processCmd(cmd);
+  EXPECT_TRUE(log.contains(Log::Error, "Dispatching command DBNames failed with send"));
+  EXPECT_EQ(socket->closeReason(), kTerminating);
+
+  auto odd = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw 42; });
+  cmd = odd->makeCmd(DBNames::kTag);
+  EXPECT_THROW(odd->processCmd(cmd), int);
+}
+
+TEST_F(ListenerTest, IpcErrorsAreLoggedAsWarnings) {
+  listener->onIpcError(socket, "Malformed frame from 127.0.0.1:1");
+  EXPECT_TRUE(log.contains(Log::Warning, "Ipc Malformed frame from 127.0.0.1:1"));
+  EXPECT_TRUE(socket->isOpen());
+}
+
+TEST_F(ListenerTest, DBNamesListsEveryDatabaseBelowTheRootButNotTheServersOwnFolders) {
+  testing_support::TempDir root;
+  const auto db = [&](const std::string& rel) { testing_support::writeFile(root / rel / "cvdb.edb", "x"); };
+  db("plant");
+  db("plant/line2");
+  db("other/deep/er");
+  db("db.backup/old");
+  db("db.temp/work");
+  testing_support::writeFile(root / "notes" / "cvdb.edb.bak", "x");
+  testing_support::writeFile(root / "cvdb.edb", "x");  // not inside a folder below the root
+  DBConfig config;
+  config.DBRoot = root.path().string() + "/";
+  DBConfig::TestOverride override(config);
+
+  auto cmd = received(DBNames::kTag);
+  listener->processCmd(cmd);
+  ASSERT_EQ(answered.size(), 1u);
+  auto names = std::static_pointer_cast<DBNames>(answered[0])->respList();
+  std::sort(names.begin(), names.end());
+  EXPECT_EQ(names, (std::vector<std::string>{"other\\deep\\er", "plant", "plant\\line2"}));
+  EXPECT_TRUE(socket->isOpen());
+}
+
+TEST_F(ListenerTest, DBNamesOnAServerWithoutDatabasesIsAnEmptyList) {
+  testing_support::TempDir root;
+  DBConfig config;
+  config.DBRoot = (root / "not-created-yet").string() + "/";
+  DBConfig::TestOverride override(config);
+  listener->processCmd(received(DBNames::kTag));
+  ASSERT_EQ(answered.size(), 1u);
+  EXPECT_TRUE(std::static_pointer_cast<DBNames>(answered[0])->respList().empty());
+}
+
+}  // namespace
