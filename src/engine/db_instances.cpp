@@ -1,0 +1,327 @@
+#include "engine/db_instances.h"
+
+#include <atomic>
+#include <mutex>
+
+#include "engine/db_exc.h"
+#include "engine/engine_errors.h"
+#include "engine/open_files.h"
+#include "framework/log.h"
+#include "service/config.h"
+#include "service/names.h"
+
+namespace DB {
+namespace {
+
+// How long a writer waits for a database's write lock.
+constexpr std::chrono::milliseconds kBusyTimeout{10000};
+
+constexpr const char* kNotAccessible = "Database not accessible! Possible restore operation in progress.";
+
+std::mutex& poolMutex() {
+  static std::mutex mutex;
+  return mutex;
+}
+
+std::atomic<std::shared_ptr<DBInstances>>& singleton() {
+  static std::atomic<std::shared_ptr<DBInstances>> pool;
+  return pool;
+}
+
+void logEngineStart(const DBConfig& config, const engine::OpenFileLimit& files) {
+  if (g_LogVerbose) {
+    Log::Lock entry(Log::Debug);
+    entry.logStreamLine() << "DBInstances: Engine initialized\n"
+                          << "\t\"" << config.DBRoot << "\" is the databases root\n"
+                          << "\t" << config.MaxActiveDBs << " maximum active databases\n"
+                          << "\t" << config.MaxActiveClientsPerDB << " maximum active clients per database\n"
+                          << "\t\"" << config.DBFilesPrefix << "\" database file names prefix\n"
+                          << "\t\"" << config.DBFileName << "\" database file name\n";
+  }
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DBInstances: the database file names prefix, circular logging, the version store size and the place "
+           "of transaction logs have no effect on this engine: each database's write-ahead log lives beside its "
+           "database file";
+  }
+  const std::uint64_t needed = 2 * config.MaxActiveDBs * config.MaxActiveClientsPerDB;
+  if (files.after < needed) {
+    Log::Lock(Log::Warning).logStreamLine()
+        << "DBInstances: the open-file limit is " << files.after << " (hard limit " << files.hard << "), but "
+        << config.MaxActiveDBs << " databases with " << config.MaxActiveClientsPerDB
+        << " clients each may need " << needed << " file descriptors";
+  }
+}
+
+}  // namespace
+
+std::shared_ptr<DBInstances> DBInstances::inst() {
+  if (auto pool = singleton().load()) return pool;
+  std::lock_guard lock(poolMutex());
+  if (auto pool = singleton().load()) return pool;
+  auto pool = std::make_shared<DBInstances>(Token{});
+  singleton().store(pool);
+  const auto& config = DBConfig::inst();
+  engine::setMaxInstances(config.MaxActiveDBs);
+  logEngineStart(config, engine::raiseOpenFileLimit());
+  return pool;
+}
+
+std::shared_ptr<DBInstances> DBInstances::existing() noexcept { return singleton().load(); }
+
+void DBInstances::teardown() noexcept {
+  std::shared_ptr<DBInstances> old;
+  {
+    std::lock_guard lock(poolMutex());
+    old = singleton().exchange(nullptr);
+    if (old) old->stopEngine(true);
+  }
+  // old goes here, or with the last maintenance hold that still holds it.
+}
+
+DBInstances::DBInstances(Token) {}
+
+DBInstances::~DBInstances() {
+  // Reached at process exit when the service did not tear the pool down;
+  // the logging may already be gone then, so this stops quietly.
+  if (!stopped_) stopEngine(false);
+}
+
+std::shared_ptr<engine::Instance> DBInstances::createInstance(const std::string& dbKey) {
+  const auto& config = DBConfig::inst();
+  engine::InstanceSettings settings;
+  settings.key = dbKey;
+  settings.instanceFolder = databaseFolder(dbKey);
+  settings.logFolder = logFolder(dbKey);
+  settings.databaseFileName = config.DBFileName;
+  settings.maxSessions = config.MaxActiveClientsPerDB;
+  settings.busyTimeout = kBusyTimeout;
+  auto instance = engine::Instance::create(std::move(settings));
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Instance I:" << instance->id() << " created for "
+                                          << databaseFolder(dbKey);
+  }
+  return instance;
+}
+
+void DBInstances::closeInstance(InstanceRec& record) noexcept {
+  if (!record.instance) return;
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: closing instance for I:" << record.instance->id();
+  }
+  record.instance->term();
+  record.instance.reset();
+}
+
+std::unique_ptr<engine::Session> DBInstances::beginSession(InstanceRec& record) {
+  if (!record.instance) throw DBExc(kNotAccessible);
+  std::unique_ptr<engine::Session> session;
+  try {
+    session = record.instance->beginSession();
+  } catch (const DBExc& e) {
+    if (e.code() == err::kNotInitialized) throw DBExc(kNotAccessible);
+    throw;
+  }
+  ++record.sessions;
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: New session S:" << session->id() << " created for I:"
+                                          << record.instance->id() << ". " << record.sessions
+                                          << " instance session(s)";
+  }
+  return session;
+}
+
+std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKey,
+                                                         const OnNewInstance& onNewInstance) {
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: New database connection request for " << dbKey;
+  }
+  std::size_t records = 0;
+  {
+    std::lock_guard lock(poolMutex());
+    if (stopped_) throwEngineError(err::kTermInProgress);
+    if (const auto found = records_.find(dbKey); found != records_.end()) return beginSession(found->second);
+    records = records_.size();
+  }
+  if ((DBConfig::inst().MaxActiveDBs * 2) / 3 <= records) closeDormantInstances();
+
+  std::lock_guard lock(poolMutex());
+  if (stopped_) throwEngineError(err::kTermInProgress);
+  if (const auto found = records_.find(dbKey); found != records_.end()) return beginSession(found->second);
+
+  auto instance = createInstance(dbKey);
+  try {
+    instance->init();
+  } catch (...) {
+    instance->term();
+    throw;
+  }
+  auto& record = records_[dbKey];
+  record.instance = instance;
+  std::unique_ptr<engine::Session> session;
+  try {
+    session = beginSession(record);
+    onNewInstance(*session);
+  } catch (...) {
+    // No session stays counted and no half-opened instance stays behind;
+    // a creation failure has dropped the record already (discardInstance).
+    session.reset();
+    const auto found = records_.find(dbKey);
+    if (found != records_.end() && found->second.instance == instance) {
+      closeInstance(found->second);
+      records_.erase(found);
+    }
+    instance->term();
+    throw;
+  }
+  const auto found = records_.find(dbKey);
+  if (found == records_.end() || found->second.instance != instance) {
+    // onNewInstance discarded the instance without reporting a failure.
+    throwEngineError(err::kDatabaseNotFound);
+  }
+  return session;
+}
+
+void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept {
+  if (!session) return;
+  const auto sessionId = session->id();
+  const auto instance = session->instance();
+  // The connection closes before the session is uncounted: until then no
+  // exclusive hold can take the database, so a restore never replaces the
+  // file under a connection that is still closing.
+  session.reset();
+
+  std::lock_guard lock(poolMutex());
+  const auto found = records_.find(dbKey);
+  if (stopped_ || found == records_.end() || found->second.instance != instance || found->second.sessions == 0) {
+    Log::Lock(Log::Error).logStreamLine() << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId
+                                          << " released for unknown instance!!!";
+    return;
+  }
+  auto& record = found->second;
+  --record.sessions;
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId
+                                          << " released for I:" << record.instance->id() << ". " << record.sessions
+                                          << " instance session(s) remaining";
+  }
+}
+
+bool DBInstances::closeIfDormant(const std::string& dbKey) noexcept {
+  std::lock_guard lock(poolMutex());
+  const auto found = records_.find(dbKey);
+  if (found == records_.end()) return true;
+  if (found->second.sessions > 0 || found->second.maintenance) return false;
+  closeInstance(found->second);
+  records_.erase(found);
+  return true;
+}
+
+void DBInstances::closeDormantInstances() noexcept {
+  std::lock_guard lock(poolMutex());
+  for (auto it = records_.begin(); it != records_.end();) {
+    if (it->second.sessions == 0 && !it->second.maintenance) {
+      if (g_LogVerbose && it->second.instance) {
+        Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Closing dormant instance I:"
+                                              << it->second.instance->id();
+      }
+      closeInstance(it->second);
+      it = records_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+}
+
+void DBInstances::discardInstance(const std::string& dbKey, engine::Session& session) noexcept {
+  session.detachAll();
+  const auto found = records_.find(dbKey);
+  if (found == records_.end() || found->second.instance != session.instance()) return;
+  closeInstance(found->second);
+  records_.erase(found);
+}
+
+std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& dbKey, bool set) {
+  std::lock_guard lock(poolMutex());
+  if (stopped_) {
+    if (set) throwEngineError(err::kTermInProgress);
+    return nullptr;
+  }
+  const auto found = records_.find(dbKey);
+  if (found == records_.end()) throw DBExc("No instance exist for " + dbKey);
+  if (set && found->second.maintenance) return nullptr;
+  found->second.maintenance = set;
+  return found->second.instance;
+}
+
+std::shared_ptr<engine::Instance> DBInstances::acquireExclusive(const std::string& dbKey, bool set) {
+  std::lock_guard lock(poolMutex());
+  if (stopped_) {
+    if (set) throwEngineError(err::kTermInProgress);
+    return nullptr;
+  }
+  auto found = records_.find(dbKey);
+  if (found == records_.end()) {
+    if (!set) return nullptr;
+    found = records_.emplace(dbKey, InstanceRec{}).first;
+  } else {
+    if (found->second.sessions > 0) return nullptr;
+    // Another hold on the database (a backup, a cleanup or a second
+    // restore) must end first: two restores of one database, or a restore
+    // under a running backup, would work on the same files.
+    if (set && found->second.maintenance) return nullptr;
+    closeInstance(found->second);
+  }
+  if (!set) {
+    records_.erase(found);
+    return nullptr;
+  }
+  try {
+    found->second.maintenance = true;
+    found->second.instance = createInstance(dbKey);
+  } catch (...) {
+    records_.erase(found);
+    throw;
+  }
+  return found->second.instance;
+}
+
+bool DBInstances::waitTick(std::chrono::milliseconds tick) {
+  std::unique_lock lock(poolMutex());
+  return !stopSignal_.wait_for(lock, tick, [this] { return stopped_; });
+}
+
+void DBInstances::stopEngine(bool log) noexcept {
+  if (log && g_LogVerbose) Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Stopping engine gracefully";
+  for (auto& [key, record] : records_) {
+    if (log) {
+      closeInstance(record);
+    } else if (record.instance) {
+      record.instance->term();
+    }
+  }
+  records_.clear();
+  stopped_ = true;
+  stopSignal_.notify_all();
+}
+
+std::optional<DBInstances::RecordView> DBInstances::record(const std::string& dbKey) const {
+  std::lock_guard lock(poolMutex());
+  const auto found = records_.find(dbKey);
+  if (found == records_.end()) return std::nullopt;
+  RecordView view;
+  if (found->second.instance) {
+    view.instanceId = found->second.instance->id();
+    view.initialised = found->second.instance->state() == engine::Instance::State::Initialised;
+  }
+  view.sessions = found->second.sessions;
+  view.maintenance = found->second.maintenance;
+  return view;
+}
+
+std::size_t DBInstances::recordCount() const {
+  std::lock_guard lock(poolMutex());
+  return records_.size();
+}
+
+}  // namespace DB

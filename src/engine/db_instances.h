@@ -1,0 +1,136 @@
+#pragma once
+// DB::DBInstances: the process-wide pool of engine instances, one per open
+// database, with their sessions and maintenance holds.
+//
+// The first session asked for a database creates and initialises its
+// instance and runs the caller's onNewInstance with that session (the store
+// attaches or creates the database there); later sessions only begin on the
+// instance. Instances stay open after their last session, so that a client
+// that comes back pays nothing; dormant instances (no session, no hold) are
+// closed all at once when the pool reaches two thirds of MaxActiveDBs, or on
+// request (closeIfDormant). The limits are the engine's: MaxActiveDBs live
+// instances (kTooManyInstances beyond), MaxActiveClientsPerDB sessions per
+// instance (kOutOfSessions beyond).
+//
+// Maintenance holds (InstanceForMaintenance, instance_for_maintenance.h)
+// take a database out of ordinary use: a shared hold works on the open
+// instance beside its clients (backup, cleanup); an exclusive hold needs
+// every session gone and replaces the instance by an uninitialised one, on
+// which no session can begin (restore). Only one hold of either kind is set
+// on a database at a time.
+//
+// Record states: absent; open (initialised instance, no hold); shared hold
+// (initialised, held); exclusive hold (uninitialised, held).
+//
+// Ownership: the pool is held by shared pointers: the process-wide one
+// (inst(), released by teardown()) and those of running maintenance holds,
+// so a hold that ends after the teardown finds valid memory. Sessions are
+// owned by their callers and handed back through endSession.
+// Thread safety: one mutex, the pool mutex, guards the singleton pointer and
+// every record; it is held while instances are created, initialised and
+// terminated, while sessions begin and end, and while onNewInstance runs
+// (which therefore must not call the pool, discardInstance excepted).
+// Failures: DB::DBExc (engine codes, or the texts documented per member).
+
+#include <condition_variable>
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+
+#include "engine/instance.h"
+#include "engine/session.h"
+
+namespace DB {
+
+class InstanceForMaintenance;
+
+class DBInstances {
+  struct Token {};
+
+ public:
+  // Runs with the first session of a newly created instance, under the pool
+  // mutex.
+  using OnNewInstance = std::function<void(engine::Session&)>;
+
+  // A view of one record, for diagnostics and tests.
+  struct RecordView {
+    std::uint64_t instanceId = 0;  // 0: no instance
+    bool initialised = false;
+    std::uint64_t sessions = 0;
+    bool maintenance = false;
+  };
+
+  // The pool, created on first use with the process-wide engine settings
+  // (instance limit from MaxActiveDBs, the open-file limit raised).
+  static std::shared_ptr<DBInstances> inst();
+  // The pool if one exists, else null; never creates one (for late callers
+  // such as a connection that closes after the service stopped).
+  static std::shared_ptr<DBInstances> existing() noexcept;
+  // The service's stop: under the pool mutex the singleton is taken away
+  // and its engine stopped (every instance terminated, waiting holds
+  // interrupted). A later inst() creates a new pool. Never throws.
+  static void teardown() noexcept;
+
+  DBInstances(Token);
+  ~DBInstances();
+  DBInstances(const DBInstances&) = delete;
+  DBInstances& operator=(const DBInstances&) = delete;
+
+  // A new session on the database's instance, creating and initialising the
+  // instance first when the database has none. Throws "Database not
+  // accessible! Possible restore operation in progress." while an exclusive
+  // hold is set, kOutOfSessions / kTooManyInstances at the limits, and
+  // whatever onNewInstance throws; then no session stays counted and an
+  // instance made for the call is dropped.
+  std::unique_ptr<engine::Session> newSession(const std::string& dbKey, const OnNewInstance& onNewInstance);
+
+  // Ends a session that newSession handed out. A session whose database or
+  // instance the pool no longer knows is logged as released for an unknown
+  // instance, and ended all the same. Never throws.
+  void endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept;
+
+  // True when the database has no instance afterwards: it had none, or it
+  // had one without sessions and holds, which is closed now.
+  bool closeIfDormant(const std::string& dbKey) noexcept;
+
+  // For a database creation that failed inside onNewInstance: detaches and
+  // closes the session's database, uncounts the session and terminates and
+  // forgets the instance. Takes no mutex: it runs while newSession holds it
+  // on the same thread. The session object itself is destroyed by
+  // newSession's caller path as the failure passes on.
+  void discardInstance(const std::string& dbKey, engine::Session& session) noexcept;
+
+  std::optional<RecordView> record(const std::string& dbKey) const;
+  std::size_t recordCount() const;
+
+ private:
+  friend class InstanceForMaintenance;
+
+  struct InstanceRec {
+    std::shared_ptr<engine::Instance> instance;  // null once terminated
+    std::uint64_t sessions = 0;
+    bool maintenance = false;
+  };
+
+  std::shared_ptr<engine::Instance> createInstance(const std::string& dbKey);
+  void closeInstance(InstanceRec& record) noexcept;
+  void closeDormantInstances() noexcept;
+  std::unique_ptr<engine::Session> beginSession(InstanceRec& record);
+  // Both return null when the hold cannot be taken now (busy).
+  std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set);
+  std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set);
+  // Sleeps one tick of a maintenance wait; false when the pool stopped
+  // meanwhile.
+  bool waitTick(std::chrono::milliseconds tick);
+  void stopEngine(bool log) noexcept;
+
+  std::unordered_map<std::string, InstanceRec> records_;  // guarded by the pool mutex
+  bool stopped_ = false;                                   // guarded by the pool mutex
+  std::condition_variable stopSignal_;                     // with the pool mutex
+};
+
+}  // namespace DB

@@ -1,0 +1,120 @@
+#include "engine/instance.h"
+
+#include <atomic>
+
+#include "engine/database_file.h"
+#include "engine/db_exc.h"
+#include "engine/engine_errors.h"
+#include "engine/session.h"
+
+namespace engine {
+namespace {
+
+std::atomic<std::uint64_t> g_nextInstanceId{1};
+std::atomic<std::uint64_t> g_maxInstances{100};
+std::atomic<std::uint64_t> g_liveInstances{0};
+
+// Takes one process-wide instance slot, or returns false at the limit.
+bool takeInstanceSlot() noexcept {
+  auto live = g_liveInstances.load();
+  do {
+    if (live >= g_maxInstances.load()) return false;
+  } while (!g_liveInstances.compare_exchange_weak(live, live + 1));
+  return true;
+}
+
+}  // namespace
+
+void setMaxInstances(std::uint64_t limit) noexcept { g_maxInstances = limit; }
+
+std::uint64_t liveInstances() noexcept { return g_liveInstances.load(); }
+
+std::shared_ptr<Instance> Instance::create(InstanceSettings settings, const std::source_location& where) {
+  if (!takeInstanceSlot()) DB::throwEngineError(DB::err::kTooManyInstances, where);
+  try {
+    return std::make_shared<Instance>(Token{}, std::move(settings));
+  } catch (...) {
+    --g_liveInstances;
+    throw;
+  }
+}
+
+Instance::Instance(Token, InstanceSettings settings) : id_(g_nextInstanceId++), settings_(std::move(settings)) {}
+
+Instance::~Instance() { term(); }
+
+Instance::State Instance::state() const {
+  std::lock_guard lock(mutex_);
+  return state_;
+}
+
+void Instance::init(const std::source_location& where) {
+  std::lock_guard lock(mutex_);
+  if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
+  if (state_ == State::Initialised) return;
+  for (const auto& folder : {settings_.instanceFolder, settings_.logFolder}) {
+    std::error_code ec;
+    std::filesystem::create_directories(folder, ec);
+    if (ec) DB::throwEngineError(engineCodeOfErrno(ec.value()), where);
+  }
+  state_ = State::Initialised;
+}
+
+void Instance::term() noexcept {
+  std::lock_guard lock(mutex_);
+  if (state_ == State::Terminated) return;
+  state_ = State::Terminated;
+  attached_.reset();
+  --g_liveInstances;
+}
+
+std::unique_ptr<Session> Instance::beginSession(const std::source_location& where) {
+  auto self = shared_from_this();
+  {
+    std::lock_guard lock(mutex_);
+    if (state_ == State::Created) DB::throwEngineError(DB::err::kNotInitialized, where);
+    if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
+    if (sessions_ >= settings_.maxSessions) DB::throwEngineError(DB::err::kOutOfSessions, where);
+    ++sessions_;
+  }
+  try {
+    return std::make_unique<Session>(Session::Token{}, std::move(self));
+  } catch (...) {
+    sessionEnded();
+    throw;
+  }
+}
+
+std::uint64_t Instance::openSessions() const {
+  std::lock_guard lock(mutex_);
+  return sessions_;
+}
+
+std::optional<std::filesystem::path> Instance::attachedDatabase() const {
+  std::lock_guard lock(mutex_);
+  return attached_;
+}
+
+void Instance::sessionEnded() noexcept {
+  std::lock_guard lock(mutex_);
+  if (sessions_ > 0) --sessions_;
+}
+
+std::int32_t Instance::attach(const std::filesystem::path& file, const std::source_location& where) {
+  std::lock_guard lock(mutex_);
+  if (state_ == State::Created) DB::throwEngineError(DB::err::kNotInitialized, where);
+  if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
+  if (attached_) {
+    if (*attached_ == file) return DB::err::kWrnDatabaseAttached;
+    DB::throwEngineError(DB::err::kTooManyAttachedDatabases, where);
+  }
+  attached_ = file;
+  return DB::err::kSuccess;
+}
+
+void Instance::detach() noexcept {
+  std::lock_guard lock(mutex_);
+  attached_.reset();
+}
+
+}  // namespace engine

@@ -1,0 +1,110 @@
+#pragma once
+// engine::Instance: the engine instance of one database.
+//
+// An instance knows its folders (the database folder, where the database
+// file and its write-ahead log live, and the log folder of the database,
+// which this engine only creates), its session limit, and the one database
+// file attached to it. It is created uninitialised; init() creates its
+// folders and lets sessions begin. A restore works on an uninitialised
+// instance, so no session can open the database meanwhile.
+//
+// Process-wide, the number of live (not terminated) instances is limited by
+// setMaxInstances(); creating one more fails with kTooManyInstances.
+//
+// Ownership: shared. The pool holds an instance in its record, and every
+// session holds it too, so a session that ends after its instance was
+// terminated still finds valid memory.
+// Thread safety: every member may be called from any thread.
+// Failures: DB::DBExc with an engine code (engine_errors.h).
+
+#include <chrono>
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <source_location>
+#include <string>
+
+namespace engine {
+
+class Session;
+
+struct InstanceSettings {
+  std::string key;                       // the database key, for log texts
+  std::filesystem::path instanceFolder;  // the database folder
+  std::filesystem::path logFolder;       // the database's log folder
+  std::string databaseFileName;          // the database file's name in the backup folder of a restore
+  std::uint64_t maxSessions = 100;       // sessions open at once on the instance
+  // How long a writer waits for the database's write lock (in-process and
+  // SQLite's) before the attempt counts as a write conflict.
+  std::chrono::milliseconds busyTimeout{10000};
+};
+
+// The process-wide instance limit (default 100).
+void setMaxInstances(std::uint64_t limit) noexcept;
+std::uint64_t liveInstances() noexcept;
+
+class Instance : public std::enable_shared_from_this<Instance> {
+  struct Token {};
+
+ public:
+  enum class State { Created, Initialised, Terminated };
+
+  // A new, uninitialised instance. Throws kTooManyInstances when the
+  // process already has the maximum of live instances.
+  static std::shared_ptr<Instance> create(InstanceSettings settings,
+                                          const std::source_location& where = std::source_location::current());
+
+  Instance(Token, InstanceSettings settings);
+  ~Instance();
+  Instance(const Instance&) = delete;
+  Instance& operator=(const Instance&) = delete;
+
+  // Process-wide number, from 1, for the "I:" of log texts.
+  std::uint64_t id() const noexcept { return id_; }
+  const InstanceSettings& settings() const noexcept { return settings_; }
+  State state() const;
+
+  // Creates the instance and log folders with missing parents and lets
+  // sessions begin. Throws kFileAccessDenied or kDiskIO when a folder cannot
+  // be made (the instance stays uninitialised), kTermInProgress when the
+  // instance was terminated. Initialising twice does nothing.
+  void init(const std::source_location& where = std::source_location::current());
+
+  // Ends the instance: no session begins any more, transactions of late
+  // sessions fail with kTermInProgress, the attached database is forgotten
+  // and the process-wide slot is freed. Idempotent; never throws.
+  void term() noexcept;
+
+  // A new session. Throws kNotInitialized on an uninitialised instance,
+  // kTermInProgress on a terminated one, kOutOfSessions when maxSessions
+  // sessions are open.
+  std::unique_ptr<Session> beginSession(const std::source_location& where = std::source_location::current());
+
+  std::uint64_t openSessions() const;
+  // The attached database file, if any.
+  std::optional<std::filesystem::path> attachedDatabase() const;
+
+ private:
+  friend class Session;
+  void sessionEnded() noexcept;
+  // Records the file as attached: kWrnDatabaseAttached when it already was,
+  // 0 when newly attached; throws kTooManyAttachedDatabases for a second
+  // file, kNotInitialized / kTermInProgress in the wrong state.
+  std::int32_t attach(const std::filesystem::path& file, const std::source_location& where);
+  void detach() noexcept;
+  // Serialises the writers of the database inside the process, so that
+  // they queue on this lock instead of polling SQLite's.
+  std::timed_mutex& writeLock() noexcept { return writeLock_; }
+
+  const std::uint64_t id_;
+  const InstanceSettings settings_;
+  mutable std::mutex mutex_;
+  State state_ = State::Created;                 // guarded by mutex_
+  std::uint64_t sessions_ = 0;                   // guarded by mutex_
+  std::optional<std::filesystem::path> attached_;  // guarded by mutex_
+  std::timed_mutex writeLock_;
+};
+
+}  // namespace engine

@@ -1,0 +1,38 @@
+#pragma once
+// Restore of an instance's database from a backup folder.
+//
+// restoreInstance finds the database file in the backup folder (the
+// instance's database file name, or else the one file there that carries
+// this server's identity), checks it (ours, not of a newer format, not
+// truncated, and passing SQLite's quick integrity check on a copy), and
+// places that copy as the destination folder's database file, durably. A
+// stale write-ahead log and index of the destination are removed first:
+// replayed onto the restored file they would corrupt it.
+//
+// The instance must be uninitialised (an exclusive maintenance hold), so no
+// connection to the destination is open while the file is replaced.
+//
+// Thread safety: any thread; the status callback runs on the caller's
+// thread.
+// Failures: DB::DBExc. kBadBackupFormat when the backup holds no usable
+// database file of this engine; kAfterInitialization when the instance is
+// initialised; the file-system failure otherwise. On failure the
+// destination's database file and its companions are as they were, and no
+// temporary file stays behind.
+
+#include <filesystem>
+#include <source_location>
+
+#include "engine/progress.h"
+
+namespace engine {
+
+class Instance;
+
+// Reports Begin, Progress (pages copied, pages in all) and Complete, with
+// operation Restore.
+void restoreInstance(Instance& instance, const std::filesystem::path& backupFolder,
+                     const std::filesystem::path& destinationFolder, const StatusCallback& status,
+                     const std::source_location& where = std::source_location::current());
+
+}  // namespace engine

@@ -1,0 +1,47 @@
+#pragma once
+// Shared set-up of the engine tests: settings whose folders lie in a
+// temporary folder, instances and sessions made directly on the engine
+// layer, and a small counter table for write tests.
+
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <string>
+
+#include "engine/db_instances.h"
+#include "engine/instance.h"
+#include "engine/session.h"
+#include "service/config.h"
+#include "support/temp_dir.h"
+
+namespace engine_testing {
+
+// Settings in a temporary folder; the pool is torn down after each test so
+// that every test starts without instances.
+class EngineTest : public ::testing::Test {
+ protected:
+  EngineTest();
+  ~EngineTest() override;
+
+  DBConfig config() const;
+  // Applies a config (from config() with changes) for the rest of the test.
+  void applyConfig(const DBConfig& changed);
+
+  std::string root() const { return dir_.path().string() + "/db/"; }
+
+  // An initialised instance of its own (not in the pool).
+  std::shared_ptr<engine::Instance> makeInstance(const std::string& key, std::uint64_t maxSessions = 100);
+  // A session on a fresh database with a "counter" table (id INTEGER
+  // PRIMARY KEY, value INTEGER) holding row 1 = 0, and a rowid table
+  // "blobs" (id BLOB NOT NULL PRIMARY KEY, blob BLOB) STRICT.
+  std::unique_ptr<engine::Session> makeDatabase(const std::shared_ptr<engine::Instance>& instance);
+
+  std::int64_t counter(engine::Session& session);
+
+  testing_support::TempDir dir_;
+
+ private:
+  std::unique_ptr<DBConfig::TestOverride> override_;
+};
+
+}  // namespace engine_testing
