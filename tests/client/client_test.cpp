@@ -1,0 +1,273 @@
+// The client library over loopback against the real transport, once with
+// the server's Listener and once with a scripted processor for the answers
+// the Listener cannot give yet (data, progress streams, silence).
+
+#include "client/client.h"
+
+#include <gtest/gtest.h>
+
+#include <future>
+#include <thread>
+
+#include "ipc/listener.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+using testing_support::LogCapture;
+
+constexpr const char* kTerminating = "Terminating client connection due to processing error";
+
+cvdb::ClientOptions at(std::uint16_t port) {
+  cvdb::ClientOptions o;
+  o.port = port;
+  o.ioTimeout = 10s;
+  o.progressTimeout = 10s;
+  return o;
+}
+
+std::string frameBytes(std::uint8_t tag, std::uint8_t kind, const std::string& payload) {
+  std::string out;
+  wire::Writer w(out);
+  w.u32(static_cast<std::uint32_t>(payload.size() + 2));
+  w.u8(tag);
+  w.u8(kind);
+  out += payload;
+  return out;
+}
+
+class WithListener : public ::testing::Test {
+ protected:
+  LogCapture log;
+  std::shared_ptr<Ipc::DB::Listener> listener = Ipc::DB::createListener(0, true);
+  std::uint16_t port = Ipc::DB::serverOf(*listener).port();
+
+  ~WithListener() override {
+    Ipc::DB::serverOf(*listener).signalStop();
+    Ipc::DB::serverOf(*listener).waitToFinish();
+  }
+};
+
+TEST_F(WithListener, PingAndUnknownTagsKeepTheConnection) {
+  cvdb::Client c(at(port));
+  c.ping();
+  for (const std::uint8_t tag : {2, 20}) {
+    try {
+      c.request(tag, "");
+      FAIL() << "tag " << int(tag) << " was answered";
+    } catch (const cvdb::Refused& e) {
+      EXPECT_EQ(e.tag(), tag);
+    }
+    EXPECT_TRUE(log.contains(Log::Error, std::string("Ipc attempt to generate command with unknown tag: ") +
+                                             static_cast<char>(tag)));
+  }
+  c.ping();
+  EXPECT_TRUE(c.isOpen());
+}
+
+TEST_F(WithListener, ACommandBeforeConnectEndsOnlyItsOwnConnection) {
+  cvdb::Client bystander(at(port));
+  cvdb::Client c(at(port));
+  try {
+    c.getData("doc", "page.tif");
+    FAIL() << "GetData without a database was answered";
+  } catch (const cvdb::ConnectionEnded& e) {
+    EXPECT_TRUE(e.byServer());
+    EXPECT_EQ(e.reason(), kTerminating);
+  }
+  EXPECT_FALSE(c.isOpen());
+  EXPECT_THROW(c.ping(), cvdb::ConnectionEnded);
+  EXPECT_TRUE(log.contains(Log::Error,
+                           "Dispatching command GetData failed with No database associated with current "
+                           "connection. Connect command failed?"));
+  bystander.ping();
+}
+
+TEST_F(WithListener, MalformedRequestsEndTheConnectionWithTheReason) {
+  cvdb::Client c(at(port));
+  c.sendRaw(frameBytes(1, 0, "x"));  // PingPong carries no payload
+  try {
+    c.awaitEnd();
+  } catch (const cvdb::ConnectionEnded& e) {
+    EXPECT_TRUE(e.byServer());
+    EXPECT_NE(e.reason().find("Malformed request PingPong"), std::string::npos) << e.reason();
+  }
+  EXPECT_TRUE(log.contains(Log::Warning, "Ipc "));
+
+  cvdb::Client big(at(port));
+  big.sendRaw(std::string("\xff\xff\xff\x7f\x01\x00", 6));  // 2 GiB announced
+  EXPECT_THROW(big.awaitEnd(), cvdb::ConnectionEnded);
+
+  // A client that goes away in the middle of a request harms nobody.
+  {
+    cvdb::Client vanishing(at(port));
+    vanishing.sendRaw(frameBytes(8, 0, std::string(100, 'x')).substr(0, 40));
+  }
+  cvdb::Client after(at(port));
+  after.ping();
+}
+
+TEST_F(WithListener, TheDatabaseList) {
+  cvdb::Client c(at(port));
+  EXPECT_NO_THROW(c.dbNames());
+  c.ping();
+}
+
+// A processor with scripted answers, on a command server of its own.
+class ScriptedProcessor : public Ipc::DB::CmdProcessorDBI {
+ public:
+  Ipc::SvcStub* server = nullptr;
+  std::map<std::string, SharedMemBuffer> files;
+  std::shared_future<void> release;  // what a silent command waits for
+
+  // The streaming threads hold their commands, which hold this processor:
+  // they are joined by the test, not by the destructor.
+  void joinAll() {
+    std::vector<std::thread> all;
+    {
+      std::lock_guard lock(mutex_);
+      all.swap(threads_);
+    }
+    for (auto& t : all) t.join();
+  }
+
+  void processCmd(std::shared_ptr<Ipc::CmdI> cmd) override {
+    try {
+      cmd->accept(*this);
+      server->onRespReady(cmd);
+    } catch (const std::exception&) {
+      cmd->onTransferError(kTerminating);
+    }
+  }
+
+#define CVDB_UNSCRIPTED(tag, Class) \
+  void process(Ipc::DB::Class&) override { throw std::runtime_error("not scripted"); }
+  CVDB_UNSCRIPTED(3, Connect)
+  CVDB_UNSCRIPTED(4, GetCfgPart)
+  CVDB_UNSCRIPTED(5, SetCfgPart)
+  CVDB_UNSCRIPTED(6, CfgIds)
+  CVDB_UNSCRIPTED(9, GetPackInfos)
+  CVDB_UNSCRIPTED(10, GetPackInfo)
+  CVDB_UNSCRIPTED(11, UpdatePackInfo)
+  CVDB_UNSCRIPTED(12, SavePack)
+  CVDB_UNSCRIPTED(13, ChangeDocId)
+  CVDB_UNSCRIPTED(15, ErasePack)
+  CVDB_UNSCRIPTED(17, Restore)
+  CVDB_UNSCRIPTED(19, DBNames)
+#undef CVDB_UNSCRIPTED
+
+  void process(Ipc::DB::SetData& cmd) override { files[cmd.id() + "/" + cmd.fileName()] = cmd.data(); }
+  void process(Ipc::DB::GetData& cmd) override {
+    const SharedMemBuffer& b = files[cmd.id() + "/" + cmd.fileName()];
+    cmd.setResp(MemBuffer::copyOf(b.data(), b.size()));
+  }
+  // Fetching a pack is the command that never answers.
+  void process(Ipc::DB::GetPack&) override { release.wait(); }
+
+  // Backup streams from a thread of its own, as the server's maintenance
+  // commands do; Cleanup fails the way they fail.
+  void process(Ipc::DB::Backup& cmd) override {
+    cmd.firstProgressMsg("Starting Database Backup...");
+    auto self = std::static_pointer_cast<Ipc::DB::Backup>(cmd.shared_from_this());
+    start([self] {
+      for (std::uint32_t p = 20; p <= 100; p += 40) self->sendMoreProgress(p, "Copying " + std::to_string(p));
+      self->sendNoMoreProgress();
+    });
+  }
+  void process(Ipc::DB::Cleanup& cmd) override {
+    cmd.firstProgressMsg("Starting Database Cleanup...");
+    auto self = std::static_pointer_cast<Ipc::DB::Cleanup>(cmd.shared_from_this());
+    start([self] {
+      self->sendMoreProgress(100, "DB operation failed with error: Operation timeout!");
+      self->onTransferError(kTerminating);
+      self->sendNoMoreProgress();
+    });
+  }
+
+ private:
+  void start(std::function<void()> body) {
+    std::lock_guard lock(mutex_);
+    threads_.emplace_back(std::move(body));
+  }
+
+  std::mutex mutex_;
+  std::vector<std::thread> threads_;
+};
+
+class WithScript : public ::testing::Test {
+ protected:
+  std::promise<void> releaseSilent;
+  std::shared_ptr<ScriptedProcessor> processor = std::make_shared<ScriptedProcessor>();
+  std::unique_ptr<Ipc::SvcStub> server;
+
+  WithScript() {
+    processor->release = releaseSilent.get_future().share();
+    server = std::make_unique<Ipc::SvcStub>(
+        0, true, [p = processor](std::uint8_t tag) { return Ipc::DB::makeCommand(tag, p); });
+    processor->server = server.get();
+  }
+  ~WithScript() override {
+    releaseSilent.set_value();
+    processor->joinAll();
+    server->signalStop();
+    server->waitToFinish();
+  }
+};
+
+TEST_F(WithScript, LargeContentTravelsBothWays) {
+  cvdb::Client c(at(server->port()));
+  std::string bytes(24 << 20, '\0');
+  for (std::size_t i = 0; i < bytes.size(); ++i) bytes[i] = static_cast<char>((i * 131) >> 3);
+  c.setData("doc", "scan.tif", SharedMemBuffer(MemBuffer::copyOf(bytes)));
+  EXPECT_EQ(c.getData("doc", "scan.tif").view(), bytes);
+  EXPECT_TRUE(c.getData("doc", "missing").empty());
+}
+
+TEST_F(WithScript, ProgressStreamsEndInSuccessOrInTheFailureMessage) {
+  cvdb::Client c(at(server->port()));
+  std::vector<std::pair<std::uint32_t, std::string>> seen;
+  c.backup("", false, [&](std::uint32_t p, const std::string& t) { seen.emplace_back(p, t); });
+  const std::vector<std::pair<std::uint32_t, std::string>> expected = {
+      {0, "Starting Database Backup..."}, {20, "Copying 20"}, {60, "Copying 60"}, {100, "Copying 100"}};
+  EXPECT_EQ(seen, expected);
+  c.ping();  // the connection goes on after a successful stream
+
+  seen.clear();
+  try {
+    c.cleanup({"a"}, [&](std::uint32_t p, const std::string& t) { seen.emplace_back(p, t); });
+    FAIL() << "a failed cleanup reported success";
+  } catch (const cvdb::OperationFailed& e) {
+    EXPECT_EQ(e.reason(), "DB operation failed with error: Operation timeout!");
+  }
+  ASSERT_EQ(seen.size(), 2u);
+  EXPECT_EQ(seen[1].first, 100u);
+  EXPECT_FALSE(c.isOpen());
+}
+
+TEST_F(WithScript, AnAnswerThatDoesNotComeInTimeClosesTheClient) {
+  cvdb::ClientOptions o = at(server->port());
+  o.ioTimeout = 200ms;
+  cvdb::Client c(o);
+  try {
+    c.getPack("P1");
+    FAIL() << "an answer arrived";
+  } catch (const cvdb::ConnectionEnded& e) {
+    EXPECT_FALSE(e.byServer());
+  }
+  EXPECT_FALSE(c.isOpen());
+}
+
+TEST(ClientConnect, AnUnreachableServerIsAConnectFailure) {
+  // Bind a port, then free it: nobody listens there.
+  std::uint16_t port;
+  {
+    Ipc::SvcStub s(0, true, [](std::uint8_t) { return nullptr; });
+    port = s.port();
+    s.signalStop();
+    s.waitToFinish();
+  }
+  EXPECT_THROW(cvdb::Client c(at(port)), cvdb::ConnectFailed);
+}
+
+}  // namespace
