@@ -1,0 +1,327 @@
+// The instance pool: sessions, limits, the dormant sweep, maintenance holds
+// and the teardown.
+
+#include "engine/db_instances.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <barrier>
+#include <filesystem>
+#include <future>
+#include <thread>
+#include <vector>
+
+#include "engine/db_exc.h"
+#include "engine/engine_errors.h"
+#include "engine/instance_for_maintenance.h"
+#include "engine_fixture.h"
+#include "service/names.h"
+#include "support/log_capture.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+namespace err = DB::err;
+using DB::DBInstances;
+using DB::InstanceForMaintenance;
+using engine_testing::EngineTest;
+using testing_support::LogCapture;
+using testing_support::VerboseLog;
+
+constexpr const char* kNotAccessible = "Database not accessible! Possible restore operation in progress.";
+
+class Recorder : public DB::DBProgressCallback {
+ public:
+  void onProgress(std::uint32_t percent, const std::string& text) override {
+    texts.push_back(text);
+    percents.push_back(percent);
+    if (then) then(texts.size());
+  }
+  std::vector<std::string> texts;
+  std::vector<std::uint32_t> percents;
+  std::function<void(std::size_t)> then;
+};
+
+class Pool : public EngineTest {
+ protected:
+  Pool() { InstanceForMaintenance::setTickForTesting(std::chrono::milliseconds(5)); }
+
+  void configure(std::uint64_t maxDbs, std::uint64_t maxClients = 100, std::int32_t maxWait = 10) {
+    DBConfig c = config();
+    c.MaxActiveDBs = maxDbs;
+    c.MaxActiveClientsPerDB = maxClients;
+    c.MaxWaitMaintenanceOpSecs = maxWait;
+    applyConfig(c);
+  }
+
+  // What the store does for a new instance: attach the file, or create it.
+  DBInstances::OnNewInstance opener() {
+    return [this](engine::Session& s) {
+      ++opened_;
+      const fs::path file = DB::mainFile(s.instance()->settings().key);
+      if (fs::exists(file)) {
+        s.attachDatabase(file);
+      } else {
+        s.createDatabase(file);
+      }
+    };
+  }
+
+  std::unique_ptr<engine::Session> open(const std::string& key) { return DBInstances::inst()->newSession(key, opener()); }
+  void close(const std::string& key, std::unique_ptr<engine::Session> s) {
+    DBInstances::inst()->endSession(key, std::move(s));
+  }
+  std::optional<DBInstances::RecordView> record(const std::string& key) { return DBInstances::inst()->record(key); }
+
+  std::string failureOf(const std::function<void()>& action) {
+    try {
+      action();
+    } catch (const std::exception& e) {
+      return e.what();
+    }
+    return "";
+  }
+  int codeOf(const std::function<void()>& action) {
+    try {
+      action();
+    } catch (const DB::DBExc& e) {
+      return e.code();
+    }
+    return 0;
+  }
+
+  std::atomic<int> opened_{0};
+};
+
+TEST_F(Pool, TwoClientsOfANewDatabaseShareOneInstance) {
+  std::barrier start(2);
+  std::unique_ptr<engine::Session> sessions[2];
+  std::vector<std::thread> threads;
+  for (auto& slot : sessions) {
+    threads.emplace_back([&] {
+      start.arrive_and_wait();
+      slot = open("shared");
+      slot->openDatabase();
+    });
+  }
+  for (auto& t : threads) t.join();
+  EXPECT_EQ(opened_, 1);
+  EXPECT_EQ(record("shared")->sessions, 2u);
+  EXPECT_EQ(sessions[0]->instance(), sessions[1]->instance());
+  EXPECT_TRUE(sessions[1]->isOpen());
+  close("shared", std::move(sessions[0]));
+  EXPECT_EQ(record("shared")->sessions, 1u);
+}
+
+TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimit) {
+  configure(3);
+  VerboseLog verbose;
+  LogCapture log;
+  close("a", open("a"));
+  close("b", open("b"));
+  EXPECT_EQ(DBInstances::inst()->recordCount(), 2u);
+  auto c = open("c");
+  EXPECT_FALSE(record("a"));
+  EXPECT_FALSE(record("b"));
+  EXPECT_TRUE(record("c"));
+  EXPECT_EQ(log.count(Log::Debug, "DBInstances: Closing dormant instance I:"), 2u);
+
+  // Reopening a database that was closed attaches it again.
+  const int before = opened_;
+  close("a", open("a"));
+  EXPECT_EQ(opened_, before + 1);
+}
+
+TEST_F(Pool, InstancesStayOpenBelowTheThreshold) {
+  configure(100);
+  for (int i = 0; i < 5; ++i) close("db" + std::to_string(i), open("db" + std::to_string(i)));
+  EXPECT_EQ(DBInstances::inst()->recordCount(), 5u);
+  const int before = opened_;
+  close("db0", open("db0"));
+  EXPECT_EQ(opened_, before);  // the instance was still open
+}
+
+TEST_F(Pool, InstanceAndSessionLimitsAreTheEngines) {
+  configure(2, 2);
+  auto a1 = open("a");
+  auto a2 = open("a");
+  EXPECT_EQ(codeOf([&] { open("a"); }), err::kOutOfSessions);
+  EXPECT_EQ(record("a")->sessions, 2u);
+
+  auto b = open("b");
+  EXPECT_EQ(codeOf([&] { open("c"); }), err::kTooManyInstances);
+  EXPECT_FALSE(record("c"));
+  close("b", std::move(b));
+  auto c = open("c");  // b was dormant and is swept
+  EXPECT_FALSE(record("b"));
+}
+
+TEST_F(Pool, ExclusiveHoldRefusesSessionsAtOnceAndLeavesForANewInstance) {
+  close("r", open("r"));
+  const auto firstInstance = record("r")->instanceId;
+  {
+    InstanceForMaintenance hold("r", nullptr, true);
+    EXPECT_FALSE(hold.instance()->state() == engine::Instance::State::Initialised);
+    EXPECT_NE(hold.instance()->id(), firstInstance);
+    const auto start = std::chrono::steady_clock::now();
+    EXPECT_EQ(failureOf([&] { open("r"); }), kNotAccessible);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
+    EXPECT_FALSE(DBInstances::inst()->closeIfDormant("r"));
+    EXPECT_EQ(record("r")->sessions, 0u);
+  }
+  EXPECT_FALSE(record("r"));
+  const int before = opened_;
+  auto s = open("r");
+  EXPECT_EQ(opened_, before + 1);
+  EXPECT_TRUE(record("r")->initialised);
+}
+
+TEST_F(Pool, SharedHoldWaitsWithItsMessagesAndTimesOut) {
+  configure(100, 100, 12);
+  auto s = open("busy");
+  InstanceForMaintenance first("busy", nullptr, false);
+  EXPECT_TRUE(record("busy")->maintenance);
+  Recorder progress;
+  EXPECT_EQ(failureOf([&] { InstanceForMaintenance second("busy", &progress, false); }), "Operation timeout!");
+  ASSERT_EQ(progress.texts.size(), 10u);  // ticks 1 to 9, then 10
+  EXPECT_EQ(progress.texts[0], "Waiting for another database maintenance operation to finish (1/12seconds passed)");
+  EXPECT_EQ(progress.texts[9], "Waiting for another database maintenance operation to finish (10/12seconds passed)");
+  EXPECT_EQ(progress.percents[0], 0u);
+
+  configure(100, 100, 0);
+  Recorder none;
+  EXPECT_EQ(failureOf([&] { InstanceForMaintenance third("busy", &none, false); }), "Operation timeout!");
+  EXPECT_TRUE(none.texts.empty());
+}
+
+TEST_F(Pool, SharedHoldNeedsAnOpenInstance) {
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(failureOf([&] { InstanceForMaintenance hold("nowhere", nullptr, false); }), "No instance exist for nowhere");
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
+}
+
+TEST_F(Pool, SharedHoldIsReleasedWithTheInstanceLeftOpen) {
+  auto s = open("kept");
+  const auto id = record("kept")->instanceId;
+  { InstanceForMaintenance hold("kept", nullptr, false); }
+  EXPECT_FALSE(record("kept")->maintenance);
+  EXPECT_EQ(record("kept")->instanceId, id);
+}
+
+TEST_F(Pool, ExclusiveHoldWaitsUntilTheLastClientLeaves) {
+  configure(100, 100, 20);
+  auto s = open("leaving");
+  Recorder progress;
+  progress.then = [&](std::size_t n) {
+    if (n == 3) close("leaving", std::move(s));
+  };
+  InstanceForMaintenance hold("leaving", &progress, true);
+  ASSERT_EQ(progress.texts.size(), 3u);
+  EXPECT_EQ(progress.texts[2], "Waiting for all clients connected to the database to exit (3/20seconds passed)");
+  EXPECT_TRUE(record("leaving")->maintenance);
+}
+
+// A restore never runs beside a backup, a cleanup or another restore of the
+// same database.
+TEST_F(Pool, MaintenanceHoldsExcludeEachOther) {
+  configure(100, 100, 2);
+  close("m", open("m"));
+  {
+    InstanceForMaintenance shared("m", nullptr, false);
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance exclusive("m", nullptr, true); }), "Operation timeout!");
+    EXPECT_TRUE(record("m")->initialised);
+  }
+  {
+    InstanceForMaintenance exclusive("m", nullptr, true);
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance other("m", nullptr, true); }), "Operation timeout!");
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance shared("m", nullptr, false); }), "Operation timeout!");
+    EXPECT_TRUE(record("m")->maintenance);
+  }
+  EXPECT_FALSE(record("m"));
+}
+
+TEST_F(Pool, FailedFirstSessionLeavesNothingCounted) {
+  const auto live = engine::liveInstances();
+  EXPECT_EQ(failureOf([&] {
+              DBInstances::inst()->newSession("f", [](engine::Session&) { throw std::runtime_error("attach failed"); });
+            }),
+            "attach failed");
+  EXPECT_FALSE(record("f"));
+  EXPECT_EQ(engine::liveInstances(), live);
+
+  // A creation failure cleans up through discardInstance itself.
+  EXPECT_EQ(failureOf([&] {
+              DBInstances::inst()->newSession("f", [&](engine::Session& s) {
+                s.createDatabase(DB::mainFile("f"));
+                DBInstances::existing()->discardInstance("f", s);
+                throw std::runtime_error("tables failed");
+              });
+            }),
+            "tables failed");
+  EXPECT_FALSE(record("f"));
+  EXPECT_EQ(engine::liveInstances(), live);
+  auto s = open("f");
+  EXPECT_EQ(record("f")->sessions, 1u);
+}
+
+TEST_F(Pool, FailedExclusiveCreationLeavesNoRecord) {
+  configure(1);
+  auto a = open("a");
+  EXPECT_EQ(codeOf([&] { InstanceForMaintenance hold("b", nullptr, true); }), err::kTooManyInstances);
+  EXPECT_FALSE(record("b"));
+  EXPECT_EQ(DBInstances::inst()->recordCount(), 1u);
+}
+
+TEST_F(Pool, CloseIfDormant) {
+  EXPECT_TRUE(DBInstances::inst()->closeIfDormant("never"));
+  auto s = open("d");
+  EXPECT_FALSE(DBInstances::inst()->closeIfDormant("d"));
+  close("d", std::move(s));
+  EXPECT_TRUE(DBInstances::inst()->closeIfDormant("d"));
+  EXPECT_FALSE(record("d"));
+}
+
+TEST_F(Pool, SessionsOfAnInstanceThePoolForgotAreEndedAndReported) {
+  LogCapture log;
+  auto s = open("gone");
+  const auto id = s->id();
+  DBInstances::teardown();
+  EXPECT_FALSE(DBInstances::existing());
+  // A new pool with a new instance of the same database is not confused by
+  // the old session.
+  auto fresh = open("gone");
+  DBInstances::inst()->endSession("gone", std::move(s));
+  EXPECT_EQ(log.count(Log::Error, "DBInstances: DB: gone, Session S:" + std::to_string(id) +
+                                      " released for unknown instance!!!"),
+            1u);
+  EXPECT_EQ(record("gone")->sessions, 1u);
+}
+
+TEST_F(Pool, TeardownInterruptsAWaitingHold) {
+  configure(100, 100, 100000);
+  auto s = open("w");
+  std::promise<void> waiting;
+  Recorder progress;
+  progress.then = [&](std::size_t n) {
+    if (n == 1) waiting.set_value();
+  };
+  auto hold = std::async(std::launch::async, [&] { InstanceForMaintenance h("w", &progress, true); });
+  waiting.get_future().wait();
+  DBInstances::teardown();
+  ASSERT_EQ(hold.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_EQ(codeOf([&] { hold.get(); }), err::kTermInProgress);
+}
+
+TEST_F(Pool, EngineStartIsLogged) {
+  VerboseLog verbose;
+  LogCapture log;
+  DBInstances::inst();
+  const std::string expected = "DBInstances: Engine initialized\n\t\"" + root() +
+                               "\" is the databases root\n\t100 maximum active databases\n"
+                               "\t100 maximum active clients per database\n\t\"cvd\" database file names prefix\n"
+                               "\t\"cvdb.edb\" database file name\n";
+  EXPECT_EQ(log.count(Log::Debug, expected), 1u);
+}
+
+}  // namespace
