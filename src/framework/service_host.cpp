@@ -147,7 +147,8 @@ std::optional<int> Host::prepare(int argc, char** argv) {
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
-    prepareResult_ = app.exit(e);
+    // --help and --version end here with 0; a bad command line with 2.
+    prepareResult_ = app.exit(e) == 0 ? 0 : 2;
     return prepareResult_;
   }
   if (!home.empty()) Platform::inst().changeSystemConfigDir(std::filesystem::absolute(home));

@@ -65,6 +65,7 @@ void WorkerPool::workerMain(const std::shared_ptr<State>& s) {
     }
     Task task = std::move(s->tasks.front());
     s->tasks.pop_front();
+    if (s->tasks.empty()) s->spawnFailing = false;  // the burst is over
     lock.unlock();
     try {
       task();

@@ -1,0 +1,78 @@
+#include "service/db_svc.h"
+
+#include "engine/db_instances.h"
+#include "framework/log.h"
+#include "ipc/listener.h"
+#include "service/config.h"
+
+namespace DBServer {
+namespace {
+
+const std::string kSvcName = "CorvinaDB";
+const std::string kSvcDisplayName = "Corvina database server";
+
+void debugLine(const char* text) {
+  if (!g_LogVerbose) return;
+  Log::Lock entry(Log::Debug);
+  entry.logStreamLine() << text;
+}
+
+}  // namespace
+
+DBSvc::DBSvc() = default;
+
+DBSvc::~DBSvc() {
+  debugLine("Svc object destroyed");
+  std::lock_guard lock(mutex_);
+  listener.reset();
+}
+
+bool DBSvc::prepareSvc() {
+  DBConfig::inst();
+  return true;
+}
+
+void DBSvc::runSvc() {
+  try {
+    const DBConfig& config = DBConfig::inst();
+    std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4);
+    Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
+    {
+      std::lock_guard lock(mutex_);
+      listener = created;
+      // A stop that came while there was no server to tell.
+      if (stopRequested_) server.signalStop();
+    }
+    server.waitToFinish();
+    {
+      std::lock_guard lock(mutex_);
+      listener.reset();
+    }
+    // The Listener and its server go with the last command that holds them.
+    created.reset();
+
+    DB::DBInstances::teardown();
+    debugLine("Svc stopped");
+  } catch (const std::exception& e) {
+    Log::Lock entry(Log::Error);
+    entry.logStreamLine() << "Service main failed. " << e.what();
+    throw;
+  } catch (...) {
+    Log::Lock entry(Log::Error);
+    entry.logStreamLine() << "Service main failed with unknown error";
+    throw;
+  }
+}
+
+void DBSvc::stopSvc() {
+  debugLine("Svc stopping...");
+  std::lock_guard lock(mutex_);
+  stopRequested_ = true;
+  if (listener) Ipc::DB::serverOf(*listener).signalStop();
+}
+
+const std::string& DBSvc::svcName() const { return kSvcName; }
+
+const std::string& DBSvc::svcDisplayName() const { return kSvcDisplayName; }
+
+}  // namespace DBServer

@@ -1,0 +1,483 @@
+// The command server over real loopback sockets: framing, refusal of bad
+// input, one command at a time per connection, progress streams, stalls,
+// vanishing clients, stop, and many connections.
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "fake_processor.h"
+#include "framework/svc_stub.h"
+#include "framework/wire.h"
+#include "raw_client.h"
+
+namespace transport_test {
+namespace {
+
+using namespace std::chrono_literals;
+using wire::FrameKind;
+
+// The reports that the transport hands to its error handler.
+class Reports {
+ public:
+  void add(const std::string& text) {
+    std::lock_guard lock(mutex_);
+    texts_.push_back(text);
+    changed_.notify_all();
+  }
+  bool waitFor(const std::string& fragment, std::chrono::milliseconds timeout = 10s) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] {
+      for (const auto& t : texts_) {
+        if (t.find(fragment) != std::string::npos) return true;
+      }
+      return false;
+    });
+  }
+  std::vector<std::string> all() const {
+    std::lock_guard lock(mutex_);
+    return texts_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<std::string> texts_;
+};
+
+template <typename Pred>
+bool eventually(Pred pred, std::chrono::milliseconds timeout = 10s) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!pred()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(5ms);
+  }
+  return true;
+}
+
+Ipc::SvcStub::Options shortTimeouts() {
+  Ipc::SvcStub::Options o;
+  o.stallTimeout = 300ms;
+  o.closeGrace = 300ms;
+  o.ioThreads = 2;
+  o.workers.keep = 2;
+  return o;
+}
+
+class TransportTest : public ::testing::Test {
+ protected:
+  void SetUp() override { start(); }
+  void TearDown() override { stop(); }
+
+  void start(bool forceIp4 = false, Ipc::SvcStub::Options options = shortTimeouts()) {
+    proc = std::make_shared<FakeProcessor>();
+    server = std::make_unique<Ipc::SvcStub>(
+        0, forceIp4, proc->factory(),
+        [this](const std::shared_ptr<Ipc::Socket>&, const std::string& text) { reports.add(text); }, options);
+    proc->server = server.get();
+  }
+  void stop() {
+    if (!server) return;
+    proc->openGate();
+    server->signalStop();
+    server->waitToFinish();
+    proc->joinThreads();
+    server.reset();
+  }
+  std::uint16_t port() const { return server->port(); }
+
+  Reports reports;
+  std::shared_ptr<FakeProcessor> proc;
+  std::unique_ptr<Ipc::SvcStub> server;
+};
+
+void expectBye(RawClient& c, const std::string& reasonStart) {
+  const auto last = c.readUntilClosed();
+  ASSERT_TRUE(last) << "the server closed without a Bye";
+  EXPECT_EQ(last->kind, FrameKind::Bye);
+  EXPECT_EQ(last->tag, 0);
+  EXPECT_EQ(last->text().rfind(reasonStart, 0), 0u) << last->text();
+}
+
+TEST_F(TransportTest, AnswersOverIpv4AndIpv6AndCarriesPayloads) {
+  RawClient v4(port());
+  EXPECT_TRUE(v4.ping());
+  RawClient v6(port(), true);
+  EXPECT_TRUE(v6.ping());
+
+  v6.send(requestBytes(kEcho, strField("hello")));
+  const auto f = v6.read();
+  ASSERT_TRUE(f);
+  EXPECT_EQ(f->tag, kEcho);
+  EXPECT_EQ(f->kind, FrameKind::Answer);
+  EXPECT_EQ(f->text(), "hello");
+}
+
+TEST_F(TransportTest, ForcedIpv4ListensOnIpv4Only) {
+  stop();
+  start(true);
+  EXPECT_TRUE(RawClient(port()).ping());
+  EXPECT_FALSE(RawClient::tryConnect(port(), true));
+}
+
+TEST_F(TransportTest, UnknownTagsAreRefusedWithoutCommandAndTheConnectionGoesOn) {
+  RawClient c(port());
+  for (const std::uint8_t tag : {0, 2, 20, 255}) {
+    c.send(requestBytes(tag, "ignored payload"));
+    const auto f = c.read();
+    ASSERT_TRUE(f);
+    EXPECT_EQ(f->kind, FrameKind::Refused);
+    EXPECT_EQ(f->tag, tag);
+    EXPECT_EQ(f->text(), "Unknown command tag " + std::to_string(tag));
+  }
+  EXPECT_EQ(proc->created, 0);
+  EXPECT_TRUE(c.ping());
+  EXPECT_EQ(proc->processed, 0);
+}
+
+struct BadInput {
+  const char* name;
+  std::string bytes;
+  const char* bye;
+  const char* report;
+};
+
+std::string lengthOnly(std::uint32_t length) {
+  std::string s(4, '\0');
+  for (int i = 0; i < 4; ++i) s[i] = static_cast<char>((length >> (8 * i)) & 0xFF);
+  return s;
+}
+
+class MalformedInputTest : public TransportTest, public ::testing::WithParamInterface<BadInput> {};
+
+TEST_P(MalformedInputTest, EndsOnlyThatConnection) {
+  RawClient bystander(port());
+  ASSERT_TRUE(bystander.ping());
+  RawClient bad(port());
+  bad.send(GetParam().bytes);
+  expectBye(bad, GetParam().bye);
+  EXPECT_TRUE(reports.waitFor(GetParam().report));
+  EXPECT_TRUE(bystander.ping());
+  EXPECT_EQ(proc->processed, 0);
+}
+
+std::string truncatedString() {
+  std::string p;
+  wire::Writer(p).u32(100);
+  return requestBytes(kEcho, p + "abc");
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Frames, MalformedInputTest,
+    ::testing::Values(
+        BadInput{"LengthZero", lengthOnly(0), "Malformed frame: length", "length 0 is out of range"},
+        BadInput{"LengthOne", lengthOnly(1) + "x", "Malformed frame: length", "length 1 is out of range"},
+        // Refused on the header alone: no body follows and none is awaited.
+        BadInput{"LengthBeyondLimit", lengthOnly(wire::kMaxBody + 1), "Malformed frame: length",
+                 "is out of range"},
+        BadInput{"AnswerKindFromClient", frameBytes(1, FrameKind::Answer), "Malformed frame: not a request",
+                 "is not a request"},
+        BadInput{"StringPastItsFrame", truncatedString(), "Malformed request Test10", "Malformed request Test10"},
+        BadInput{"TrailingGarbage", requestBytes(kEcho, strField("x") + "zz"), "Malformed request Test10",
+                 "trailing"},
+        BadInput{"PayloadOnPing", requestBytes(1, "p"), "Malformed request PingPong", "Malformed request PingPong"},
+        BadInput{"FactoryThrows", requestBytes(kFactoryThrows), "Terminating client connection",
+                 "Cannot create a command for tag 18"}),
+    [](const ::testing::TestParamInfo<BadInput>& p) { return std::string(p.param.name); });
+
+TEST_F(TransportTest, AStalledFrameIsDroppedWhileAnIdleConnectionIsKept) {
+  RawClient idle(port());
+  RawClient header(port());
+  RawClient body(port());
+  header.send(std::string("\x10\x00", 2));
+  body.send(requestBytes(kEcho, strField("0123456789")).substr(0, 9));
+  expectBye(header, "Frame incomplete for too long");
+  expectBye(body, "Frame incomplete for too long");
+  EXPECT_TRUE(reports.waitFor("sent part of a frame and nothing more"));
+  // The idle connection has outlived the stall timeout several times over.
+  EXPECT_TRUE(idle.ping());
+}
+
+TEST_F(TransportTest, AClientVanishingMidRequestLeavesNothingBehind) {
+  {
+    RawClient c(port());
+    c.send(requestBytes(kEcho, strField(std::string(100000, 'x'))).substr(0, 50000));
+    ASSERT_TRUE(eventually([&] { return server->connectionCount() == 1; }));
+  }
+  EXPECT_TRUE(reports.waitFor("ended in the middle of a frame"));
+  EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
+  EXPECT_EQ(proc->processed, 0);
+}
+
+TEST_F(TransportTest, AClientVanishingMidAnswerOrMidCommandLeavesNothingBehind) {
+  {
+    RawClient c(port());
+    c.send(requestBytes(kSlot, strField("slot")));
+    ASSERT_TRUE(c.read());
+    EXPECT_EQ(proc->liveSlots, 1);
+    // An answer far larger than the socket buffers, never read.
+    c.send(requestBytes(kBig, strField("67108864")));
+    ASSERT_TRUE(proc->waitStarted("67108864"));
+    c.close(true);
+  }
+  EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
+  EXPECT_TRUE(eventually([&] { return proc->liveSlots == 0; }));
+
+  // While a command runs its connection reads nothing, so the end of the
+  // peer (reset or close) shows once the command is done.
+  {
+    RawClient reset(port());
+    RawClient closed(port());
+    reset.send(requestBytes(kBlock, strField("reset")));
+    closed.send(requestBytes(kBlock, strField("closed")));
+    ASSERT_TRUE(proc->waitStarted("reset"));
+    ASSERT_TRUE(proc->waitStarted("closed"));
+    reset.close(true);
+    closed.close();
+  }
+  proc->openGate();
+  EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
+  // The answers of the orphaned commands go nowhere; the server goes on.
+  EXPECT_TRUE(RawClient(port()).ping());
+  EXPECT_TRUE(eventually([&] { return proc->disconnects == 3; }));
+}
+
+TEST_F(TransportTest, ProgressFromAnotherThreadPrecedesTheNextRequest) {
+  RawClient c(port());
+  // The ping is sent at once but must be read only after the stream's end.
+  c.send(requestBytes(kProgress, strField("p")) + requestBytes(1));
+  std::vector<std::uint32_t> percents;
+  for (;;) {
+    const auto f = c.read();
+    ASSERT_TRUE(f);
+    ASSERT_EQ(f->tag, kProgress);
+    if (f->kind == FrameKind::ProgressEnd) break;
+    ASSERT_EQ(f->kind, FrameKind::Progress);
+    wire::Reader in(f->payload);
+    percents.push_back(in.u32());
+  }
+  EXPECT_EQ(percents, (std::vector<std::uint32_t>{0, 25, 50, 75}));
+  const auto pong = c.read();
+  ASSERT_TRUE(pong);
+  EXPECT_EQ(pong->tag, 1);
+  EXPECT_EQ(pong->kind, FrameKind::Answer);
+}
+
+TEST_F(TransportTest, CommandsOfOneConnectionRunInOrderWhileOthersGoOn) {
+  RawClient a(port());
+  RawClient b(port());
+  a.send(requestBytes(kBlock, strField("a1")) + requestBytes(kEcho, strField("a2")));
+  ASSERT_TRUE(proc->waitStarted("a1"));
+
+  b.send(requestBytes(kEcho, strField("b1")));
+  const auto fb = b.read();
+  ASSERT_TRUE(fb);
+  EXPECT_EQ(fb->text(), "b1");
+  EXPECT_TRUE(b.ping());
+
+  proc->openGate();
+  const auto f1 = a.read();
+  const auto f2 = a.read();
+  ASSERT_TRUE(f1 && f2);
+  EXPECT_EQ(f1->text(), "a1");
+  EXPECT_EQ(f2->text(), "a2");
+  const auto ev = proc->events();
+  const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
+  EXPECT_LT(pos("start:b1"), pos("end:a1"));
+  EXPECT_LT(pos("end:a1"), pos("start:a2"));
+}
+
+TEST_F(TransportTest, ProcessorFaultsEndTheirConnectionOnly) {
+  RawClient bystander(port());
+  struct Case {
+    std::uint8_t tag;
+    const char* bye;
+    const char* report;
+  };
+  for (const Case& k : {Case{kThrowOther, "Terminating client connection", "failed with an unknown exception"},
+                        Case{kSilent, "Terminating client connection", "ended without an answer"},
+                        Case{kHangup, "Hung up by the processor", ""}}) {
+    RawClient c(port());
+    c.send(requestBytes(k.tag, strField("x")));
+    expectBye(c, k.bye);
+    if (*k.report) {
+      EXPECT_TRUE(reports.waitFor(k.report));
+    }
+    EXPECT_TRUE(bystander.ping());
+  }
+}
+
+TEST_F(TransportTest, LargeFramesRoundTripIntact) {
+  RawClient c(port());
+  std::string text(8 << 20, '\0');
+  for (std::size_t i = 0; i < text.size(); ++i) text[i] = static_cast<char>(i * 31 + 7);
+  c.send(requestBytes(kEcho, strField(text)));
+  const auto f = c.read(30s);
+  ASSERT_TRUE(f);
+  EXPECT_TRUE(f->text() == text);
+
+  c.send(requestBytes(kBig, strField("3000000")));
+  const auto big = c.read(30s);
+  ASSERT_TRUE(big);
+  wire::Reader in(big->payload);
+  const auto bytes = in.bytes();
+  ASSERT_EQ(bytes.size(), 3000000u);
+  bool same = true;
+  for (std::size_t i = 0; i < bytes.size(); ++i) same &= bytes[i] == static_cast<char>(i * 7);
+  EXPECT_TRUE(same);
+}
+
+TEST_F(TransportTest, PipelinedRequestsAreAllAnsweredInOrder) {
+  RawClient c(port());
+  std::string burst;
+  for (int i = 0; i < 2000; ++i) burst += i % 2 ? requestBytes(1) : requestBytes(kEcho, strField(std::to_string(i)));
+  c.send(burst);
+  for (int i = 0; i < 2000; ++i) {
+    const auto f = c.read();
+    ASSERT_TRUE(f);
+    if (i % 2) {
+      ASSERT_EQ(f->tag, 1);
+    } else {
+      ASSERT_EQ(f->text(), std::to_string(i));
+    }
+  }
+}
+
+TEST_F(TransportTest, AClientThatStopsReadingIsDisconnected) {
+  RawClient c(port());
+  c.send(requestBytes(kBig, strField("67108864")));
+  EXPECT_TRUE(reports.waitFor("has not read its answers"));
+  EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
+}
+
+TEST_F(TransportTest, StopDisconnectsIdleClientsPromptly) {
+  std::vector<RawClient> clients;
+  for (int i = 0; i < 50; ++i) clients.emplace_back(port(), i % 2 == 1);
+  for (auto& c : clients) ASSERT_TRUE(c.ping());
+
+  const auto t0 = std::chrono::steady_clock::now();
+  EXPECT_TRUE(server->signalStop());
+  EXPECT_FALSE(server->signalStop());
+  server->waitToFinish();
+  EXPECT_LT(std::chrono::steady_clock::now() - t0, 1s);
+  EXPECT_EQ(server->connectionCount(), 0u);
+  for (auto& c : clients) expectBye(c, "Server is stopping");
+  EXPECT_FALSE(RawClient::tryConnect(port(), false));
+}
+
+TEST_F(TransportTest, StopWaitsForARunningCommandAndReleasesItsConnection) {
+  RawClient c(port());
+  c.send(requestBytes(kSlot, strField("s")));
+  ASSERT_TRUE(c.read());
+  c.send(requestBytes(kBlock, strField("running")));
+  ASSERT_TRUE(proc->waitStarted("running"));
+
+  server->signalStop();
+  expectBye(c, "Server is stopping");
+  auto done = std::async(std::launch::async, [&] { server->waitToFinish(); });
+  EXPECT_EQ(done.wait_for(200ms), std::future_status::timeout);
+  proc->openGate();
+  done.get();
+  EXPECT_EQ(proc->liveSlots, 0);
+  EXPECT_EQ(proc->events().back(), "end:running");
+}
+
+TEST_F(TransportTest, DestroyingTheServerStopsIt) {
+  RawClient c(port());
+  ASSERT_TRUE(c.ping());
+  server.reset();
+  expectBye(c, "Server is stopping");
+}
+
+long residentBytes() {
+  std::ifstream statm("/proc/self/statm");
+  long pages = 0;
+  long resident = 0;
+  statm >> pages >> resident;
+  return resident * ::sysconf(_SC_PAGESIZE);
+}
+
+void raiseFileLimit() {
+  rlimit l{};
+  ::getrlimit(RLIMIT_NOFILE, &l);
+  l.rlim_cur = l.rlim_max;
+  ::setrlimit(RLIMIT_NOFILE, &l);
+}
+
+TEST_F(TransportTest, AThousandIdleConnectionsAreCheap) {
+  raiseFileLimit();
+  rlimit l{};
+  ::getrlimit(RLIMIT_NOFILE, &l);
+  if (l.rlim_cur < 2100) GTEST_SKIP() << "open-file limit too low: " << l.rlim_cur;
+
+  std::vector<RawClient> clients;
+  clients.reserve(1000);
+  for (int i = 0; i < 20; ++i) clients.emplace_back(port());  // warm the allocator and threads
+  for (auto& c : clients) ASSERT_TRUE(c.ping());
+  const long before = residentBytes();
+  for (int i = 0; i < 980; ++i) clients.emplace_back(port());
+  for (auto& c : clients) ASSERT_TRUE(c.ping());
+  ASSERT_TRUE(eventually([&] { return server->connectionCount() == 1000; }));
+  const long grown = residentBytes() - before;
+  std::printf("[ measure  ] 980 more idle connections: %.1f MiB resident (%.1f KiB each)\n", grown / 1048576.0,
+              grown / 1024.0 / 980);
+  EXPECT_LT(grown, 64L << 20);
+
+  const auto t0 = std::chrono::steady_clock::now();
+  server->signalStop();
+  server->waitToFinish();
+  EXPECT_LT(std::chrono::steady_clock::now() - t0, 1s);
+}
+
+TEST_F(TransportTest, RunningOutOfDescriptorsRefusesNewConnectionsAndKeepsServing) {
+  RawClient served(port());
+  ASSERT_TRUE(served.ping());
+
+  // Sockets made before the limit drops, connected after it.
+  std::vector<int> pending;
+  for (int i = 0; i < 8; ++i) pending.push_back(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  rlimit saved{};
+  ::getrlimit(RLIMIT_NOFILE, &saved);
+  int highest = 0;
+  for (int fd = 0; fd < 65536 && fd < static_cast<int>(saved.rlim_cur); ++fd) {
+    if (::fcntl(fd, F_GETFD) != -1) highest = fd;
+  }
+  rlimit tight = saved;
+  tight.rlim_cur = highest + 1;
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
+  // Fill the holes below the limit: not one more descriptor for anyone.
+  std::vector<int> fillers;
+  for (int fd; (fd = ::open("/dev/null", O_RDONLY | O_CLOEXEC)) >= 0;) fillers.push_back(fd);
+
+  sockaddr_in a{};
+  a.sin_family = AF_INET;
+  a.sin_port = htons(port());
+  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  for (const int fd : pending) ::connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
+  const bool reported = reports.waitFor("Cannot accept a connection");
+  // The refused clients see their connection end without a word.
+  char byte = 0;
+  pollfd p{pending.front(), POLLIN, 0};
+  const ssize_t got = ::poll(&p, 1, 10000) == 1 ? ::recv(pending.front(), &byte, 1, 0) : -2;
+  for (const int fd : fillers) ::close(fd);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &saved), 0);
+  for (const int fd : pending) ::close(fd);
+
+  EXPECT_TRUE(reported);
+  EXPECT_EQ(got, 0);
+  EXPECT_TRUE(served.ping());
+  EXPECT_TRUE(RawClient(port()).ping());
+}
+
+}  // namespace
+}  // namespace transport_test
