@@ -28,7 +28,7 @@ using ConnectionPtr = std::unique_ptr<sqlite3, ConnectionCloser>;
 // grows a connection by about 2 MiB; with a thousand connections open that
 // would be 2 GiB, so the cache is kept small and the operating system's
 // page cache does the rest.
-inline constexpr int kConnectionCacheKiB = 512;
+inline constexpr int kConnectionCacheKiB = 256;
 // After a checkpoint the WAL file is cut back to this size, so that one big
 // value does not leave a write-ahead log of its size behind.
 inline constexpr std::int64_t kWalSizeLimit = 64 * 1024 * 1024;

@@ -108,8 +108,9 @@ Statement Session::prepare(std::string_view sql, const std::source_location& whe
   }
   sqlite3_stmt* stmt = nullptr;
   // A statement already in use (a nested use of the same text) gets one of
-  // its own, which the handle finalises.
-  const bool cache = found == statements_.end();
+  // its own, which the handle finalises; so does any text once the cache is
+  // full, so that SQL built at run time cannot grow it without bound.
+  const bool cache = found == statements_.end() && statements_.size() < kMaxCachedStatements;
   const int rc = sqlite3_prepare_v3(db, sql.data(), static_cast<int>(sql.size()),
                                     cache ? SQLITE_PREPARE_PERSISTENT : 0, &stmt, nullptr);
   if (rc != SQLITE_OK) {

@@ -76,6 +76,10 @@ class Session {
   // a creation that failed. The session stays counted until it is destroyed.
   void detachAll() noexcept;
 
+  // Statements cached per session; texts beyond these are prepared for each
+  // use. SQL texts are meant to be constants with parameters.
+  static constexpr std::size_t kMaxCachedStatements = 128;
+
   // The cached statement for the SQL text (see statement.h).
   Statement prepare(std::string_view sql, const std::source_location& where = std::source_location::current());
   // Runs SQL without results, e.g. a table definition.
