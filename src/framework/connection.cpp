@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "framework/frame.h"
+#include "framework/request_decoder.h"
 #include "framework/transport_core.h"
 #include "framework/wire.h"
 
@@ -226,7 +227,7 @@ void Connection::parse() {
     const std::size_t avail = stageEnd_ - stageBegin_;
     if (avail < wire::kLengthSize) return;
     const std::uint32_t length = wire::frameLength(stage_.get() + stageBegin_);
-    if (length < 2 || length > wire::kMaxBody) {
+    if (!frameLengthValid(length)) {
       fail("Malformed frame from " + peer_ + ": length " + std::to_string(length) + " is out of range (2 to " +
                std::to_string(wire::kMaxBody) + "); connection ended",
            "Malformed frame: length out of range");
@@ -255,50 +256,35 @@ void Connection::parse() {
 }
 
 void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size) {
-  const std::uint8_t tag = body.get()[0];
-  const std::uint8_t kind = body.get()[1];
-  if (kind != static_cast<std::uint8_t>(wire::FrameKind::Request)) {
-    fail("Malformed frame from " + peer_ + ": kind " + std::to_string(kind) + " is not a request; connection ended",
-         "Malformed frame: not a request");
-    return;
-  }
-
-  std::shared_ptr<CmdI> cmd;
-  try {
-    if (core_->factory) cmd = core_->factory(tag);
-  } catch (const std::exception& e) {
-    fail("Cannot create a command for tag " + std::to_string(tag) + " from " + peer_ + ": " + e.what() +
-             "; connection ended",
-         "Terminating client connection due to processing error");
-    return;
-  } catch (...) {
-    fail("Cannot create a command for tag " + std::to_string(tag) + " from " + peer_ + "; connection ended",
-         "Terminating client connection due to processing error");
-    return;
-  }
-  if (!cmd) {
-    enqueue(textFrame(tag, wire::FrameKind::Refused, "Unknown command tag " + std::to_string(tag)));
-    return;
-  }
-
-  try {
-    // The payload shares the frame's buffer, so byte strings in it reach the
-    // command without a copy.
-    wire::Reader in(std::shared_ptr<unsigned char>(body, body.get() + 2), size - 2);
-    cmd->readRequest(in);
-    in.expectEnd();
-  } catch (const std::exception& e) {
-    fail("Malformed request " + cmd->name() + " from " + peer_ + ": " + e.what() + "; connection ended",
-         "Malformed request " + cmd->name() + ": " + e.what());
-    return;
-  } catch (...) {
-    fail("Malformed request " + cmd->name() + " from " + peer_ + "; connection ended",
-         "Malformed request " + cmd->name());
-    return;
-  }
+  using Outcome = DecodedRequest::Outcome;
+  DecodedRequest r = decodeRequest(body, size, core_->factory);
   body.reset();
-  cmd->attachSocket(shared_from_this());
+  const std::string tag = std::to_string(r.tag);
+  switch (r.outcome) {
+    case Outcome::NotARequest:
+      fail("Malformed frame from " + peer_ + ": kind " + std::to_string(r.kind) +
+               " is not a request; connection ended",
+           "Malformed frame: not a request");
+      return;
+    case Outcome::FactoryFailed:
+      fail("Cannot create a command for tag " + tag + " from " + peer_ + ": " + r.problem + "; connection ended",
+           "Terminating client connection due to processing error");
+      return;
+    case Outcome::UnknownTag:
+      // The processor has said what it thinks of the tag; the client learns
+      // that nothing ran, and may go on.
+      enqueue(textFrame(r.tag, wire::FrameKind::Refused, "Unknown command tag " + tag));
+      return;
+    case Outcome::Malformed:
+      fail("Malformed request " + r.cmd->name() + " from " + peer_ + ": " + r.problem + "; connection ended",
+           "Malformed request " + r.cmd->name() + ": " + r.problem);
+      return;
+    case Outcome::Command:
+      break;
+  }
 
+  const std::shared_ptr<CmdI>& cmd = r.cmd;
+  cmd->attachSocket(shared_from_this());
   const auto processor = cmd->processor();
   if (!processor) {
     // Keep-alive and the like: answered here, without a worker.

@@ -221,6 +221,10 @@ int ServerProcess::wait(std::chrono::milliseconds timeout) {
     status = -1;
   }
   status_ = status;
+  // What the process wrote last may still be in the pipe: the lines are
+  // complete once the reader has seen the end of its output.
+  std::unique_lock lock(mutex_);
+  changed_.wait_for(lock, std::chrono::seconds(10), [this] { return outputEnded_; });
   return *status_;
 }
 
