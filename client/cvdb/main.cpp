@@ -42,6 +42,7 @@ int main(int argc, char** argv) {
     options.connectTimeout = std::chrono::seconds(std::min(globals.timeoutSeconds, 10u));
     options.ioTimeout = std::chrono::seconds(globals.timeoutSeconds);
     if (action.needsDb && !globals.db) throw UsageError("this command needs --db NAME");
+    if (action.prepare) action.prepare();
     cvdb::Client client(options);
     if (action.needsDb) {
       const cvdb::ConnectResult connected = client.connect(*globals.db, globals.openMode);

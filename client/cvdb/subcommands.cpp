@@ -29,6 +29,10 @@ struct Args {
   bool all = false;
   std::vector<std::string> used;
   std::string usedFile;
+  // Read by the actions' prepare step.
+  json::Object part;
+  SharedMemBuffer contentBytes;
+  std::set<std::string> usedSet;
 };
 
 void printOk(const Globals& g, const std::string& text) {
@@ -136,7 +140,13 @@ void addConfig(CLI::App& app, const Globals& g, Action& chosen, Args& a) {
   auto* value = set->add_option("JSON", a.value, "The part as JSON text, or - for standard input");
   set->add_option("--file", a.file, "Read the part from this file")->excludes(value);
   set->callback([&] {
-    chosen = {true, [&](Client& c) {
+    chosen = {true,
+              [&](Client& c) {
+                c.setCfg(a.key, a.part);
+                printOk(g, "stored \"" + a.key + "\"");
+                return kOk;
+              },
+              [&] {
                 if (a.value.empty() && a.file.empty()) throw UsageError("cfg set needs JSON, --file F or -");
                 std::string text;
                 if (!a.file.empty() || a.value == "-") {
@@ -144,15 +154,11 @@ void addConfig(CLI::App& app, const Globals& g, Action& chosen, Args& a) {
                 } else {
                   text = a.value;
                 }
-                json::Object part;
                 try {
-                  part = json::strToObject(text);
+                  a.part = json::strToObject(text);
                 } catch (const json::Exc& e) {
                   throw UsageError(std::string("the part must be one JSON object: ") + e.what());
                 }
-                c.setCfg(a.key, part);
-                printOk(g, "stored \"" + a.key + "\"");
-                return kOk;
               }};
   });
 
@@ -205,13 +211,14 @@ void addData(CLI::App& app, const Globals& g, Action& chosen, Args& a) {
   put->add_option("FILE", a.fileName)->required();
   put->add_option("IN", a.input, "File to send, or - for standard input")->capture_default_str();
   put->callback([&] {
-    chosen = {true, [&](Client& c) {
-                SharedMemBuffer content = readInput(a.input);
-                const auto size = content.size();
-                c.setData(a.id, a.fileName, std::move(content));
+    chosen = {true,
+              [&](Client& c) {
+                const auto size = a.contentBytes.size();
+                c.setData(a.id, a.fileName, a.contentBytes);
                 printOk(g, "stored " + std::to_string(size) + " bytes as " + a.id + "/" + a.fileName);
                 return kOk;
-              }};
+              },
+              [&] { a.contentBytes = readInput(a.input); }};
   });
 }
 
@@ -312,7 +319,8 @@ void addPackWrites(CLI::App* pack, const Globals& g, Action& chosen, Args& a) {
   addRecordOptions(save, a);
   save->add_option("--content", a.content, "File with the content, or - for standard input")->required();
   save->callback([&] {
-    chosen = {true, [&](Client& c) {
+    chosen = {true,
+              [&](Client& c) {
                 Ipc::PackInfo p(a.id);
                 applyRecordOptions(a, p);
                 // The server creates a pack only from a complete record: a
@@ -325,12 +333,12 @@ void addPackWrites(CLI::App* pack, const Globals& g, Action& chosen, Args& a) {
                   if (!a.docs) p.docCount = 0;
                 }
                 if (!a.modified) p.modified = now;
-                SharedMemBuffer content = readInput(a.content);
-                const auto size = content.size();
-                c.savePack(p, std::move(content));
+                const auto size = a.contentBytes.size();
+                c.savePack(p, a.contentBytes);
                 printOk(g, "saved \"" + a.id + "\" with " + std::to_string(size) + " bytes");
                 return kOk;
-              }};
+              },
+              [&] { a.contentBytes = readInput(a.content); }};
   });
 
   auto* rm = pack->add_subcommand("rm", "Erase a pack's record and content");
@@ -378,17 +386,19 @@ void addMaintenance(CLI::App& app, const Globals& g, Action& chosen, Args& a) {
   cleanup->add_option("--used", a.used, "An id whose data is still in use (repeatable)");
   cleanup->add_option("--used-file", a.usedFile, "File with one used id per line");
   cleanup->callback([&] {
-    chosen = {true, [&](Client& c) {
-                std::set<std::string> used(a.used.begin(), a.used.end());
-                if (!a.usedFile.empty()) {
-                  std::ifstream in(a.usedFile);
-                  if (!in) throw UsageError("cannot open \"" + a.usedFile + "\"");
-                  for (std::string line; std::getline(in, line);) {
-                    if (!line.empty() && line.back() == '\r') line.pop_back();
-                    if (!line.empty()) used.insert(line);
-                  }
+    chosen = {true,
+              [&](Client& c) {
+                return runMaintenance(g.json, [&](const ProgressFn& progress) { c.cleanup(a.usedSet, progress); });
+              },
+              [&] {
+                a.usedSet.insert(a.used.begin(), a.used.end());
+                if (a.usedFile.empty()) return;
+                std::ifstream in(a.usedFile);
+                if (!in) throw UsageError("cannot open \"" + a.usedFile + "\"");
+                for (std::string line; std::getline(in, line);) {
+                  if (!line.empty() && line.back() == '\r') line.pop_back();
+                  if (!line.empty()) a.usedSet.insert(line);
                 }
-                return runMaintenance(g.json, [&](const ProgressFn& progress) { c.cleanup(used, progress); });
               }};
   });
 }

@@ -44,6 +44,9 @@ struct Globals {
 struct Action {
   bool needsDb = true;
   std::function<int(Client&)> run;
+  // Reads local input before anything goes to the server, so that a bad
+  // file or text changes nothing there.
+  std::function<void()> prepare = {};
 };
 
 // Adds every subcommand to app; the chosen one's action lands in chosen.
