@@ -16,6 +16,8 @@
 // terminated still finds valid memory.
 // Thread safety: every member may be called from any thread.
 // Failures: DB::DBExc with an engine code (engine_errors.h).
+// The write gate serialises the database's writers inside the process
+// (write_gate.h); sessions take it around their write transactions.
 
 #include <chrono>
 #include <cstdint>
@@ -25,6 +27,8 @@
 #include <optional>
 #include <source_location>
 #include <string>
+
+#include "engine/write_gate.h"
 
 namespace engine {
 
@@ -94,9 +98,7 @@ class Instance : public std::enable_shared_from_this<Instance> {
   // file, kNotInitialized / kTermInProgress in the wrong state.
   std::int32_t attach(const std::filesystem::path& file, const std::source_location& where);
   void detach() noexcept;
-  // Serialises the writers of the database inside the process, so that
-  // they queue on this lock instead of polling SQLite's.
-  std::timed_mutex& writeLock() noexcept { return writeLock_; }
+  WriteGate& writeGate() noexcept { return writeGate_; }
 
   const std::uint64_t id_;
   const InstanceSettings settings_;
@@ -104,7 +106,7 @@ class Instance : public std::enable_shared_from_this<Instance> {
   State state_ = State::Created;                 // guarded by mutex_
   std::uint64_t sessions_ = 0;                   // guarded by mutex_
   std::optional<std::filesystem::path> attached_;  // guarded by mutex_
-  std::timed_mutex writeLock_;
+  WriteGate writeGate_;
 };
 
 }  // namespace engine

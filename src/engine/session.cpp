@@ -135,7 +135,7 @@ void Session::beginWrite(const std::source_location& where) {
   checkInstanceLive(where);
   connection(where);
   if (writeLocked_) DB::throwEngineError(DB::err::kInvalidParameter, where);
-  if (!instance_->writeLock().try_lock_for(instance_->settings().busyTimeout)) {
+  if (!instance_->writeGate().enter(instance_->settings().busyTimeout)) {
     DB::throwEngineError(DB::err::kWriteConflict, where);
   }
   writeLocked_ = true;
@@ -179,7 +179,7 @@ void Session::rollback(const std::source_location& where) {
 void Session::releaseWriteLock() noexcept {
   if (!writeLocked_) return;
   writeLocked_ = false;
-  instance_->writeLock().unlock();
+  instance_->writeGate().leave();
 }
 
 std::int64_t Session::lastInsertRowid() const noexcept { return db_ ? sqlite3_last_insert_rowid(db_.get()) : 0; }

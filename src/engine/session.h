@@ -21,8 +21,7 @@
 // transaction is rolled back, the connection is closed (SQLite checkpoints
 // and removes the write-ahead log when the last connection goes) and the
 // instance counts one session less.
-// Thread safety: one thread at a time; a write transaction begins and ends
-// on the same thread.
+// Thread safety: one thread at a time.
 // Failures: DB::DBExc with an engine code and the caller's file and line.
 
 #include <sqlite3.h>
