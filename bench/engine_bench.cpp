@@ -32,6 +32,7 @@
 #include <thread>
 #include <vector>
 
+#include "engine/blob_io.h"
 #include "engine/connection.h"
 #include "engine/db_instances.h"
 #include "engine/session.h"
@@ -223,6 +224,47 @@ double layerRate(const Options& o, int sessions, int dbs) {
   return r;
 }
 
+// The high-water mark of resident memory, reset to the current use.
+std::uint64_t peakResident() {
+  std::ifstream status("/proc/self/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmHWM:", 0) == 0) return std::stoull(line.substr(6)) * 1024;
+  }
+  return 0;
+}
+void resetPeak() { std::ofstream("/proc/self/clear_refs") << "5"; }
+
+// A 256 MiB value written and read through blob I/O: the memory beyond the
+// caller's own buffer stays small.
+void longValue() {
+  constexpr std::size_t kSize = 256 * 1024 * 1024;
+  std::vector<std::byte> value(kSize, std::byte{0x5a});
+  auto session = layerSession("long");
+  session->execute("CREATE TABLE IF NOT EXISTS meta(id BLOB NOT NULL PRIMARY KEY, blob BLOB) STRICT");
+  resetPeak();
+  const auto base = residentBytes();
+  auto start = Clock::now();
+  DB::runInTransaction(*session, [&] {
+    session->prepare("INSERT INTO meta(id, blob) VALUES(?, ?) ON CONFLICT(id) DO UPDATE SET blob = excluded.blob")
+        .bindBlob(1, std::string_view("big"))
+        .bindZeroBlob(2, static_cast<std::int64_t>(kSize))
+        .run();
+    engine::writeBlob(*session, "meta", "blob", *engine::findRowid(*session, "meta", "id", "big"), value);
+  });
+  const double writeSeconds = std::chrono::duration<double>(Clock::now() - start).count();
+  const auto writePeak = peakResident();
+  resetPeak();
+  start = Clock::now();
+  engine::readBlob(*session, "meta", "blob", *engine::findRowid(*session, "meta", "id", "big"), value);
+  const double readSeconds = std::chrono::duration<double>(Clock::now() - start).count();
+  const auto readPeak = peakResident();
+  const auto extra = [&](std::uint64_t peak) { return peak > base ? static_cast<double>(peak - base) / 1048576.0 : 0.0; };
+  std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "write a 256 MiB value", writeSeconds, extra(writePeak));
+  std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "read it back", readSeconds, extra(readPeak));
+  DB::DBInstances::inst()->endSession("long", std::move(session));
+}
+
 void openManySessions(const Options& o) {
   constexpr int kSessions = 1000;
   // A table of 8 MiB, so that a full scan could fill any cache.
@@ -323,6 +365,7 @@ int main(int argc, char** argv) try {
   std::printf("%-40s %12.2f\n\n", "16 databases against 1 session",
               median(measures[5].results) / layer);
 
+  longValue();
   openManySessions(o);
   DB::DBInstances::teardown();
   fs::remove_all(o.dir);
