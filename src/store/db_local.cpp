@@ -1,0 +1,203 @@
+#include "store/db_local.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <set>
+#include <system_error>
+#include <utility>
+
+#include "engine/db_exc.h"
+#include "engine/db_instances.h"
+#include "engine/engine_errors.h"
+#include "engine/transaction.h"
+#include "framework/log.h"
+#include "service/config.h"
+#include "service/names.h"
+#include "store/file_ops.h"
+#include "store/schema.h"
+#include "store/store_exc.h"
+
+namespace DB {
+namespace {
+
+namespace fs = std::filesystem;
+
+DBLocal::CreationHook& creationHook() {
+  static DBLocal::CreationHook hook;
+  return hook;
+}
+
+// The folders from root (exclusive) down to folder that do not exist yet,
+// the deepest last. folder lies below root by construction of the paths.
+std::vector<fs::path> missingFoldersBelow(const std::string& root, const std::string& folder) {
+  std::vector<fs::path> missing;
+  if (root.empty() || folder.size() <= root.size() || folder.compare(0, root.size(), root) != 0) return missing;
+  fs::path level(root);
+  std::size_t start = root.size();
+  while (start < folder.size()) {
+    const auto end = folder.find('/', start);
+    const auto part = folder.substr(start, end == std::string::npos ? std::string::npos : end - start);
+    start = end == std::string::npos ? folder.size() : end + 1;
+    if (part.empty()) continue;
+    level /= part;
+    std::error_code ec;
+    if (!fs::exists(level, ec)) missing.push_back(level);
+  }
+  return missing;
+}
+
+// Removes the folders, deepest first, each only when it is empty: whatever
+// another connection put into one meanwhile (a database of a longer name,
+// a data file) keeps it.
+void removeEmptyFolders(const std::vector<fs::path>& folders) {
+  std::set<fs::path> done;
+  for (auto it = folders.rbegin(); it != folders.rend(); ++it) {
+    if (!done.insert(*it).second) continue;
+    std::error_code ignored;
+    if (fs::is_directory(fs::symlink_status(*it, ignored))) fs::remove(*it, ignored);
+  }
+}
+
+void removeFileAndCompanions(const std::string& file) {
+  std::error_code ignored;
+  for (const char* suffix : {"", "-wal", "-shm", "-journal"}) fs::remove(file + suffix, ignored);
+}
+
+}  // namespace
+
+DBLocal::DBLocal(std::string_view dbName)
+    : name_(folderName(dbName)), folder_(databaseFolder(name_)), dbFile_(mainFile(name_)) {}
+
+DBLocal::~DBLocal() { disconnect(); }
+
+std::uint64_t DBLocal::sessionId() const noexcept { return session_ ? session_->id() : 0; }
+
+engine::Session& DBLocal::session(const std::source_location& where) {
+  if (!session_) throwEngineError(err::kInvalidDatabaseId, where);
+  return *session_;
+}
+
+DBLocal::CreationHook DBLocal::setCreationHookForTesting(CreationHook hook) {
+  return std::exchange(creationHook(), std::move(hook));
+}
+
+bool DBLocal::fileAccessible() const {
+  if (FileOps::current().access(dbFile_.c_str(), R_OK | W_OK) == 0) return true;
+  const int error = errno;
+  if (error == ENOENT || error == ENOTDIR) return false;
+  // Taking such a file for missing would lead to a creation attempt on top
+  // of an existing database; it is the operator's to repair.
+  throw StoreExc(err::kFileAccessDenied, "Database file \"" + dbFile_ + "\" is not accessible (" +
+                                             std::error_code(error, std::generic_category()).message() +
+                                             "); it is left as it is");
+}
+
+bool DBLocal::exists(bool mustExist) {
+  disconnect();
+  const bool found = fileAccessible();
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << (found ? "DB:exists Found existing database in "
+                                                    : "DB:exists No database found in ")
+                                          << name_;
+  }
+  if (mustExist && !found) return false;
+
+  // A failed creation removes the folders it made, and only those; which
+  // they are is known only before the new instance makes its folders.
+  std::vector<fs::path> newFolders;
+  if (!found) {
+    const auto& config = DBConfig::inst();
+    newFolders = missingFoldersBelow(config.DBRoot, folder_);
+    auto logs = missingFoldersBelow(config.DBLogRoot, logFolder(name_));
+    newFolders.insert(newFolders.end(), logs.begin(), logs.end());
+  }
+  const auto pool = DBInstances::inst();
+  bool creationFailed = false;
+  try {
+    session_ = pool->newSession(
+        name_, [&](engine::Session& fresh) { attachOrCreate(*pool, fresh, found, creationFailed); });
+  } catch (...) {
+    if (creationFailed) removeEmptyFolders(newFolders);
+    throw;
+  }
+  openDB();
+  return true;
+}
+
+void DBLocal::attachOrCreate(DBInstances& pool, engine::Session& fresh, bool found, bool& creationFailed) {
+  // Another connection may have created the database since the first
+  // look, its instance closed again meanwhile; under the pool mutex nobody
+  // else creates it now, so a second look decides.
+  if (!found && !fileAccessible()) {
+    createDB(pool, fresh, creationFailed);
+    return;
+  }
+  fresh.attachDatabase(dbFile_);  // kWrnDatabaseAttached is a success too
+  const auto tables = schema::present(fresh);
+  if (!tables.info && !tables.meta) {
+    // A creation that was cut off (a crash) between the file and its
+    // tables: nothing can be in it yet, so the tables are made now.
+    Transaction txn(fresh);
+    schema::create(fresh);
+    txn.commit();
+    Log::Lock(Log::Notice).logStreamLine() << "Tables created in existing empty database \"" << name_ << '"';
+  }
+}
+
+void DBLocal::createDB(DBInstances& pool, engine::Session& fresh, bool& creationFailed) {
+  bool fileIsOurs = true;
+  try {
+    try {
+      fresh.createDatabase(dbFile_);
+    } catch (const DBExc& e) {
+      // The file appeared after the second look: it is somebody's database.
+      if (e.code() == err::kDatabaseDuplicate) fileIsOurs = false;
+      throw;
+    }
+    Transaction txn(fresh);
+    schema::create(fresh);
+    if (creationHook()) creationHook()(fresh);
+    txn.commit();
+  } catch (...) {
+    Log::Lock(Log::Error).logStreamLine() << "Failed to create new database in \"" << name_ << '"';
+    pool.discardInstance(name_, fresh);
+    // Only what this creation made goes: the database file it created and
+    // the folders that did not exist before (removed by exists() when they
+    // are empty). A database file that was there before is never touched.
+    if (fileIsOurs) removeFileAndCompanions(dbFile_);
+    creationFailed = true;
+    throw;
+  }
+  if (g_LogVerbose) Log::Lock(Log::Debug).logStreamLine() << "DB:createDB S:" << fresh.id() << " Created database";
+  Log::Lock(Log::Notice).logStreamLine() << "New database created in \"" << name_ << '"';
+}
+
+void DBLocal::openDB() {
+  auto& s = session();
+  s.openDatabase();
+  const auto tables = schema::present(s);
+  if (!tables.info || !tables.meta) {
+    throw StoreExc(err::kInvalidDatabase, "Database file \"" + dbFile_ + "\" lacks its table \"" +
+                                              (tables.info ? schema::kMetaTable : schema::kInfoTable) + '"');
+  }
+  if (g_LogVerbose) Log::Lock(Log::Debug).logStreamLine() << "DB:openDB S:" << s.id() << " Opened database";
+}
+
+bool DBLocal::disconnect() noexcept {
+  if (!session_) return false;
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:disconnect S:" << session_->id() << " Closing session";
+  }
+  // A store that closes after the service stopped finds no pool: its
+  // session then simply ends.
+  if (const auto pool = DBInstances::existing()) {
+    pool->endSession(name_, std::move(session_));
+  } else {
+    session_.reset();
+  }
+  return true;
+}
+
+}  // namespace DB

@@ -1,0 +1,165 @@
+#pragma once
+// DB::DBLocal: one client database as one client connection sees it.
+//
+// A store is built from the name the client gave and is closed until
+// exists() opens it: then it holds one engine session (from the pool,
+// DBInstances) on the database's instance, with the session's prepared
+// statements standing in for cursors. disconnect() and destruction give the
+// session back. Operations are spread over files by concern:
+//   db_local.cpp      lifecycle: exists, createDB, openDB, disconnect
+//   schema.cpp        the two tables and their creation
+//   meta_blobs.cpp    named values in table "meta" (configuration parts,
+//                     pack contents)
+//   data_files.cpp    plain files below the database folder's "d/"
+//   pack_records.cpp, pack_use.cpp   pack records in table "info"
+//
+// Keys of both tables are byte strings compared as bytes (memcmp order);
+// they are always bound as blobs.
+//
+// Ownership: a store belongs to one connection (Listener::ConnDB) and is
+// never shared; it is movable neither by copy nor by move, since its
+// session is counted in the pool under its key.
+// Thread safety: one thread at a time (the connection's commands run one
+// after another).
+// Failures: DB::DBExc for engine failures and for the store's own refusals
+// (see each member); a closed store refuses the table operations with the
+// engine code kInvalidDatabaseId. Data-file operations need no session.
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <source_location>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "engine/session.h"
+#include "engine/statement.h"
+#include "framework/buffers.h"
+
+namespace DB {
+
+class DBInstances;
+
+class DBLocal {
+ public:
+  // Values at most this long are bound and read whole; longer ones move
+  // through the engine's blob streams, so that the server holds a long
+  // value once, in the caller's buffer, and never a second copy.
+  static constexpr std::int64_t kInlineValueBytes = 64 * 1024;
+
+  // Builds the paths from the name; opens nothing.
+  explicit DBLocal(std::string_view dbName);
+  ~DBLocal();
+  DBLocal(const DBLocal&) = delete;
+  DBLocal& operator=(const DBLocal&) = delete;
+
+  // The database key (folderName of the client's name).
+  const std::string& name() const noexcept { return name_; }
+  // The database folder, ending with "/".
+  const std::string& folder() const noexcept { return folder_; }
+  const std::string& dbFile() const noexcept { return dbFile_; }
+  bool isOpen() const noexcept { return session_ != nullptr; }
+  // The session's number for "S:" in log texts; 0 when closed.
+  std::uint64_t sessionId() const noexcept;
+
+  // ---- Lifecycle -------------------------------------------------------
+  // Gives up an open session first, then finds the database file and opens
+  // the database on a new session, creating the database when it is
+  // missing and mustExist is false. Returns false (and stays closed) only
+  // when the file is missing and mustExist is true.
+  // A database file that exists but cannot be read and written by the
+  // server is reported (kFileAccessDenied) and left alone. A creation that
+  // fails removes only what it made itself and passes its failure on.
+  bool exists(bool mustExist);
+  // Closes the session and gives it back to the pool; false when the store
+  // was closed already. Never throws.
+  bool disconnect() noexcept;
+
+  // ---- Named values (table "meta") --------------------------------------
+  // The value of key; empty when there is no row or the value is empty.
+  MemBuffer loadMetaBlob(const std::string& key);
+  // Inserts or replaces the value of key (in a transaction with retry).
+  // A key longer than 255 bytes, or a value longer than the engine's
+  // length limit, fails with the engine's error.
+  void saveMetaBlob(const void* data, std::uint64_t length, const std::string& key);
+  // Deletes the row of key; true when there was one.
+  bool removeMetaBlob(const std::string& key);
+  // The keys that begin with prefix (every key for the empty prefix), in
+  // byte order.
+  std::vector<std::string> metaBlobsWithPrefix(const std::string& prefix);
+
+  // ---- Data files (below folder() + "d/") --------------------------------
+  // The data folder of an id: folder() + "d/" + id + "/". A pure path rule:
+  // the operations below check id first, callers with ids of their own
+  // (cleanup walks the folder) use it as it is.
+  std::string dataDir(const std::string& id) const;
+  // The whole file; empty when it does not exist or cannot be opened.
+  // Throws "Error reading database file: \"<path>\"" when reading fails.
+  MemBuffer loadDataBlob(const std::string& id, const std::string& file);
+  // Replaces the file whole: readers see either the old or the new
+  // content, and a failed write keeps the old one. Throws "Error writing
+  // to database file: \"<path>\"".
+  void saveDataBlob(const void* data, std::uint64_t length, const std::string& id, const std::string& file);
+  // Copies the data folder of source into that of target, merging into an
+  // existing target and replacing files of the same name. Throws "Error
+  // renaming data folder <source> to <target>" (also when source has no
+  // data folder).
+  // Ids and file names must each be one path component: not empty, not
+  // "." or "..", without "/", "\" or NUL; file names may not begin with
+  // kTempPrefix. Anything else is refused with a DB::DBExc before any file
+  // is touched.
+  void copyDataFolder(const std::string& source, const std::string& target);
+
+  // Names of the files that a write builds before it renames them into
+  // place.
+  static constexpr std::string_view kTempPrefix = ".cvtmp.";
+
+  // ---- Pack records (pack_records.cpp) and pack use (pack_use.cpp) -------
+  // Their declarations go here.
+
+  // ---- For tests -----------------------------------------------------------
+  // Runs inside the creation of a new database, after its tables were made
+  // and before they are committed; a throw fails the creation there.
+  // Returns the previous hook; an empty function removes it.
+  using CreationHook = std::function<void(engine::Session&)>;
+  static CreationHook setCreationHookForTesting(CreationHook hook);
+
+ private:
+  // ---- Helpers shared by the table operations, the pack code included --
+  // The open session; throws kInvalidDatabaseId when the store is closed.
+  engine::Session& session(const std::source_location& where = std::source_location::current());
+
+  // The value stored under key in "meta" (what a seek on the key followed
+  // by reading the "blob" column gives): empty when there is no row or the
+  // value is empty. Inside a write transaction it reads that transaction's
+  // state; outside one, the row as one snapshot.
+  MemBuffer readMeta(std::string_view key);
+  // Inserts or replaces the row of key; runs inside the caller's
+  // transaction, which rolls the row back on failure.
+  void putMeta(std::string_view key, const void* data, std::uint64_t length);
+  // Deletes the row of key inside the caller's transaction; true when there
+  // was one.
+  bool deleteMeta(std::string_view key);
+  // Column `column` of the statement's current row as an owned buffer
+  // (empty for NULL or an empty value); for values of "info", whose length
+  // is bounded by the schema.
+  static MemBuffer retrieveColumn(const engine::Statement& row, int column);
+
+  // ---- Lifecycle internals ---------------------------------------------
+  void openDB();
+  // Both run in the pool's onNewInstance, under the pool mutex. createDB
+  // sets creationFailed before it passes a failure on.
+  void attachOrCreate(DBInstances& pool, engine::Session& session, bool found, bool& creationFailed);
+  void createDB(DBInstances& pool, engine::Session& session, bool& creationFailed);
+  // Whether dbFile may be read and written; throws for a file that exists
+  // but may not.
+  bool fileAccessible() const;
+
+  const std::string name_;
+  const std::string folder_;
+  const std::string dbFile_;
+  std::unique_ptr<engine::Session> session_;
+};
+
+}  // namespace DB
