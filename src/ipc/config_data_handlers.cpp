@@ -2,16 +2,53 @@
 // write its configuration parts and data files, and list the databases.
 
 #include <filesystem>
+#include <memory>
+#include <stdexcept>
+#include <string>
 #include <system_error>
+#include <vector>
 
-#include "ipc/handler_support.h"
 #include "ipc/listener.h"
 #include "service/config.h"
 #include "service/names.h"
+#include "store/db_local.h"
 
 namespace Ipc::DB {
 
-void Listener::process(Connect& cmd) { notAvailableYet(cmd); }
+void Listener::process(Connect& cmd) {
+  const std::string& dbName = cmd.dbName();
+  // A name that would leave the database root, or give an existing
+  // database a second key, is refused before anything is opened or made;
+  // the connection keeps whatever binding it had.
+  if (!::DB::isValidDatabaseName(dbName)) {
+    cmd.setResp("Database name " + dbName + " is not valid");
+    return;
+  }
+  const auto& socket = cmd.socket();
+  if (!socket) throw std::runtime_error("Connect without a connection");
+  std::unique_ptr<Ipc::ConnInf>& slot = socket->connInf();
+  if (const auto* bound = dynamic_cast<const ConnDB*>(slot.get());
+      bound && bound->db.name() == ::DB::folderName(dbName)) {
+    cmd.setResp();  // already bound to this database, open or not
+    return;
+  }
+  // The previous binding goes first, giving its session back; the new one
+  // stays installed, closed, if opening fails below.
+  slot.reset();
+  slot = std::make_unique<ConnDB>(dbName);
+  ::DB::DBLocal& db = static_cast<ConnDB&>(*slot).db;
+  switch (cmd.openMode()) {
+    case 0: db.exists(false); break;
+    case 1:
+      if (!db.exists(true)) {
+        cmd.setResp("Database " + dbName + " does not exist");
+        return;
+      }
+      break;
+    default: break;  // bound without opening
+  }
+  cmd.setResp();
+}
 
 void Listener::process(DBNames& cmd) {
   namespace fs = std::filesystem;
@@ -37,28 +74,35 @@ void Listener::process(DBNames& cmd) {
 }
 
 void Listener::process(GetCfgPart& cmd) {
-  dbOfConn(cmd);
-  notAvailableYet(cmd);
+  const MemBuffer stored = dbOfConn(cmd).loadMetaBlob(cmd.key());
+  if (stored.empty()) {
+    cmd.setResp(json::Value());
+    return;
+  }
+  // Keys are shared with pack contents: bytes that are not a JSON object
+  // make the parser throw, which ends this connection and nothing else.
+  cmd.setResp(json::strToObject(reinterpret_cast<const char*>(stored.data()), stored.size()));
 }
 
 void Listener::process(SetCfgPart& cmd) {
-  dbOfConn(cmd);
-  notAvailableYet(cmd);
+  ::DB::DBLocal& db = dbOfConn(cmd);
+  if (cmd.deleteData()) {
+    db.removeMetaBlob(cmd.key());
+  } else {
+    // The wrapper's compact text, as its stream output writes it.
+    const std::string text = cmd.jCfgData().dump();
+    db.saveMetaBlob(text.data(), text.size(), cmd.key());
+  }
+  cmd.setResp();
 }
 
-void Listener::process(CfgIds& cmd) {
-  dbOfConn(cmd);
-  notAvailableYet(cmd);
-}
+void Listener::process(CfgIds& cmd) { cmd.setResp(dbOfConn(cmd).metaBlobsWithPrefix(cmd.prefix())); }
 
-void Listener::process(GetData& cmd) {
-  dbOfConn(cmd);
-  notAvailableYet(cmd);
-}
+void Listener::process(GetData& cmd) { cmd.setResp(dbOfConn(cmd).loadDataBlob(cmd.id(), cmd.fileName())); }
 
 void Listener::process(SetData& cmd) {
-  dbOfConn(cmd);
-  notAvailableYet(cmd);
+  const SharedMemBuffer& content = cmd.data();
+  dbOfConn(cmd).saveDataBlob(content.data(), content.size(), cmd.id(), cmd.fileName());
 }
 
 }  // namespace Ipc::DB

@@ -6,6 +6,8 @@
 
 namespace Ipc::DB {
 
+Listener::ConnDB::ConnDB(std::string_view dbName) : db(dbName) {}
+
 Listener::ConnDB::~ConnDB() = default;
 
 Listener::Listener(Passkey, Responder respond) : respond_(std::move(respond)) {}
@@ -46,9 +48,9 @@ void Listener::onIpcError(const std::shared_ptr<Ipc::Socket>&, const std::string
   entry.logStreamLine() << "Ipc " << text;
 }
 
-Listener::ConnDB& Listener::dbOfConn(const Ipc::CmdI& cmd) {
+::DB::DBLocal& Listener::dbOfConn(const Ipc::CmdI& cmd) {
   if (const auto& socket = cmd.socket()) {
-    if (auto* conn = dynamic_cast<ConnDB*>(socket->connInf().get())) return *conn;
+    if (auto* conn = dynamic_cast<ConnDB*>(socket->connInf().get())) return conn->db;
   }
   throw std::runtime_error("No database associated with current connection. Connect command failed?");
 }

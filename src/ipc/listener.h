@@ -17,10 +17,12 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "framework/svc_stub.h"
 #include "protocol/commands.h"
 #include "protocol/processor.h"
+#include "store/db_local.h"
 
 namespace Ipc::DB {
 
@@ -28,11 +30,15 @@ class Listener final : public CmdProcessorDBI {
  public:
   // The database binding of one connection, kept in the connection's
   // connInf slot. Created by Connect; destroyed with the connection or when
-  // a Connect for another database replaces it. It will own the
-  // connection's store object (its member db).
+  // a Connect for another database replaces it. It owns the connection's
+  // store (db), built closed from the client's database name; destroying
+  // the binding gives the store's session back.
   class ConnDB : public Ipc::ConnInf {
    public:
+    explicit ConnDB(std::string_view dbName);
     ~ConnDB() override;
+
+    ::DB::DBLocal db;
   };
 
   // Where a processed command goes for its answer: the command server's
@@ -63,10 +69,11 @@ class Listener final : public CmdProcessorDBI {
   // Logs "Ipc " + text (priority 4).
   void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
 
-  // The database binding of the command's connection; throws
-  // std::runtime_error "No database associated with current connection.
-  // Connect command failed?" when the connection has none.
-  static ConnDB& dbOfConn(const Ipc::CmdI& cmd);
+  // The store of the command's connection (its binding's db), looked up
+  // anew by each command; throws std::runtime_error "No database
+  // associated with current connection. Connect command failed?" when the
+  // connection has no binding.
+  static ::DB::DBLocal& dbOfConn(const Ipc::CmdI& cmd);
 
   // Handlers, grouped as their source files are: maintenance, packs,
   // configuration and data.

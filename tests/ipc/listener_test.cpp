@@ -89,10 +89,10 @@ TEST_F(ListenerTest, OnlyTheListenersOwnBindingCountsAsADatabase) {
   } catch (const std::runtime_error& e) {
     EXPECT_STREQ(e.what(), kNoDatabase);
   }
-  auto binding = std::make_unique<Listener::ConnDB>();
+  auto binding = std::make_unique<Listener::ConnDB>("plant");
   Listener::ConnDB* raw = binding.get();
   socket->connInf() = std::move(binding);
-  EXPECT_EQ(&Listener::dbOfConn(*cmd), raw);
+  EXPECT_EQ(&Listener::dbOfConn(*cmd), &raw->db);
 
   GetData unattached;
   EXPECT_THROW(Listener::dbOfConn(unattached), std::runtime_error);
