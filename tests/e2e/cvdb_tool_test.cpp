@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include "support/server_process.h"
+#include "support/temp_dir.h"
 
 namespace {
 
@@ -51,6 +52,38 @@ TEST(CvdbTool, SaysPlainlyWhenTheServerEndsTheConnection) {
   EXPECT_TRUE(has(r, "cvdb: the server ended the connection: Terminating client connection due to processing error"))
       << r.output;
   EXPECT_TRUE(server.waitForLogLine("Dispatching command "));
+}
+
+TEST(CvdbTool, ConfigurationPartsAndDataFilesFromFilesAndBack) {
+  ServerProcess server(kServer);
+  const Tool cvdb{server.port()};
+  testing_support::TempDir dir;
+  std::string bytes(300000, '\0');
+  for (std::size_t i = 0; i < bytes.size(); ++i) bytes[i] = static_cast<char>(i * 7 + 3);
+  testing_support::writeFile(dir / "in.bin", bytes);
+  testing_support::writeFile(dir / "part.json", R"({"columns": ["id", "name"], "width": 3})");
+
+  const auto ok = [](const ServerProcess::Result& r) {
+    EXPECT_EQ(r.status, 0) << r.output;
+    return r.output;
+  };
+  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "set", "layout", "--file", (dir / "part.json").string()}));
+  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "set", "other", R"({"a": 1})"}));
+  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "get", "layout"})),
+            "{\"columns\":[\"id\",\"name\"],\"width\":3}\n");
+  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "ls", "lay"})), "[\"layout\"]\n");
+  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "rm", "layout"}));
+  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "get", "layout"})), "null\n");
+
+  ok(cvdb({"--db", "Plant\\Line 2", "data", "put", "doc-1", "scan.bin", (dir / "in.bin").string()}));
+  ok(cvdb({"--db", "Plant\\Line 2", "data", "get", "doc-1", "scan.bin", "-o", (dir / "out.bin").string()}));
+  EXPECT_EQ(testing_support::readFile(dir / "out.bin"), bytes);
+
+  EXPECT_EQ(ok(cvdb({"--json", "dbs"})), "[\"plant\\\\line 2\"]\n");
+
+  const auto missing = cvdb({"--db", "nowhere", "--open-mode", "1", "cfg", "ls"});
+  EXPECT_EQ(missing.status, 1) << missing.output;
+  EXPECT_TRUE(has(missing, "cvdb: Database nowhere does not exist")) << missing.output;
 }
 
 TEST(CvdbTool, LocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
