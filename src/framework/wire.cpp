@@ -1,5 +1,7 @@
 #include "framework/wire.h"
 
+#include <algorithm>
+
 namespace wire {
 
 void Writer::str(std::string_view s) {
@@ -82,7 +84,10 @@ std::vector<std::string> Reader::strList() {
   // is refused before anything is reserved.
   need(static_cast<std::uint64_t>(count) * 4, "string list");
   std::vector<std::string> list;
-  list.reserve(count);
+  // A std::string costs several times the 4 bytes its length takes on the
+  // wire, so reserving the claimed count could cost far more than the frame;
+  // the vector grows with what actually arrives.
+  list.reserve(std::min<std::uint32_t>(count, 256));
   for (std::uint32_t i = 0; i < count; ++i) list.push_back(str());
   return list;
 }
