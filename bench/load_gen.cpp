@@ -3,6 +3,7 @@
 // throughput and the latency percentiles.
 //
 //   load_gen --port 45678 --connections 50 --seconds 10 --command ping
+//   load_gen --command setcfg --size 100 --connections 50 --databases 16
 //
 // A command is one line in kWorkloads: its name, whether it needs a
 // database, what it does once per connection before the clock starts, and
@@ -26,21 +27,54 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
+// What the commands send, built once from --size: configuration parts
+// whose JSON text is that long, and data-file contents of that length. A
+// writer alternates between the two of a kind, so that every write changes
+// the stored bytes (SQLite skips writing a row whose bytes stay the same,
+// and the commit then has nothing to sync).
+struct Payload {
+  json::Object cfg[2];
+  SharedMemBuffer data[2];
+};
+
+Payload makePayload(std::size_t size) {
+  Payload p;
+  for (int i = 0; i < 2; ++i) {
+    const char fill = i == 0 ? 'x' : 'y';
+    // {"v":"xxx"} is 8 bytes around the string.
+    p.cfg[i] = json::strToObject("{\"v\":\"" + std::string(size > 8 ? size - 8 : 0, fill) + "\"}");
+    p.data[i] = SharedMemBuffer(MemBuffer::copyOf(std::string(size, fill)));
+  }
+  return p;
+}
+
+// Each connection works on a key of its own, so that writers meet only in
+// the database's write lock, not on one row. n counts the connection's
+// operations.
+using Step = std::function<void(cvdb::Client&, const Payload&, const std::string& key, std::uint64_t n)>;
 struct Workload {
   const char* name;
   bool needsDb;
-  std::function<void(cvdb::Client&)> prepare;
-  std::function<void(cvdb::Client&)> op;
+  std::size_t defaultSize;
+  Step prepare;
+  Step op;
 };
 
 const std::vector<Workload> kWorkloads = {
-    {"ping", false, {}, [](cvdb::Client& c) { c.ping(); }},
-    {"dbs", false, {}, [](cvdb::Client& c) { c.dbNames(); }},
-    {"getcfg", true, [](cvdb::Client& c) { c.setCfg("bench", json::strToObject(R"({"a":1})")); },
-     [](cvdb::Client& c) { c.getCfg("bench"); }},
-    {"getdata", true,
-     [](cvdb::Client& c) { c.setData("bench", "4k", SharedMemBuffer(MemBuffer::copyOf(std::string(4096, 'x')))); },
-     [](cvdb::Client& c) { c.getData("bench", "4k"); }},
+    {"ping", false, 0, {}, [](cvdb::Client& c, const Payload&, const std::string&, std::uint64_t) { c.ping(); }},
+    {"dbs", false, 0, {}, [](cvdb::Client& c, const Payload&, const std::string&, std::uint64_t) { c.dbNames(); }},
+    {"getcfg", true, 100,
+     [](cvdb::Client& c, const Payload& p, const std::string& key, std::uint64_t) { c.setCfg(key, p.cfg[0]); },
+     [](cvdb::Client& c, const Payload&, const std::string& key, std::uint64_t) { c.getCfg(key); }},
+    {"setcfg", true, 100, {},
+     [](cvdb::Client& c, const Payload& p, const std::string& key, std::uint64_t n) { c.setCfg(key, p.cfg[n % 2]); }},
+    {"getdata", true, 4096,
+     [](cvdb::Client& c, const Payload& p, const std::string& key, std::uint64_t) { c.setData(key, "file", p.data[0]); },
+     [](cvdb::Client& c, const Payload&, const std::string& key, std::uint64_t) { c.getData(key, "file"); }},
+    {"setdata", true, 4096, {},
+     [](cvdb::Client& c, const Payload& p, const std::string& key, std::uint64_t n) {
+       c.setData(key, "file", p.data[n % 2]);
+     }},
 };
 
 struct Result {
@@ -64,6 +98,8 @@ int main(int argc, char** argv) {
   double seconds = 5;
   std::string command = "ping";
   std::string db = "loadgen";
+  unsigned databases = 1;
+  std::size_t size = 0;
   bool json = false;
   std::vector<std::string> names;
   for (const auto& w : kWorkloads) names.emplace_back(w.name);
@@ -73,12 +109,20 @@ int main(int argc, char** argv) {
   app.add_option("-t,--seconds", seconds, "How long to run")->capture_default_str();
   app.add_option("--command", command, "What to send")->check(CLI::IsMember(names))->capture_default_str();
   app.add_option("--db", db, "Database of the commands that need one")->capture_default_str();
+  app.add_option("--databases", databases,
+                 "Spread the connections over this many databases (--db with -0, -1, ... appended)")
+      ->capture_default_str();
+  app.add_option("--size", size, "Bytes of a configuration part's JSON text or of a data file (0: the command's default)")
+      ->capture_default_str();
   app.add_flag("--json", json, "One JSON object as the result");
   CLI11_PARSE(app, argc, argv);
   if (connections == 0) connections = 1;
+  if (databases == 0) databases = 1;
 
   const Workload& work = *std::find_if(kWorkloads.begin(), kWorkloads.end(),
                                        [&](const Workload& w) { return command == w.name; });
+  if (size == 0) size = work.defaultSize;
+  const Payload payload = makePayload(size);
 
   std::vector<Result> results(connections);
   std::atomic<unsigned> ready{0};
@@ -91,10 +135,12 @@ int main(int argc, char** argv) {
     threads.emplace_back([&, i] {
       Result& r = results[i];
       std::unique_ptr<cvdb::Client> client;
+      const std::string dbName = databases == 1 ? db : db + "-" + std::to_string(i % databases);
+      const std::string key = "bench-" + std::to_string(i);
       try {
         client = std::make_unique<cvdb::Client>(options);
-        if (work.needsDb && !client->connect(db)) throw std::runtime_error("cannot connect to database " + db);
-        if (work.prepare) work.prepare(*client);
+        if (work.needsDb && !client->connect(dbName)) throw std::runtime_error("cannot connect to database " + dbName);
+        if (work.prepare) work.prepare(*client, payload, key, 0);
       } catch (const std::exception& e) {
         r.firstError = e.what();
         setupFailed = true;
@@ -108,11 +154,11 @@ int main(int argc, char** argv) {
         end = deadline;
       }
       r.latenciesNs.reserve(1 << 16);
-      while (true) {
+      for (std::uint64_t n = 0;; ++n) {
         const auto start = Clock::now();
         if (start >= end) break;
         try {
-          work.op(*client);
+          work.op(*client, payload, key, n);
         } catch (const std::exception& e) {
           if (r.errors++ == 0) r.firstError = e.what();
           if (!client->isOpen()) break;
@@ -149,9 +195,9 @@ int main(int argc, char** argv) {
   const double opsPerSec = static_cast<double>(all.size()) / elapsed;
   if (json) {
     std::printf(
-        "{\"command\":\"%s\",\"connections\":%u,\"seconds\":%.3f,\"ops\":%zu,\"ops_per_sec\":%.1f,"
-        "\"p50_us\":%.1f,\"p99_us\":%.1f,\"errors\":%llu}\n",
-        work.name, connections, elapsed, all.size(), opsPerSec, percentile(all, 50), percentile(all, 99),
+        "{\"command\":\"%s\",\"connections\":%u,\"databases\":%u,\"size\":%zu,\"seconds\":%.3f,\"ops\":%zu,"
+        "\"ops_per_sec\":%.1f,\"p50_us\":%.1f,\"p99_us\":%.1f,\"errors\":%llu}\n",
+        work.name, connections, databases, size, elapsed, all.size(), opsPerSec, percentile(all, 50), percentile(all, 99),
         static_cast<unsigned long long>(errors));
   } else {
     std::printf("%s: %u connection(s), %.2f s, %zu ops, %.0f ops/s, p50 %.1f us, p99 %.1f us", work.name,
