@@ -82,12 +82,6 @@ TEST(ServerLifecycle, VerboseLoggingShowsTheServiceSteps) {
   }
 }
 
-TEST(ServerLifecycle, QuietLoggingLeavesTheServiceStepsOut) {
-  ServerProcess server(kServer);
-  ASSERT_EQ(server.stop(), 0);
-  EXPECT_EQ(server.countLogLines("Svc stopp"), 0u);
-}
-
 TEST(ServerLifecycle, APortInUseEndsTheServerWithAFailure) {
   ServerProcess first(kServer);
   ServerOptions o;
