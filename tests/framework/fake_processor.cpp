@@ -77,9 +77,14 @@ void FakeProcessor::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
       record("end:" + c.text);
       cmd->onTransferError("Hung up by the processor");
       return;
-    case kSlot:
+    case kSlot: {
       cmd->socket()->connInf() = std::make_unique<TrackedConnInf>(liveSlots);
+      if (c.text == "keep") {
+        std::lock_guard lock(mutex_);
+        keptSocket = cmd->socket();
+      }
       break;
+    }
     default:
       throw std::logic_error("no behaviour for tag " + std::to_string(c.tag()));
   }

@@ -23,7 +23,7 @@ enum TestTag : std::uint8_t {
   kSilent = 14,      // the processor returns without an answer
   kBig = 15,         // answers as many bytes as its request string says, as a shared tail
   kHangup = 16,      // ends the connection through onTransferError
-  kSlot = 17,        // puts a tracked ConnInf into the connection's slot and answers
+  kSlot = 17,        // puts a tracked ConnInf into the connection's slot ("keep": and keeps the socket)
   kFactoryThrows = 18,
 };
 
@@ -73,6 +73,9 @@ class FakeProcessor final : public Ipc::CmdProcessorI {
   std::atomic<int> processed{0};
   std::atomic<int> disconnects{0};
   std::atomic<int> liveSlots{0};
+  // The socket of the last kSlot "keep" command, kept as a maintenance thread keeps
+  // its command's.
+  std::shared_ptr<Ipc::Socket> keptSocket;
 
   void processCmd(std::shared_ptr<Ipc::CmdI> cmd) override;
   void onDisconnect(const std::shared_ptr<Ipc::Socket>& socket) override;

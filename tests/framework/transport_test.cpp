@@ -399,6 +399,25 @@ TEST_F(TransportTest, DestroyingTheServerStopsIt) {
   expectBye(c, "Server is stopping");
 }
 
+TEST_F(TransportTest, ASocketHeldBeyondTheServerStaysSafeToUse) {
+  {
+    RawClient c(port());
+    c.send(requestBytes(kSlot, strField("keep")));
+    ASSERT_TRUE(c.read());
+    stop();
+  }
+  // What a maintenance thread may still do with its command's socket.
+  auto socket = std::move(proc->keptSocket);
+  ASSERT_TRUE(socket);
+  EXPECT_FALSE(socket->isOpen());
+  socket->send(wire::OutFrame{std::string(8, 'x'), {}});
+  socket->commandDone();
+  socket->close("late");
+  EXPECT_EQ(proc->liveSlots, 1);  // the slot lives as long as the socket
+  socket.reset();
+  EXPECT_EQ(proc->liveSlots, 0);
+}
+
 long residentBytes() {
   std::ifstream statm("/proc/self/statm");
   long pages = 0;
