@@ -30,7 +30,8 @@ namespace Ipc {
 // Builds a command for a tag, or returns null for an unknown tag.
 using CmdFactory = std::function<std::shared_ptr<CmdI>(std::uint8_t tag)>;
 // Receives the transport's problem reports (a null socket for problems that
-// belong to no connection).
+// belong to no connection). Without one, they are logged at priority 4 as
+// "Ipc " + text.
 using IpcErrorHandler = std::function<void(const std::shared_ptr<Socket>&, const std::string&)>;
 
 class SvcStub {
@@ -52,6 +53,8 @@ class SvcStub {
   // listens on IPv6 and IPv4 (a dual-stack socket), else on IPv4 only.
   SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError = {});
   SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError, Options options);
+  // Stops and waits as signalStop() and waitToFinish() do. On one of the
+  // server's own I/O threads it does not wait: the threads end by themselves.
   ~SvcStub();
   SvcStub(const SvcStub&) = delete;
   SvcStub& operator=(const SvcStub&) = delete;
