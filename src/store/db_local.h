@@ -28,6 +28,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <source_location>
 #include <string>
 #include <string_view>
@@ -36,6 +37,8 @@
 #include "engine/session.h"
 #include "engine/statement.h"
 #include "framework/buffers.h"
+#include "framework/json.h"
+#include "protocol/pack_info.h"
 
 namespace DB {
 
@@ -116,7 +119,68 @@ class DBLocal {
   static constexpr std::string_view kTempPrefix = ".cvtmp.";
 
   // ---- Pack records (pack_records.cpp) and pack use (pack_use.cpp) -------
-  // Their declarations go here.
+  // A pack is one row of "info" (id, folder, status, and a JSON object with
+  // the record's other fields and its use list; docs/protocol.md gives the
+  // stored form) and its content: the row of "meta" under the pack's id.
+  // Every read of a stored use list passes Ipc::kUseLimitSeconds, so the
+  // entries of a client that crashed end after seven hours.
+  // Writes run in runInTransaction: a record, its use list and its content
+  // change together or not at all, and a refused request leaves nothing.
+
+  // The records of folder (of every folder when it is empty), ordered by
+  // folder, then status, then id.
+  Ipc::PackInfosPtr infos(const std::string& folder);
+  // The record of id; null when there is none.
+  Ipc::PackInfoPtr infoFor(const std::string& id);
+  // Applies a record that may be partial: a complete one creates a missing
+  // pack; otherwise the fields present are changed and every other stored
+  // field, keys this version does not know included, stays. A use entry in
+  // the request changes the use list (updateUseInfo). Returns the id and
+  // the status as written, with the use list when the request opened the
+  // pack or took its upload lock; null after a CloseEdit for a missing
+  // pack, which is accepted and changes nothing.
+  // Refused with DB::DBExc, writing nothing: a partial record for a missing
+  // pack ("Pack information update attempted for missing record. Id:" and
+  // the id), and the refusals of updateUseInfo.
+  Ipc::PackInfoPtr updateInfo(const Ipc::PackInfo& request);
+  // What updateInfo does, and the content replaces the pack's stored one,
+  // in the same transaction. A CloseEdit for a missing pack stores nothing.
+  void savePackMeta(const Ipc::PackInfo& request, const void* content, std::uint64_t length);
+
+  struct PackMeta {
+    Ipc::PackInfoPtr info;  // null when the pack has no record
+    MemBuffer content;      // empty without a record or content
+  };
+  // The complete record and the content of a pack, read from one snapshot.
+  // With a use entry in the request (open, close, lock, unlock) the use
+  // list is changed first, as updateInfo does, in one transaction with the
+  // read; the record then carries the new list.
+  PackMeta packMetadata(const Ipc::PackInfo& request);
+  // Deletes the record and the content of a pack; nothing happens when it
+  // has no record. Its data files stay (cleanup removes unused ones).
+  void removePack(const std::string& id);
+
+ private:
+  // The record of a row of the pack statements (columns id, folder,
+  // status, blob). Throws json::Exc when the stored object is not JSON.
+  static Ipc::PackInfo readInfo(const engine::Statement& row);
+  // The write that every pack writer shares, inside the caller's
+  // transaction. useUpdate: the caller is a fetch with a use entry, which
+  // wants the complete record back. Returns null only for a CloseEdit on a
+  // missing pack.
+  Ipc::PackInfoPtr upsertInfo(const Ipc::PackInfo& request, bool useUpdate);
+  // Applies the first use entry of the request to the use list inside
+  // stored, and writes the list back (no key when it is empty). Returns the
+  // new list when useUpdate is set or the request opened the pack or took
+  // its lock. Throws DB::DBExc for a lock that another host holds ("Attept
+  // to lock for upload a pack which is already locked from another host.")
+  // and for a release of a lock this host does not hold ("Failed unlock
+  // for upload").
+  std::optional<Ipc::UseInfos> updateUseInfo(json::Object& stored, const Ipc::PackInfo& request, bool useUpdate);
+  // The debug line of one use-list transition; callers test g_LogVerbose.
+  void logUseChange(const std::string& id, std::string_view transition, const Ipc::UseInfo& entry) const;
+
+ public:
 
   // ---- For tests -----------------------------------------------------------
   // Runs inside the creation of a new database, after its tables were made

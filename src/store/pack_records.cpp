@@ -1,0 +1,197 @@
+// Pack records in table "info" and pack contents in table "meta".
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "engine/db_exc.h"
+#include "engine/transaction.h"
+#include "framework/log.h"
+#include "store/db_local.h"
+#include "store/pack_sql.h"
+
+namespace DB {
+namespace {
+
+void logInfoFor(std::uint64_t session, const std::string& id, const Ipc::PackInfoPtr& info) {
+  Log::Lock entry(Log::Debug);
+  auto& line = entry.logStreamLine();
+  line << "DB:infoFor S:" << session;
+  if (info) {
+    line << " Returning " << (info->allValid() ? "full info for " : "info for ") << id;
+  } else {
+    line << " Can not find info for " << id;
+  }
+}
+
+bool isCloseEdit(const Ipc::PackInfo& request) {
+  return !request.uses.empty() && request.uses.front().state == Ipc::UseInfo::CloseEdit;
+}
+
+}  // namespace
+
+Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) {
+  const std::string_view blob = row.columnBytes(3);
+  // Every writer stores an object with the row; an empty value (a row
+  // written by hand) reads as a record without further fields.
+  const json::Object stored = blob.empty() ? json::Object() : json::strToObject(blob);
+  return Ipc::PackInfo(std::string(row.columnBytes(0)), std::string(row.columnBytes(1)),
+                       static_cast<std::int32_t>(row.columnInt64(2)),
+                       Ipc::PackInfoPartial(stored, Ipc::kUseLimitSeconds));
+}
+
+Ipc::PackInfosPtr DBLocal::infos(const std::string& folder) {
+  auto& s = session();
+  auto list = std::make_shared<Ipc::PackInfos>();
+  auto rows = s.prepare(folder.empty() ? pack_sql::kAllInfos : pack_sql::kInfosOfFolder);
+  if (!folder.empty()) rows.bindBlob(1, folder);
+  // One statement: the whole listing comes from one snapshot.
+  while (rows.step()) list->push_back(readInfo(rows));
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:infos S:" << s.id() << " Returning " << list->size()
+                                          << " item(s) for folder \"" << folder << '"';
+  }
+  return list;
+}
+
+Ipc::PackInfoPtr DBLocal::infoFor(const std::string& id) {
+  auto row = session().prepare(pack_sql::kSelectInfo);
+  row.bindBlob(1, id);
+  Ipc::PackInfoPtr info;
+  if (row.step()) info = std::make_shared<Ipc::PackInfo>(readInfo(row));
+  if (g_LogVerbose) logInfoFor(sessionId(), id, info);
+  return info;
+}
+
+Ipc::PackInfoPtr DBLocal::upsertInfo(const Ipc::PackInfo& request, bool useUpdate) {
+  auto& s = session();
+  const std::string& id = request.id();
+
+  // The stored state, read inside the caller's write transaction: no other
+  // writer can change it before this one commits.
+  bool exists = false;
+  std::string storedFolder;
+  std::int32_t storedStatus = Ipc::PackInfoPartial::LONG_INVALID;
+  json::Object stored;
+  {
+    auto row = s.prepare(pack_sql::kSelectInfo);
+    row.bindBlob(1, id);
+    exists = row.step();
+    if (exists) {
+      storedFolder.assign(row.columnBytes(1));
+      storedStatus = static_cast<std::int32_t>(row.columnInt64(2));
+      const std::string_view blob = row.columnBytes(3);
+      if (!blob.empty()) stored = json::strToObject(blob);
+    }
+  }
+  if (!exists && !request.allValid()) {
+    // Closing a pack that is gone is what a client does when it cleans up;
+    // there is nothing to close.
+    if (isCloseEdit(request)) return nullptr;
+    throw DBExc("Pack information update attempted for missing record. Id:" + id);
+  }
+
+  // Only the fields the request carries are written; everything else in
+  // the object (the use list, keys of other versions) stays.
+  request.serializeDBUpdate(stored);
+  std::optional<Ipc::UseInfos> newUses;
+  if (useUpdate || !request.uses.empty()) newUses = updateUseInfo(stored, request, useUpdate);
+
+  const std::string& folder = request.folderValid() ? request.folder() : storedFolder;
+  const std::int32_t status = request.statusValid() ? request.status() : storedStatus;
+  const std::string text = stored.dump();
+  {
+    auto write = s.prepare(exists ? pack_sql::kUpdateInfo : pack_sql::kInsertInfo);
+    write.bindBlob(1, id).bindBlob(2, folder).bindInt64(3, status).bindBlob(4, text);
+    write.run();
+  }
+  if (s.changes() != 1) throw DBExc("Failed to find previously updated/inserted record. Id:" + id);
+
+  if (useUpdate) {
+    return std::make_shared<Ipc::PackInfo>(id, folder, status, Ipc::PackInfoPartial(stored, std::move(*newUses)));
+  }
+  auto result = std::make_shared<Ipc::PackInfo>(id);
+  result->setStatus(status);
+  if (newUses) result->uses = std::move(*newUses);
+  return result;
+}
+
+Ipc::PackInfoPtr DBLocal::updateInfo(const Ipc::PackInfo& request) {
+  Ipc::PackInfoPtr result = runInTransaction(session(), [&] { return upsertInfo(request, false); });
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:updateInfo S:" << sessionId() << " Info for " << request.id()
+                                          << (request.allValid() ? " fully updated" : " updated");
+  }
+  return result;
+}
+
+void DBLocal::savePackMeta(const Ipc::PackInfo& request, const void* content, std::uint64_t length) {
+  const bool stored = runInTransaction(session(), [&] {
+    // No record means a CloseEdit for a missing pack: a content without a
+    // record could be neither fetched nor erased.
+    if (!upsertInfo(request, false)) return false;
+    putMeta(request.id(), content, length);
+    return true;
+  });
+  if (stored && g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:savePackMeta S:" << sessionId() << " Stored pack metadata for "
+                                          << request.id();
+  }
+}
+
+DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
+  const std::string& id = request.id();
+  if (request.uses.empty()) {
+    PackMeta found;
+    auto row = session().prepare(pack_sql::kSelectInfo);
+    row.bindBlob(1, id);
+    if (row.step()) {
+      found.info = std::make_shared<Ipc::PackInfo>(readInfo(row));
+      // The record's statement still stands on its row, so the read
+      // snapshot it opened is still the connection's: the content comes
+      // from the same state as the record, never from a save that
+      // committed in between.
+      found.content = readMeta(id);
+    }
+    if (g_LogVerbose) {
+      logInfoFor(sessionId(), id, found.info);
+      Log::Lock(Log::Debug).logStreamLine() << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for "
+                                            << id;
+    }
+    return found;
+  }
+
+  PackMeta changed = runInTransaction(session(), [&] {
+    PackMeta m;
+    m.info = upsertInfo(request, true);
+    // A pack without record has no content to hand out.
+    if (m.info) m.content = readMeta(id);
+    return m;
+  });
+  if (g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for "
+                                          << id << ". Pack use updated";
+  }
+  return changed;
+}
+
+void DBLocal::removePack(const std::string& id) {
+  auto& s = session();
+  const bool removed = runInTransaction(s, [&] {
+    {
+      auto del = s.prepare(pack_sql::kDeleteInfo);
+      del.bindBlob(1, id);
+      del.run();
+    }
+    // Without a record the key may well be a configuration part's: the
+    // content row goes only with its record.
+    if (s.changes() == 0) return false;
+    deleteMeta(id);
+    return true;
+  });
+  if (removed && g_LogVerbose) {
+    Log::Lock(Log::Debug).logStreamLine() << "DB:removePack S:" << s.id() << " Deleted pack metadata for " << id;
+  }
+}
+
+}  // namespace DB
