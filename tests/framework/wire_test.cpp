@@ -52,11 +52,13 @@ TEST(Wire, LengthsBeyondTheMessageAreRefusedBeforeAllocating) {
 }
 
 TEST(Wire, TruncatedIntegersBadBooleansAndTrailingBytesAreMalformed) {
-  wire::Reader shortInt(std::string("\x01\x02\x03", 3));
+  // Readers do not own their bytes: keep the messages alive.
+  const std::string shortMsg("\x01\x02\x03", 3), badBoolMsg("\x02", 1), trailingMsg("\x01\x02", 2);
+  wire::Reader shortInt(shortMsg);
   EXPECT_THROW(shortInt.u32(), wire::DecodeError);
-  wire::Reader badBool(std::string("\x02", 1));
+  wire::Reader badBool(badBoolMsg);
   EXPECT_THROW(badBool.boolean(), wire::DecodeError);
-  wire::Reader trailing(std::string("\x01\x02", 2));
+  wire::Reader trailing(trailingMsg);
   trailing.u8();
   EXPECT_THROW(trailing.expectEnd(), wire::DecodeError);
 }
