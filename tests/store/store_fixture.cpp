@@ -1,7 +1,5 @@
 #include "store_fixture.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 
 #include "engine/db_instances.h"
@@ -27,22 +25,10 @@ std::unique_ptr<DB::DBLocal> StoreTest::open(const std::string& name) {
   return db;
 }
 
-int FailingFileOps::access(const char* path, int mode) {
-  if (++accesses == access_.nth) {
-    errno = access_.error;
-    return -1;
-  }
-  return FileOps::access(path, mode);
-}
-
 ssize_t FailingFileOps::write(int fd, const void* data, std::size_t size) {
-  if (++writes == write_.nth) {
-    if (write_.partial > 0) return FileOps::write(fd, data, std::min(size, write_.partial));
-    errno = write_.error;
-    return -1;
-  }
-  // After a partial write the next call reports the failure.
-  if (write_.nth > 0 && write_.partial > 0 && writes == write_.nth + 1) {
+  ++writes_;
+  if (writes_ == write_.nth && write_.partial > 0) return FileOps::write(fd, data, std::min(size, write_.partial));
+  if (writes_ == write_.nth + (write_.partial > 0 ? 1 : 0)) {
     errno = write_.error;
     return -1;
   }
@@ -50,19 +36,15 @@ ssize_t FailingFileOps::write(int fd, const void* data, std::size_t size) {
 }
 
 int FailingFileOps::fsync(int fd) {
-  if (++fsyncs == fsync_.nth) {
-    errno = fsync_.error;
-    return -1;
-  }
-  return FileOps::fsync(fd);
+  if (++fsyncs_ != fsync_.nth) return FileOps::fsync(fd);
+  errno = fsync_.error;
+  return -1;
 }
 
 int FailingFileOps::rename(const char* from, const char* to) {
-  if (++renames == rename_.nth) {
-    errno = rename_.error;
-    return -1;
-  }
-  return FileOps::rename(from, to);
+  if (++renames_ != rename_.nth) return FileOps::rename(from, to);
+  errno = rename_.error;
+  return -1;
 }
 
 std::vector<std::string> entries(const std::filesystem::path& folder) {

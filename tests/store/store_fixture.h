@@ -7,9 +7,9 @@
 
 #include <cerrno>
 #include <filesystem>
-#include <functional>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "service/config.h"
 #include "store/db_local.h"
@@ -25,7 +25,6 @@ class StoreTest : public ::testing::Test {
 
   std::string root() const { return dir_.path().string() + "/db/"; }
   std::string logRoot() const { return dir_.path().string() + "/logs/"; }
-
   // A store on the database, opened (and created when missing).
   std::unique_ptr<DB::DBLocal> open(const std::string& name);
 
@@ -35,9 +34,8 @@ class StoreTest : public ::testing::Test {
   std::unique_ptr<DBConfig::TestOverride> override_;
 };
 
-// Real calls, except where a test sets a failure: the n-th call (from 1)
-// of that kind fails with the error; 0 never fails. A write call that
-// fails after `partial` bytes first writes those bytes.
+// Real calls, except that the nth call (from 1) of a kind fails with error;
+// a write that fails after `partial` bytes first writes those bytes.
 class FailingFileOps : public DB::FileOps {
  public:
   struct Failure {
@@ -45,16 +43,17 @@ class FailingFileOps : public DB::FileOps {
     int error = EIO;
     std::size_t partial = 0;
   };
-  Failure write_, fsync_, rename_, access_;
-  int writes = 0, fsyncs = 0, renames = 0, accesses = 0;
+  Failure write_, fsync_, rename_;
 
-  int access(const char* path, int mode) override;
   ssize_t write(int fd, const void* data, std::size_t size) override;
   int fsync(int fd) override;
   int rename(const char* from, const char* to) override;
+
+ private:
+  int writes_ = 0, fsyncs_ = 0, renames_ = 0;
 };
 
-// The names of the entries of a folder, sorted; empty when it is missing.
+// The names in a folder, sorted; empty when it is missing.
 std::vector<std::string> entries(const std::filesystem::path& folder);
 
 }  // namespace store_testing
