@@ -1,0 +1,200 @@
+// Editors and upload locks of a pack: every transition and refusal, the
+// stored form of the list, the age limit that ends a crashed client's
+// entries, and the log lines.
+
+#include <gtest/gtest.h>
+
+#include "engine/db_exc.h"
+#include "pack_test_util.h"
+#include "store_fixture.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using Ipc::PackInfo;
+using Ipc::UseInfo;
+using pack_testing::complete;
+using pack_testing::RawDb;
+using pack_testing::useRequest;
+using store_testing::StoreTest;
+using testing_support::LogCapture;
+using testing_support::VerboseLog;
+
+constexpr const char* kLocked = "Attept to lock for upload a pack which is already locked from another host.";
+constexpr const char* kNotUnlocked = "Failed unlock for upload";
+constexpr std::int64_t kT0 = 1800000000;
+
+// The stored list as (state, host, process) triples, in list order.
+using Entry = std::tuple<int, std::string, std::uint32_t>;
+std::vector<Entry> usesOf(DB::DBLocal& db, const std::string& id) {
+  std::vector<Entry> out;
+  const auto info = db.infoFor(id);
+  for (const UseInfo& u : info->uses) out.emplace_back(u.state, u.host, u.process);
+  return out;
+}
+
+std::string refusal(const std::function<void()>& op) {
+  try {
+    op();
+  } catch (const DB::DBExc& e) {
+    return e.what();
+  }
+  return "(accepted)";
+}
+
+class PackUse : public StoreTest {
+ protected:
+  PackUse() {
+    db = open("u");
+    db->savePackMeta(complete("P", "f", 1), "content", 7);
+  }
+  std::unique_ptr<DB::DBLocal> db;
+  Ipc::FixedUseClock clock{kT0};
+
+  Ipc::PackInfoPtr fetch(UseInfo::State state, const std::string& host, std::uint32_t process = 7) {
+    return db->packMetadata(useRequest("P", state, host, process)).info;
+  }
+};
+
+TEST_F(PackUse, EditorsArePerHostAndProcessAndTheKeyGoesWithTheLastOne) {
+  using E = std::vector<Entry>;
+  fetch(UseInfo::OpenForEdit, "ws-1", 10);
+  fetch(UseInfo::OpenForEdit, "ws-1", 11);
+  const auto third = fetch(UseInfo::OpenForEdit, "ws-1", 10);  // not merged
+  // A fetch with a use entry answers the complete record with the new list.
+  ASSERT_NE(third, nullptr);
+  EXPECT_TRUE(third->allValid());
+  EXPECT_EQ(third->uses.size(), 3u);
+  EXPECT_EQ(third->uses[0].time, kT0);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-1", 10}, {0, "ws-1", 11}, {0, "ws-1", 10}}));
+
+  fetch(UseInfo::CloseEdit, "ws-1", 10);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-1", 11}, {0, "ws-1", 10}}));
+  // Nobody of that host and process, or another host: no change, no fault.
+  fetch(UseInfo::CloseEdit, "ws-1", 12);
+  fetch(UseInfo::CloseEdit, "ws-2", 11);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-1", 11}, {0, "ws-1", 10}}));
+
+  RawDb raw(db->dbFile());
+  EXPECT_TRUE(raw.object("P").has("uses"));
+  fetch(UseInfo::CloseEdit, "ws-1", 10);
+  fetch(UseInfo::CloseEdit, "ws-1", 11);
+  EXPECT_TRUE(usesOf(*db, "P").empty());
+  EXPECT_FALSE(raw.object("P").has("uses"));
+  EXPECT_EQ(db->infoFor("P")->name, "name");
+}
+
+TEST_F(PackUse, TheUploadLockBelongsToOneHostAndARefusalLeavesNoTrace) {
+  using E = std::vector<Entry>;
+  fetch(UseInfo::OpenForEdit, "ws-9", 1);
+  fetch(UseInfo::LockForUpload, "scan-A", 5);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}, {2, "scan-A", 5}}));
+
+  // Host B's save, with new fields and content, is refused whole.
+  PackInfo fromB = complete("P", "other", 8, "by B");
+  fromB.uses.append(UseInfo(UseInfo::LockForUpload, "scan-B", "b", 6));
+  RawDb raw(db->dbFile());
+  const auto before = raw.blob("P");
+  EXPECT_EQ(refusal([&] { db->savePackMeta(fromB, "B's", 3); }), kLocked);
+  EXPECT_EQ(refusal([&] { db->updateInfo(fromB); }), kLocked);
+  EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "scan-B"); }), kLocked);
+  EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "SCAN-A"); }), kLocked);  // hosts are exact bytes
+  EXPECT_EQ(raw.blob("P"), before);
+  EXPECT_EQ(db->packMetadata(PackInfo("P")).content.view(), "content");
+  EXPECT_EQ(db->infoFor("P")->folder(), "f");
+
+  // The same host renews the lock: one entry, the later time; another
+  // process of that host takes it over.
+  clock.advance(60);
+  fetch(UseInfo::LockForUpload, "scan-A", 9);
+  const auto list = db->infoFor("P")->uses;
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}, {2, "scan-A", 9}}));
+  EXPECT_EQ(list[1].time, kT0 + 60);
+
+  // Only the holder's host releases it; a release without lock is refused.
+  EXPECT_EQ(refusal([&] { fetch(UseInfo::EndUpload, "scan-B"); }), kNotUnlocked);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}, {2, "scan-A", 9}}));
+  fetch(UseInfo::EndUpload, "scan-A", 1234);
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}}));
+  EXPECT_EQ(refusal([&] { fetch(UseInfo::EndUpload, "scan-A"); }), kNotUnlocked);
+  // Now B may.
+  fetch(UseInfo::LockForUpload, "scan-B");
+  EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}, {2, "scan-B", 7}}));
+}
+
+TEST_F(PackUse, ALockOlderThanSevenHoursNoLongerBlocksAnotherHost) {
+  fetch(UseInfo::LockForUpload, "crashed");
+  fetch(UseInfo::OpenForEdit, "crashed", 3);
+  clock.advance(Ipc::kUseLimitSeconds);
+  // Exactly at the limit the entries still count.
+  EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "scan-B"); }), kLocked);
+  EXPECT_EQ(db->infoFor("P")->uses.size(), 2u);
+
+  clock.advance(1);
+  EXPECT_TRUE(db->infoFor("P")->uses.empty());  // every read applies the limit
+  const auto taken = fetch(UseInfo::LockForUpload, "scan-B");
+  ASSERT_EQ(taken->uses.size(), 1u);
+  EXPECT_EQ(taken->uses[0].host, "scan-B");
+  // The old entries are gone from the stored list too.
+  RawDb raw(db->dbFile());
+  EXPECT_EQ(raw.object("P").get("uses").dump().find("crashed"), std::string::npos);
+}
+
+TEST_F(PackUse, AnUpdateAnswersTheListOnlyWhenItOpenedOrLocked) {
+  PackInfo open = useRequest("P", UseInfo::OpenForEdit, "ws-1");
+  open.setStatus(3);
+  const auto opened = db->updateInfo(open);
+  EXPECT_EQ(opened->status(), 3);
+  EXPECT_FALSE(opened->folderValid());
+  EXPECT_EQ(opened->name, Ipc::PackInfoPartial::STR_INVALID);
+  ASSERT_EQ(opened->uses.size(), 1u);
+  EXPECT_EQ(opened->uses[0].host, "ws-1");
+
+  const auto closed = db->updateInfo(useRequest("P", UseInfo::CloseEdit, "ws-1"));
+  EXPECT_EQ(closed->status(), 3);
+  EXPECT_TRUE(closed->uses.empty());
+
+  // A state that asks for nothing changes nothing, on every path.
+  fetch(UseInfo::OpenForEdit, "ws-2");
+  const auto odd = db->packMetadata(useRequest("P", static_cast<UseInfo::State>(1), "ws-3")).info;
+  ASSERT_EQ(odd->uses.size(), 1u);
+  EXPECT_EQ(odd->uses[0].host, "ws-2");
+  EXPECT_TRUE(db->updateInfo(useRequest("P", static_cast<UseInfo::State>(55), "ws-3"))->uses.empty());
+  EXPECT_EQ(db->infoFor("P")->uses.size(), 1u);
+}
+
+TEST_F(PackUse, EveryTransitionIsLoggedWithItsEntryWhenVerbose) {
+  VerboseLog verbose;
+  LogCapture log;
+  const auto s = "DB:updateUseInfo S:" + std::to_string(db->sessionId()) + " Pack P ";
+  db->packMetadata(useRequest("P", UseInfo::OpenForEdit, "ws-1", 0, ""));  // the server's own tools
+  fetch(UseInfo::OpenForEdit, "ws-1", 42);
+  fetch(UseInfo::CloseEdit, "ws-1", 42);
+  fetch(UseInfo::CloseEdit, "ws-1", 43);
+  fetch(UseInfo::LockForUpload, "A", 1);
+  fetch(UseInfo::LockForUpload, "A", 2);
+  refusal([&] { fetch(UseInfo::LockForUpload, "B", 3); });
+  refusal([&] { fetch(UseInfo::EndUpload, "B", 4); });
+  fetch(UseInfo::EndUpload, "A", 5);
+  const std::vector<std::string> expected = {
+      s + "opened for edit host \"ws-1\" CVSvc",
+      s + "opened for edit host \"ws-1\" user \"u\" process 42",
+      s + "closed host \"ws-1\" user \"u\" process 42",
+      s + "close requested but lock not found host \"ws-1\" user \"u\" process 43",
+      s + "sheduled for upload by host \"A\" user \"u\" process 1",
+      s + "updating old upload lock by host \"A\" user \"u\" process 1",
+      s + "sheduled for upload by host \"A\" user \"u\" process 2",
+      s + "upload request denied - already uploading host \"B\" user \"u\" process 3",
+      s + "failed to end upload host \"B\" user \"u\" process 4",
+      s + "ended upload host \"A\" user \"u\" process 5",
+  };
+  std::vector<std::string> seen;
+  for (const auto& e : log.entries()) {
+    if (e.text.find("DB:updateUseInfo") == std::string::npos) continue;
+    EXPECT_EQ(e.priority, Log::Debug);
+    seen.push_back(e.text.substr(e.text.find("DB:updateUseInfo")));
+  }
+  EXPECT_EQ(seen, expected);
+}
+
+}  // namespace
