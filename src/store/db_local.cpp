@@ -188,7 +188,11 @@ void DBLocal::openDB() {
 bool DBLocal::disconnect() noexcept {
   if (!session_) return false;
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:disconnect S:" << session_->id() << " Closing session";
+    try {
+      Log::Lock(Log::Debug).logStreamLine() << "DB:disconnect S:" << session_->id() << " Closing session";
+    } catch (const std::exception&) {
+      // Out of memory for a debug line: the session is given back anyway.
+    }
   }
   // A store that closes after the service stopped finds no pool: its
   // session then simply ends.
