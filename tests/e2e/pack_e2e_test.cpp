@@ -14,13 +14,11 @@ namespace {
 using namespace std::chrono_literals;
 using Ipc::PackInfo;
 using Ipc::UseInfo;
-using testing_support::ServerOptions;
 using testing_support::ServerProcess;
 
 const char* const kServer = CVDB_SERVER_PATH;
 const char* const kTool = CVDB_TOOL_PATH;
 constexpr const char* kTerminating = "Terminating client connection due to processing error";
-constexpr const char* kLocked = "Attept to lock for upload a pack which is already locked from another host.";
 
 std::unique_ptr<cvdb::Client> connectedTo(const ServerProcess& server, const std::string& db) {
   cvdb::ClientOptions o;
@@ -56,107 +54,63 @@ UseInfo use(UseInfo::State state, const std::string& host, std::uint32_t process
   return UseInfo(state, host, "user", process);
 }
 
-TEST(PackEndToEnd, EveryPackCommandThroughTheClientLibrary) {
+// What the store tests cannot show: the answers as they cross the wire
+// (null records, a long content handed over as the frame's tail, the use
+// list of a fetch), ChangeDocId, and a refusal ending only its connection.
+TEST(PackEndToEnd, PackCommandsThroughTheClientLibrary) {
   ServerProcess server(kServer);
   auto c = connectedTo(server, "Packs");
-
   EXPECT_EQ(c->packInfo("P1"), nullptr);
   EXPECT_TRUE(c->packInfos().empty());
   const auto none = c->getPack("P1");
   EXPECT_EQ(none.info, nullptr);
   EXPECT_TRUE(none.content.empty());
 
-  // A content beyond the size that the store binds whole.
   std::string big(300000, '\0');
   std::mt19937 gen(3);
   for (auto& ch : big) ch = static_cast<char>(gen());
   const PackInfo p1 = complete("P1", "inbox", 2, "first");
   c->savePack(p1, bytes(big));
   c->savePack(complete("P2", "inbox", 1, "second"), {});
-  c->savePack(complete("P3", "archive", 0, "third"), bytes("x"));
-  ASSERT_NE(c->packInfo("P1"), nullptr);
   EXPECT_EQ(*c->packInfo("P1"), p1);
-
-  std::vector<std::string> ids;
-  for (const auto& p : c->packInfos("inbox")) ids.push_back(p.id());
-  EXPECT_EQ(ids, (std::vector<std::string>{"P2", "P1"}));
-  ids.clear();
-  for (const auto& p : c->packInfos()) ids.push_back(p.id());
-  EXPECT_EQ(ids, (std::vector<std::string>{"P3", "P2", "P1"}));
-
+  EXPECT_EQ(c->packInfos("inbox").size(), 2u);
   const auto fetched = c->getPack("P1");
-  ASSERT_NE(fetched.info, nullptr);
   EXPECT_EQ(*fetched.info, p1);
   EXPECT_EQ(fetched.content.view(), big);
-  const auto empty = c->getPack("P2");
-  ASSERT_NE(empty.info, nullptr);
-  EXPECT_TRUE(empty.content.empty());
+  EXPECT_TRUE(c->getPack("P2").content.empty());
 
-  // A partial update answers the id and the status as written.
   PackInfo status("P1");
   status.setStatus(7);
   const auto updated = c->updatePackInfo(status);
-  ASSERT_NE(updated, nullptr);
   EXPECT_EQ(updated->status(), 7);
   EXPECT_FALSE(updated->folderValid());
-  EXPECT_EQ(c->packInfo("P1")->name, "first");
 
-  // Open, lock and release in the fetch; the answer carries the new list.
   const auto opened = c->getPack("P1", use(UseInfo::OpenForEdit, "ws-1", 40));
   ASSERT_EQ(opened.info->uses.size(), 1u);
   EXPECT_EQ(opened.info->uses[0].host, "ws-1");
   EXPECT_NE(opened.info->uses[0].time, UseInfo::TIME_INVALID);
+  EXPECT_EQ(opened.info->status(), 7);
   EXPECT_EQ(opened.content.view(), big);
-  EXPECT_EQ(c->getPack("P1", use(UseInfo::LockForUpload, "scan-1")).info->uses.size(), 2u);
-  EXPECT_EQ(c->getPack("P1", use(UseInfo::EndUpload, "scan-1")).info->uses.size(), 1u);
-  EXPECT_EQ(c->getPack("P1", use(UseInfo::CloseEdit, "ws-1", 40)).info->uses.size(), 0u);
   EXPECT_EQ(c->getPack("gone", use(UseInfo::CloseEdit, "ws-1", 40)).info, nullptr);
 
   c->erasePack("P1");
   c->erasePack("P1");
   EXPECT_EQ(c->packInfo("P1"), nullptr);
-  EXPECT_TRUE(c->getPack("P1").content.empty());
-  EXPECT_EQ(c->packInfos().size(), 2u);
 
-  // A document's data files move to a new id by copy.
   c->setData("doc-1", "page.tif", bytes("tiff"));
   c->changeDocId("doc-1", "doc-2");
   EXPECT_EQ(c->getData("doc-2", "page.tif").view(), "tiff");
-  EXPECT_EQ(c->getData("doc-1", "page.tif").view(), "tiff");
-  EXPECT_EQ(endedBy([&] { c->changeDocId("no-such-doc", "doc-3"); }), kTerminating);
-  EXPECT_TRUE(server.waitForLogLine("Dispatching command ChangeDocId failed with Error renaming data folder no-such-doc"));
-}
 
-TEST(PackEndToEnd, RefusedRequestsEndOnlyTheirConnectionAndStoreNothing) {
-  ServerProcess server(kServer);
-  auto a = connectedTo(server, "Packs");
-  a->savePack(complete("P", "f", 1, "kept"), bytes("kept content"));
-  a->getPack("P", use(UseInfo::LockForUpload, "scan-A"));
-
-  auto b = connectedTo(server, "Packs");
-  PackInfo fromB = complete("P", "g", 5, "by B");
-  fromB.uses.append(use(UseInfo::LockForUpload, "scan-B"));
-  EXPECT_EQ(endedBy([&] { b->savePack(fromB, bytes("B's content")); }), kTerminating);
-  EXPECT_TRUE(server.waitForLogLine(std::string("Dispatching command SavePack failed with ") + kLocked));
-
-  auto b2 = connectedTo(server, "Packs");
-  EXPECT_EQ(endedBy([&] { b2->getPack("P", use(UseInfo::EndUpload, "scan-B")); }), kTerminating);
-  EXPECT_TRUE(server.waitForLogLine("Dispatching command GetPack failed with Failed unlock for upload"));
-
-  auto b3 = connectedTo(server, "Packs");
+  // A refusal ends its own connection and no other.
+  auto other = connectedTo(server, "Packs");
   PackInfo partial("new");
   partial.setStatus(1);
-  EXPECT_EQ(endedBy([&] { b3->updatePackInfo(partial); }), kTerminating);
+  EXPECT_EQ(endedBy([&] { other->updatePackInfo(partial); }), kTerminating);
   EXPECT_TRUE(server.waitForLogLine(
       "Dispatching command UpdatePackInfo failed with Pack information update attempted for missing record. Id:new"));
-
-  const auto seen = a->getPack("P");
-  EXPECT_EQ(seen.content.view(), "kept content");
-  EXPECT_EQ(seen.info->name, "kept");
-  EXPECT_EQ(seen.info->folder(), "f");
-  ASSERT_EQ(seen.info->uses.size(), 1u);
-  EXPECT_EQ(seen.info->uses[0].host, "scan-A");
-  EXPECT_EQ(a->packInfo("new"), nullptr);
+  EXPECT_EQ(endedBy([&] { c->changeDocId("no-such-doc", "doc-3"); }), kTerminating);
+  EXPECT_TRUE(server.waitForLogLine("Dispatching command ChangeDocId failed with Error renaming data folder no-such-doc"));
+  EXPECT_EQ(connectedTo(server, "Packs")->packInfos().size(), 1u);
 }
 
 struct Tool {
