@@ -1,5 +1,6 @@
 #include "framework/connection.h"
 
+#include <boost/asio/defer.hpp>
 #include <boost/asio/post.hpp>
 #include <boost/asio/write.hpp>
 #include <cstring>
@@ -63,16 +64,21 @@ Connection::~Connection() {
 }
 
 template <typename F>
-void Connection::onStrand(F&& f) {
+void Connection::onStrand(F&& f, bool last) {
   if (socket_.get_executor().running_in_this_thread()) {
     if (!finished_) f();
     return;
   }
   std::lock_guard lock(postMutex_);
   if (!accepting_) return;
-  asio::post(socket_.get_executor(), [self = shared_from_this(), f = std::forward<F>(f)]() mutable {
+  auto task = [self = shared_from_this(), f = std::forward<F>(f)]() mutable {
     if (!self->finished_) f();
-  });
+  };
+  if (last) {
+    asio::defer(socket_.get_executor(), std::move(task));
+  } else {
+    asio::post(socket_.get_executor(), std::move(task));
+  }
 }
 
 void Connection::start() {
@@ -106,10 +112,14 @@ void Connection::commandDone() {
 }
 
 void Connection::respond(wire::OutFrame answer) {
-  onStrand([this, f = std::move(answer)]() mutable {
-    enqueue(std::move(f));
-    endCommand();
-  });
+  // Called as the command's last step: deferred, the answer is written by
+  // this same thread as soon as the command returns.
+  onStrand(
+      [this, f = std::move(answer)]() mutable {
+        enqueue(std::move(f));
+        endCommand();
+      },
+      true);
 }
 
 void Connection::endCommand() {
@@ -307,12 +317,18 @@ void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_
   answered_ = false;
   inFlight_ = cmd.get();
   processor_ = processor;
-  auto self = shared_from_this();
-  const bool queued = core_->workers.submit([self, cmd, processor] { self->runOnWorker(cmd, processor); });
-  if (!queued) close("Server is stopping");
+  // The command runs on this thread once the strand's handler has returned
+  // (a deferred task is not handed to another thread), but outside the
+  // strand: the connection's writes, timers and closing go on meanwhile.
+  asio::defer(core_->io.get_executor(),
+              [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
 }
 
-void Connection::runOnWorker(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+  // Closed before it started (the server is stopping): nobody waits for it.
+  if (!open_.load()) return;
+  // Another thread takes over the other connections if this one blocks.
+  IoPool::Busy busy(core_->threads);
   try {
     processor->processCmd(cmd);
   } catch (const std::exception& e) {

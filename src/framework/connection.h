@@ -2,8 +2,9 @@
 // Internal to the transport: one client connection.
 //
 // Reads request frames, turns each into a command through the factory and
-// hands it to a worker (or answers it at once when it has no processor),
-// reading no further request until the command is done; queues outgoing
+// runs it on an I/O thread outside the connection's strand (or answers it
+// at once when it has no processor), reading no further request until the
+// command is done; queues outgoing
 // frames and writes them with gather writes; ends itself on malformed or
 // stalled frames, on a processor's request, on the peer's end and when the
 // server stops.
@@ -84,9 +85,12 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
 
  private:
   // Runs f on the strand: at once when already there, else queued. Does
-  // nothing once the connection has finished.
+  // nothing once the connection has finished. With last, the caller is
+  // about to return to the I/O context, which then runs f on the same
+  // thread instead of waking another (only when called from an I/O thread;
+  // from others it is queued as usual).
   template <typename F>
-  void onStrand(F&& f);
+  void onStrand(F&& f, bool last = false);
 
   // Strand only, from here on.
   bool partialFrame() const noexcept { return inBody_ || stageEnd_ > stageBegin_; }
@@ -100,7 +104,8 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void parse();
   void handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size);
   void runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
-  void runOnWorker(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
+  // Not on the strand: runs the command in a busy scope of the I/O pool.
+  void execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
   void settleAfterEof();
 
   void enqueue(wire::OutFrame frame);

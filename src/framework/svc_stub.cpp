@@ -1,11 +1,8 @@
 #include "framework/svc_stub.h"
 
 #include <boost/asio/executor_work_guard.hpp>
-#include <algorithm>
 #include <mutex>
 #include <optional>
-#include <thread>
-#include <vector>
 
 #include "framework/acceptor.h"
 #include "framework/connection.h"
@@ -17,29 +14,6 @@ namespace {
 
 using WorkGuard = boost::asio::executor_work_guard<boost::asio::io_context::executor_type>;
 
-// The server whose I/O thread this is, if any: such a thread must not wait
-// for the I/O threads to end.
-thread_local const detail::ServerCore* tIoThreadOf = nullptr;
-
-void ioThreadMain(const std::shared_ptr<detail::ServerCore>& core) {
-  tIoThreadOf = core.get();
-  for (;;) {
-    try {
-      core->io.run();
-      return;
-    } catch (const std::exception& e) {
-      core->report(nullptr, std::string("Unexpected failure in an I/O thread: ") + e.what());
-    } catch (...) {
-      core->report(nullptr, "Unexpected failure in an I/O thread");
-    }
-  }
-}
-
-unsigned ioThreadCount(unsigned asked) {
-  if (asked > 0) return asked;
-  return std::max(2u, std::thread::hardware_concurrency());
-}
-
 }  // namespace
 
 class SvcStub::Impl {
@@ -49,17 +23,15 @@ class SvcStub::Impl {
         acceptor_(std::make_shared<detail::Acceptor>(core_)),
         work_(std::in_place, core_->io.get_executor()) {
     const bool ip4Only = acceptor_->open(port, forceIp4);
-    const unsigned count = ioThreadCount(options.ioThreads);
     try {
-      for (unsigned i = 0; i < count; ++i) {
-        threads_.emplace_back([core = core_] { ioThreadMain(core); });
-      }
+      // The threads keep the core, and with it the I/O context, alive.
+      core_->threads.start(std::shared_ptr<boost::asio::io_context>(core_, &core_->io));
     } catch (...) {
       acceptor_->stop();
       bool first = false;
       core_->beginStop(&first);
       work_.reset();
-      for (auto& t : threads_) t.join();
+      core_->threads.join();
       throw;
     }
     acceptor_->start();
@@ -86,22 +58,14 @@ class SvcStub::Impl {
   void waitToFinish() {
     std::lock_guard lock(waitMutex_);
     if (finished_) return;
-    const bool onOwnThread = tIoThreadOf == core_.get();
     // Connections end within their close grace; an I/O thread of ours would
     // be waiting for itself, so it only stops what it can.
-    if (!onOwnThread) core_->waitUntilEmpty();
-    // Commands still running are short (a handler's store call); they are
-    // waited for. Commands queued behind them belong to ended connections.
-    core_->workers.shutdown();
+    if (!core_->threads.runningInThisThread()) core_->waitUntilEmpty();
+    // The threads end when the I/O context runs out of work: after the
+    // commands that are running (they are short: a handler's store call).
+    // Commands not yet started belong to closed connections and are dropped.
     work_.reset();
-    for (auto& t : threads_) {
-      if (t.get_id() == std::this_thread::get_id()) {
-        t.detach();  // the thread keeps the shared state alive
-      } else {
-        t.join();
-      }
-    }
-    threads_.clear();
+    core_->threads.join();
     finished_ = true;
   }
 
@@ -111,7 +75,6 @@ class SvcStub::Impl {
   std::shared_ptr<detail::ServerCore> core_;
   std::shared_ptr<detail::Acceptor> acceptor_;
   std::optional<WorkGuard> work_;
-  std::vector<std::thread> threads_;
   std::mutex waitMutex_;
   bool finished_ = false;  // guarded by waitMutex_
 };

@@ -7,10 +7,11 @@
 // returns once every connection is closed and every command that was being
 // processed has ended.
 //
-// Threads: socket I/O runs on a few I/O threads; commands run on an elastic
-// pool of worker threads, one command of a connection at a time, so a
-// command that blocks stalls neither its I/O thread nor other connections.
-// Every member may be called from any thread.
+// Threads: socket I/O and commands run on an elastic set of I/O threads,
+// one command of a connection at a time. Whenever a command would leave no
+// thread free for the other connections, another thread is started, so a
+// command that blocks stalls no other connection. Every member may be
+// called from any thread.
 // Failures: malformed frames, stalled frames and exhausted resources end the
 // connection concerned (or refuse it) and are reported through the IPC error
 // handler; they never affect other connections.
@@ -23,7 +24,6 @@
 
 #include "framework/cmd.h"
 #include "framework/frame.h"
-#include "framework/worker_pool.h"
 
 namespace Ipc {
 
@@ -44,9 +44,17 @@ class SvcStub {
     // How long a closing connection waits for its Bye frame to go out and
     // for the peer to close before the socket is closed anyway.
     std::chrono::milliseconds closeGrace{500};
-    // Socket I/O threads; 0 means as many as cores, at least 2.
+    // I/O threads kept for the server's life; 0 means as many as cores, at
+    // least 2. More are started while commands occupy them all.
     unsigned ioThreads = 0;
-    WorkerPool::Options workers{4, 2048, std::chrono::milliseconds(30000)};
+    // Most threads at once; beyond, connections wait for a command to end.
+    std::size_t maxThreads = 2048;
+    // A thread beyond ioThreads that has run nothing for this long ends.
+    std::chrono::milliseconds spareIdle{30000};
+    // When every I/O thread has been in commands this long and none has
+    // finished one, another thread is started: the longest that other
+    // connections wait for blocked commands.
+    std::chrono::microseconds blockedAfter{1000};
   };
 
   // port 0 binds a free port (see port()). With forceIp4 false the server

@@ -1,13 +1,25 @@
 #include "framework/transport_core.h"
 
+#include <algorithm>
+#include <thread>
+
 #include "framework/log.h"
 
 namespace Ipc::detail {
+namespace {
+
+unsigned ioThreadCount(unsigned asked) {
+  if (asked > 0) return asked;
+  return std::max(2u, std::thread::hardware_concurrency());
+}
+
+}  // namespace
 
 ServerCore::ServerCore(const SvcStub::Options& opts, CmdFactory f, IpcErrorHandler onError)
     : options(opts),
       factory(std::move(f)),
-      workers(opts.workers, [this](const std::string& text) { report(nullptr, text); }),
+      threads(IoPool::Options{ioThreadCount(opts.ioThreads), opts.maxThreads, opts.spareIdle, opts.blockedAfter},
+              [this](const std::string& text) { report(nullptr, text); }),
       onError_(std::move(onError)) {}
 
 void ServerCore::report(const std::shared_ptr<Socket>& socket, const std::string& text) const noexcept {

@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "framework/svc_stub.h"
-#include "framework/worker_pool.h"
+#include "framework/io_pool.h"
 
 namespace Ipc::detail {
 
@@ -33,7 +33,8 @@ class ServerCore {
   boost::asio::io_context io;
   const SvcStub::Options options;
   const CmdFactory factory;
-  WorkerPool workers;
+  // The threads that run io, and the commands.
+  IoPool threads;
 
   // Hands a problem to the error handler (or logs it when there is none).
   // Never throws.

@@ -70,7 +70,6 @@ Ipc::SvcStub::Options shortTimeouts() {
   o.stallTimeout = 300ms;
   o.closeGrace = 300ms;
   o.ioThreads = 2;
-  o.workers.keep = 2;
   return o;
 }
 
@@ -295,6 +294,30 @@ TEST_F(TransportTest, CommandsOfOneConnectionRunInOrderWhileOthersGoOn) {
   const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
   EXPECT_LT(pos("start:b1"), pos("end:a1"));
   EXPECT_LT(pos("end:a1"), pos("start:a2"));
+}
+
+TEST_F(TransportTest, CommandsBlockingEveryIoThreadAtOnceStallNoOtherConnection) {
+  // Twice as many blocked commands as the server has I/O threads.
+  std::vector<RawClient> blocked;
+  for (int i = 0; i < 4; ++i) {
+    blocked.emplace_back(port());
+    blocked.back().send(requestBytes(kBlock, strField("b" + std::to_string(i))));
+  }
+  for (int i = 0; i < 4; ++i) ASSERT_TRUE(proc->waitStarted("b" + std::to_string(i)));
+
+  RawClient other(port());
+  EXPECT_TRUE(other.ping());
+  other.send(requestBytes(kEcho, strField("still served")));
+  const auto f = other.read();
+  ASSERT_TRUE(f);
+  EXPECT_EQ(f->text(), "still served");
+
+  proc->openGate();
+  for (int i = 0; i < 4; ++i) {
+    const auto answer = blocked[i].read();
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->text(), "b" + std::to_string(i));
+  }
 }
 
 TEST_F(TransportTest, ProcessorFaultsEndTheirConnectionOnly) {

@@ -1,0 +1,229 @@
+#include "framework/io_pool.h"
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <map>
+#include <mutex>
+#include <system_error>
+#include <thread>
+#include <vector>
+
+namespace Ipc::detail {
+
+struct IoPool::State {
+  State(Options o, ErrorReport r) : options(o), report(std::move(r)) {
+    if (options.base == 0) options.base = 1;
+    if (options.maxThreads < options.base) options.maxThreads = options.base;
+    if (options.blockedAfter.count() <= 0) options.blockedAfter = std::chrono::microseconds(1);
+  }
+
+  Options options;
+  const ErrorReport report;
+
+  // Threads in a Busy scope; Busy scopes ended; threads in all (a copy of
+  // threads.size() for the Busy scope, which takes no lock).
+  std::atomic<std::size_t> busy{0};
+  std::atomic<std::uint64_t> done{0};
+  std::atomic<std::size_t> total{0};
+  // The watcher polls (set under mutex).
+  std::atomic<bool> watching{false};
+  // A thread was needed and none could be started; reported once.
+  std::atomic<bool> starved{false};
+
+  std::mutex mutex;
+  std::condition_variable wake;                    // the watcher's
+  std::weak_ptr<boost::asio::io_context> io;       // guarded by mutex; the threads own it
+  std::map<std::thread::id, std::thread> threads;  // guarded by mutex
+  std::vector<std::thread> finished;               // guarded by mutex: retired spares to join
+  std::thread watcher;                             // guarded by mutex
+  bool stopping = false;                           // guarded by mutex
+
+  void tell(const std::string& text) const noexcept {
+    if (!report) return;
+    try {
+      report(text);
+    } catch (...) {
+      // A report that fails has nowhere else to go.
+    }
+  }
+};
+
+namespace {
+
+// Polls of the watcher that see a free thread before it goes back to sleep.
+constexpr unsigned kQuietPolls = 100;
+
+thread_local const void* tPoolOf = nullptr;
+
+void joinOrDetach(std::thread& t) {
+  if (!t.joinable()) return;
+  if (t.get_id() == std::this_thread::get_id()) {
+    t.detach();  // the pool is being destroyed from one of its own threads
+  } else {
+    t.join();
+  }
+}
+
+}  // namespace
+
+IoPool::IoPool(Options options, ErrorReport report) : state_(std::make_shared<State>(options, std::move(report))) {}
+
+IoPool::~IoPool() { join(); }
+
+void IoPool::start(std::shared_ptr<boost::asio::io_context> io) {
+  std::lock_guard lock(state_->mutex);
+  state_->io = io;
+  state_->watcher = std::thread([s = state_] { watcherMain(s); });
+  for (unsigned i = 0; i < state_->options.base; ++i) {
+    try {
+      spawn(state_, io, false);
+    } catch (const std::system_error&) {
+      if (i == 0) throw;
+      break;
+    }
+  }
+}
+
+std::string IoPool::spawn(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
+                          bool spare) {
+  if (s->threads.size() >= s->options.maxThreads) {
+    if (s->starved.exchange(true)) return {};
+    return "All " + std::to_string(s->threads.size()) +
+           " I/O threads are busy in commands; other connections wait for one to finish";
+  }
+  try {
+    std::thread t([s, io, spare] { threadMain(s, io, spare); });
+    const auto id = t.get_id();
+    s->threads.emplace(id, std::move(t));
+    s->total = s->threads.size();
+    return {};
+  } catch (const std::system_error& e) {
+    if (!spare) throw;
+    if (s->starved.exchange(true)) return {};
+    return std::string("Cannot start an I/O thread (") + e.what() + "); " + std::to_string(s->threads.size()) +
+           " threads are busy in commands, other connections wait for one to finish";
+  }
+}
+
+void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
+                        bool spare) {
+  tPoolOf = s.get();
+  for (;;) {
+    try {
+      if (!spare) {
+        io->run();
+        return;
+      }
+      if (io->run_one_for(s->options.spareIdle) > 0) continue;
+      if (io->stopped()) return;
+    } catch (const std::exception& e) {
+      s->tell(std::string("Unexpected failure in an I/O thread: ") + e.what());
+      continue;
+    } catch (...) {
+      s->tell("Unexpected failure in an I/O thread");
+      continue;
+    }
+    // A spare that ran nothing for spareIdle ends, unless that would leave
+    // no thread free for the connections.
+    std::lock_guard lock(s->mutex);
+    if (s->stopping) return;  // join() owns the handles now
+    if (s->threads.size() - 1 <= s->busy.load()) continue;
+    const auto it = s->threads.find(std::this_thread::get_id());
+    if (it == s->threads.end()) return;
+    s->finished.push_back(std::move(it->second));
+    s->threads.erase(it);
+    s->total = s->threads.size();
+    return;
+  }
+}
+
+// Sleeps while some thread is free; while none is, checks every
+// blockedAfter whether any command has ended meanwhile, and starts a spare
+// when none has.
+void IoPool::watcherMain(const std::shared_ptr<State>& s) {
+  std::unique_lock lock(s->mutex);
+  unsigned quiet = 0;
+  for (;;) {
+    s->wake.wait(lock, [&] { return s->stopping || s->watching.load(); });
+    if (s->stopping) return;
+    const bool allBusyBefore = s->busy.load() >= s->threads.size();
+    const std::uint64_t doneBefore = s->done.load();
+    s->wake.wait_for(lock, s->options.blockedAfter, [&] { return s->stopping; });
+    if (s->stopping) return;
+    const bool allBusy = s->busy.load() >= s->threads.size();
+    if (allBusy && allBusyBefore && s->done.load() == doneBefore) {
+      quiet = 0;
+      std::shared_ptr<boost::asio::io_context> io = s->io.lock();
+      std::string problem;
+      if (io) problem = spawn(s, io, true);
+      std::vector<std::thread> reap;
+      reap.swap(s->finished);
+      // The I/O context (and the server with it) may go with the last
+      // reference: never under the mutex.
+      lock.unlock();
+      io.reset();
+      for (auto& t : reap) joinOrDetach(t);
+      if (!problem.empty()) s->tell(problem);
+      lock.lock();
+    } else if (allBusy) {
+      quiet = 0;
+    } else if (++quiet >= kQuietPolls) {
+      quiet = 0;
+      s->watching = false;
+    }
+  }
+}
+
+IoPool::Busy::Busy(IoPool& pool) : state_(pool.state_.get()) {
+  State& s = *state_;
+  const std::size_t busy = s.busy.fetch_add(1) + 1;
+  if (busy < s.total.load() || s.watching.load()) return;
+  std::lock_guard lock(s.mutex);
+  if (!s.watching.load()) {
+    s.watching = true;
+    s.wake.notify_one();
+  }
+}
+
+IoPool::Busy::~Busy() {
+  State& s = *state_;
+  s.done.fetch_add(1);
+  const std::size_t busy = s.busy.fetch_sub(1) - 1;
+  // A starvation is over once a thread is free again.
+  if (busy < s.total.load() && s.starved.load()) s.starved = false;
+}
+
+void IoPool::join() {
+  const bool own = runningInThisThread();
+  std::vector<std::thread> all;
+  {
+    std::lock_guard lock(state_->mutex);
+    state_->stopping = true;
+    if (state_->watcher.joinable()) all.push_back(std::move(state_->watcher));
+    for (auto& [id, t] : state_->threads) all.push_back(std::move(t));
+    state_->threads.clear();
+    for (auto& t : state_->finished) all.push_back(std::move(t));
+    state_->finished.clear();
+    state_->total = 0;
+  }
+  state_->wake.notify_all();
+  for (auto& t : all) {
+    if (own) {
+      t.detach();
+    } else {
+      joinOrDetach(t);
+    }
+  }
+}
+
+bool IoPool::runningInThisThread() const noexcept { return tPoolOf == state_.get(); }
+
+std::size_t IoPool::threadCount() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->threads.size();
+}
+
+std::size_t IoPool::busyCount() const { return state_->busy.load(); }
+
+}  // namespace Ipc::detail

@@ -1,0 +1,173 @@
+// The elastic I/O threads: blocked commands never keep other work waiting
+// for long, short commands do not make the pool grow, idle spares go, and
+// the limit on threads is reported.
+
+#include "framework/io_pool.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <boost/asio/executor_work_guard.hpp>
+#include <boost/asio/post.hpp>
+#include <chrono>
+#include <condition_variable>
+#include <future>
+#include <mutex>
+#include <thread>
+
+namespace {
+
+using namespace std::chrono_literals;
+using Ipc::detail::IoPool;
+namespace asio = boost::asio;
+
+// A gate that commands wait at until the test opens it.
+class Gate {
+ public:
+  void open() {
+    std::lock_guard lock(mutex_);
+    open_ = true;
+    changed_.notify_all();
+  }
+  void pass() {
+    std::unique_lock lock(mutex_);
+    ++waiting_;
+    changed_.notify_all();
+    changed_.wait(lock, [this] { return open_; });
+  }
+  bool waitForWaiting(int n, std::chrono::milliseconds timeout = 10s) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] { return waiting_ >= n; });
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  bool open_ = false;
+  int waiting_ = 0;
+};
+
+template <typename Pred>
+bool eventually(Pred pred, std::chrono::milliseconds timeout = 10s) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!pred()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(2ms);
+  }
+  return true;
+}
+
+// An I/O context kept running by a work guard, and a pool on it.
+struct Rig {
+  explicit Rig(IoPool::Options options, IoPool::ErrorReport report = {})
+      : io(std::make_shared<asio::io_context>()), work(io->get_executor()), pool(options, std::move(report)) {
+    pool.start(io);
+  }
+  ~Rig() { stop(); }
+  void stop() {
+    work.reset();
+    pool.join();
+  }
+  // A command: runs in a busy scope, as the transport runs them.
+  template <typename F>
+  void command(F f) {
+    asio::post(*io, [this, f = std::move(f)]() mutable {
+      IoPool::Busy busy(pool);
+      f();
+    });
+  }
+
+  std::shared_ptr<asio::io_context> io;
+  asio::executor_work_guard<asio::io_context::executor_type> work;
+  IoPool pool;
+};
+
+TEST(IoPool, BlockedCommandsNeverKeepOtherWorkWaitingAndIdleSparesEnd) {
+  Rig rig({2, 64, 50ms, 1000us});
+  Gate gate;
+  for (int i = 0; i < 6; ++i) rig.command([&] { gate.pass(); });
+  // Six commands blocked at once: only possible with spares beside the two
+  // base threads.
+  ASSERT_TRUE(gate.waitForWaiting(6));
+  EXPECT_EQ(rig.pool.busyCount(), 6u);
+  // Plain I/O work still runs, on a seventh thread.
+  std::promise<void> ran;
+  asio::post(*rig.io, [&] { ran.set_value(); });
+  EXPECT_EQ(ran.get_future().wait_for(10s), std::future_status::ready);
+  EXPECT_GE(rig.pool.threadCount(), 7u);
+
+  gate.open();
+  EXPECT_TRUE(eventually([&] { return rig.pool.threadCount() == 2; }));
+  std::promise<void> after;
+  rig.command([&] { after.set_value(); });
+  EXPECT_EQ(after.get_future().wait_for(10s), std::future_status::ready);
+}
+
+TEST(IoPool, ShortCommandsDoNotMakeThePoolGrow) {
+  Rig rig({2, 64, 30s, 1000us});
+  std::atomic<int> left{20000};
+  std::promise<void> done;
+  for (int i = 0; i < 20000; ++i) {
+    rig.command([&] {
+      volatile unsigned x = 0;
+      for (int k = 0; k < 200; ++k) x = x + static_cast<unsigned>(k);
+      if (--left == 0) done.set_value();
+    });
+  }
+  ASSERT_EQ(done.get_future().wait_for(60s), std::future_status::ready);
+  // Both threads are in a command most of the time; a spare is due only
+  // when neither finishes one for a whole millisecond (a long preemption on
+  // a loaded machine), not whenever both are busy.
+  EXPECT_LE(rig.pool.threadCount(), 4u);
+}
+
+TEST(IoPool, AtTheThreadLimitWorkWaitsForACommandToEndAndTheProblemIsReportedOnce) {
+  std::mutex m;
+  std::vector<std::string> reports;
+  Rig rig({1, 2, 30s, 500us}, [&](const std::string& t) {
+    std::lock_guard lock(m);
+    reports.push_back(t);
+  });
+  Gate gate;
+  for (int i = 0; i < 2; ++i) rig.command([&] { gate.pass(); });
+  ASSERT_TRUE(gate.waitForWaiting(2));
+  std::promise<void> ran;
+  asio::post(*rig.io, [&] { ran.set_value(); });
+  auto ranFuture = ran.get_future();
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard lock(m);
+    return !reports.empty();
+  }));
+  EXPECT_EQ(ranFuture.wait_for(20ms), std::future_status::timeout);
+  gate.open();
+  EXPECT_EQ(ranFuture.wait_for(10s), std::future_status::ready);
+  std::lock_guard lock(m);
+  ASSERT_EQ(reports.size(), 1u);
+  EXPECT_NE(reports[0].find("All 2 I/O threads are busy in commands"), std::string::npos) << reports[0];
+}
+
+TEST(IoPool, AFailingHandlerIsReportedAndItsThreadGoesOn) {
+  std::promise<std::string> report;
+  Rig rig({1, 4, 30s, 1000us}, [&](const std::string& t) { report.set_value(t); });
+  asio::post(*rig.io, [] { throw std::runtime_error("boom"); });
+  auto text = report.get_future();
+  ASSERT_EQ(text.wait_for(10s), std::future_status::ready);
+  EXPECT_NE(text.get().find("boom"), std::string::npos);
+  std::promise<void> after;
+  asio::post(*rig.io, [&] { after.set_value(); });
+  EXPECT_EQ(after.get_future().wait_for(10s), std::future_status::ready);
+}
+
+TEST(IoPool, ACommandMayReleaseTheLastOwnerOfThePool) {
+  auto rig = std::make_shared<Rig>(IoPool::Options{2, 4, 30s, 1000us});
+  std::promise<void> released;
+  Rig* raw = rig.get();
+  raw->command([owner = std::move(rig), &released]() mutable {
+    owner->work.reset();
+    owner.reset();  // joins the other threads, detaches this one
+    released.set_value();
+  });
+  EXPECT_EQ(released.get_future().wait_for(10s), std::future_status::ready);
+}
+
+}  // namespace
