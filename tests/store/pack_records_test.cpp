@@ -163,7 +163,8 @@ TEST_F(PackRecords, ListingsComeInFolderStatusIdOrderAndAFolderIsExact) {
   EXPECT_EQ(idsOf(*db->infos("\xC3\xA4")), std::vector<std::string>{"e"});
   EXPECT_TRUE(db->infos("C")->empty());
   EXPECT_TRUE(db->infos("a")->empty());  // folders compare as bytes, case included
-  for (const auto& p : *db->infos("")) EXPECT_TRUE(p.allValid()) << p.id();
+  const auto all = db->infos("");
+  for (const auto& p : *all) EXPECT_TRUE(p.allValid()) << p.id();
 }
 
 TEST_F(PackRecords, ListingsAndLookupsUseTheIndexesWithoutASort) {
