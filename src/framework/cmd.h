@@ -105,8 +105,9 @@ class CmdI : public std::enable_shared_from_this<CmdI> {
 class CmdProcessorI : public std::enable_shared_from_this<CmdProcessorI> {
  public:
   virtual ~CmdProcessorI() = default;
-  // Runs a received command. Called on a worker thread of the transport;
-  // may block. Must end with SvcStub::onRespReady or cmd->onTransferError.
+  // Runs a received command. Called on an I/O thread of the transport; may
+  // block (other threads then serve the other connections). Must end with
+  // SvcStub::onRespReady or cmd->onTransferError.
   virtual void processCmd(std::shared_ptr<CmdI> cmd) = 0;
   // The transport reports a problem (malformed frame, resource exhaustion).
   virtual void onIpcError(const std::shared_ptr<Socket>& socket, const std::string& text) {

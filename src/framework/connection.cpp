@@ -55,7 +55,12 @@ Connection::Connection(std::shared_ptr<ServerCore> core, StrandSocket socket)
       stallTimer_(socket_.get_executor()),
       closeTimer_(socket_.get_executor()),
       peer_(describePeer(socket_)),
-      stage_(std::make_unique<unsigned char[]>(kStageSize)) {}
+      stage_(std::make_unique<unsigned char[]>(kStageSize)) {
+  // Writes are tried at once, which must never block the thread.
+  boost::system::error_code ec;
+  socket_.non_blocking(true, ec);
+  writeAtOnce_ = !ec;
+}
 
 Connection::~Connection() {
   // Normally finish() has done this; a connection that never got that far
@@ -297,7 +302,7 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
   cmd->attachSocket(shared_from_this());
   const auto processor = cmd->processor();
   if (!processor) {
-    // Keep-alive and the like: answered here, without a worker.
+    // Keep-alive and the like: answered here, without a processor.
     wire::OutFrame answer;
     try {
       answer = cmd->answerFrame();
@@ -374,7 +379,42 @@ void Connection::enqueue(wire::OutFrame frame) {
   if (!writing_) startWrite();
 }
 
+// Writes what is queued: first at once, without waiting (the usual case:
+// the socket takes a small answer whole, and no completion has to be
+// scheduled for it), then, for what the socket did not take, with an
+// asynchronous write.
 void Connection::startWrite() {
+  while (!writing_ && !finished_) {
+    const std::size_t count = gather();
+    if (count == 0) return;
+    boost::system::error_code ec = asio::error::would_block;
+    const std::size_t n = writeAtOnce_ ? socket_.write_some(BufferSpan{gather_.data(), count}, ec) : 0;
+    if (ec == asio::error::would_block || ec == asio::error::try_again) {
+      writing_ = true;
+      writeSince_ = Clock::now();
+      socket_.async_write_some(BufferSpan{gather_.data(), count},
+                               [self = shared_from_this()](const boost::system::error_code& e, std::size_t m) {
+                                 self->onWrite(e, m);
+                               });
+      armStallTimer();
+      return;
+    }
+    if (ec) {
+      // The peer is gone; what was queued for it goes with it.
+      peerDone_ = true;
+      finish();
+      return;
+    }
+    consumeWritten(n);
+    if (out_.empty()) {
+      if (closing_) byeWritten();
+      return;
+    }
+  }
+}
+
+// Fills gather_ with the unwritten part of the queue; returns the count.
+std::size_t Connection::gather() {
   std::size_t count = 0;
   std::uint64_t skip = frontSent_;
   for (const auto& frame : out_) {
@@ -390,14 +430,36 @@ void Connection::startWrite() {
     }
     skip = 0;
   }
-  if (count == 0) return;
-  writing_ = true;
-  writeSince_ = Clock::now();
-  socket_.async_write_some(BufferSpan{gather_.data(), count},
-                           [self = shared_from_this()](const boost::system::error_code& ec, std::size_t n) {
-                             self->onWrite(ec, n);
-                           });
-  armStallTimer();
+  return count;
+}
+
+void Connection::consumeWritten(std::uint64_t n) {
+  outBytes_ -= n;
+  while (n > 0 && !out_.empty()) {
+    const std::uint64_t rest = out_.front().size() - frontSent_;
+    if (n < rest) {
+      frontSent_ += n;
+      n = 0;
+    } else {
+      n -= rest;
+      frontSent_ = 0;
+      out_.pop_front();
+    }
+  }
+}
+
+// The Bye frame is out: the sending side ends, and the connection waits
+// for the peer to close (within the close grace).
+void Connection::byeWritten() {
+  if (byeFlushed_) return;
+  byeFlushed_ = true;
+  boost::system::error_code ignored;
+  socket_.shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
+  if (peerDone_) {
+    finish();
+  } else {
+    startDrain();
+  }
 }
 
 void Connection::onWrite(const boost::system::error_code& ec, std::size_t n) {
@@ -412,36 +474,16 @@ void Connection::onWrite(const boost::system::error_code& ec, std::size_t n) {
     finish();
     return;
   }
-  std::uint64_t left = n;
-  outBytes_ -= n;
-  while (left > 0 && !out_.empty()) {
-    const std::uint64_t rest = out_.front().size() - frontSent_;
-    if (left < rest) {
-      frontSent_ += left;
-      left = 0;
-    } else {
-      left -= rest;
-      frontSent_ = 0;
-      out_.pop_front();
-    }
-  }
+  consumeWritten(n);
   if (!out_.empty()) {
     startWrite();
-    return;
+    if (writing_ || finished_ || !out_.empty()) return;
   }
   if (closing_) {
-    if (!byeFlushed_) {
-      byeFlushed_ = true;
-      boost::system::error_code ignored;
-      socket_.shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
-      if (peerDone_) {
-        finish();
-      } else {
-        startDrain();
-      }
-    }
+    byeWritten();
     return;
   }
+  // Reading may have waited for the answers to drain.
   goOn();
 }
 

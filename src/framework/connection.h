@@ -110,6 +110,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
 
   void enqueue(wire::OutFrame frame);
   void startWrite();
+  std::size_t gather();
+  void consumeWritten(std::uint64_t n);
+  void byeWritten();
   void onWrite(const boost::system::error_code& ec, std::size_t n);
 
   void beginClose(const std::string& reason);
@@ -154,6 +157,7 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   bool byeFlushed_ = false;  // the Bye is written; draining until the peer closes
   bool finished_ = false;    // the socket is closed
   bool stallArmed_ = false;
+  bool writeAtOnce_ = false;  // the socket is in non-blocking mode
   std::chrono::steady_clock::time_point readSince_;
   std::chrono::steady_clock::time_point writeSince_;
 

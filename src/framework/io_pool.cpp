@@ -1,8 +1,16 @@
 #include "framework/io_pool.h"
 
+#include <fcntl.h>
+#include <pthread.h>
+#include <sys/types.h>
+#include <unistd.h>
+
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
+#include <cstring>
+#include <algorithm>
+#include <list>
 #include <map>
 #include <mutex>
 #include <system_error>
@@ -10,6 +18,46 @@
 #include <vector>
 
 namespace Ipc::detail {
+namespace {
+
+// What the watcher knows of one thread of the pool.
+struct Slot {
+  // When the thread's current command began (steady clock, ns); 0 while
+  // the thread is not in a command.
+  std::atomic<std::int64_t> since{0};
+  int statFd = -1;  // /proc/self/task/<tid>/stat, for the thread's state
+
+  Slot() {
+    const std::string stat = "/proc/self/task/" + std::to_string(::gettid()) + "/stat";
+    statFd = ::open(stat.c_str(), O_RDONLY | O_CLOEXEC);
+  }
+  ~Slot() {
+    if (statFd >= 0) ::close(statFd);
+  }
+  Slot(const Slot&) = delete;
+  Slot& operator=(const Slot&) = delete;
+
+  // Waiting for the disk (state D: a sync, a read of the file system);
+  // unknown counts as not waiting.
+  bool waitingForDisk() const noexcept {
+    if (statFd < 0) return false;
+    char buf[512];
+    const ssize_t n = ::pread(statFd, buf, sizeof buf - 1, 0);
+    if (n <= 0) return false;
+    buf[n] = 0;
+    // "tid (name) S ...": the name may hold anything but ends at the last ')'.
+    const char* close = std::strrchr(buf, ')');
+    if (!close || close[1] != ' ') return false;
+    return close[2] == 'D';
+  }
+};
+
+std::int64_t nowNs() noexcept {
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now().time_since_epoch())
+      .count();
+}
+
+}  // namespace
 
 struct IoPool::State {
   State(Options o, ErrorReport r) : options(o), report(std::move(r)) {
@@ -36,6 +84,7 @@ struct IoPool::State {
   std::weak_ptr<boost::asio::io_context> io;       // guarded by mutex; the threads own it
   std::map<std::thread::id, std::thread> threads;  // guarded by mutex
   std::vector<std::thread> finished;               // guarded by mutex: retired spares to join
+  std::list<Slot> slots;                           // guarded by mutex: one per running thread
   std::thread watcher;                             // guarded by mutex
   bool stopping = false;                           // guarded by mutex
 
@@ -55,6 +104,49 @@ namespace {
 constexpr unsigned kQuietPolls = 100;
 
 thread_local const void* tPoolOf = nullptr;
+thread_local Slot* tSlot = nullptr;
+
+// Registers the calling thread with the watcher for its life.
+class SlotGuard {
+ public:
+  SlotGuard(std::mutex& mutex, std::list<Slot>& slots) : mutex_(mutex), slots_(slots) {
+    std::lock_guard lock(mutex_);
+    slots_.emplace_back();
+    it_ = std::prev(slots_.end());
+    tSlot = &*it_;
+  }
+  ~SlotGuard() {
+    std::lock_guard lock(mutex_);
+    tSlot = nullptr;
+    slots_.erase(it_);
+  }
+  SlotGuard(const SlotGuard&) = delete;
+  SlotGuard& operator=(const SlotGuard&) = delete;
+
+ private:
+  std::mutex& mutex_;
+  std::list<Slot>& slots_;
+  std::list<Slot>::iterator it_;
+};
+
+// Commands younger than this are not looked at (a look costs a read of
+// the thread's state).
+constexpr std::int64_t kBlockedNs = 50000;
+
+// Threads of commands that wait for the disk. (A command asleep on a lock
+// or a pause counts as blocked only through the watcher's other rule, no
+// command finishing: under load on few cores a command often sleeps on a
+// mutex held by a thread waiting for a core, which more threads would not
+// help.) Called with the pool's mutex held.
+std::size_t countBlocked(const std::list<Slot>& slots) {
+  const std::int64_t now = nowNs();
+  std::size_t blocked = 0;
+  for (const Slot& slot : slots) {
+    const std::int64_t since = slot.since.load();
+    if (since != 0 && now - since >= kBlockedNs && slot.waitingForDisk()) ++blocked;
+  }
+  return blocked;
+}
 
 void joinOrDetach(std::thread& t) {
   if (!t.joinable()) return;
@@ -109,6 +201,7 @@ std::string IoPool::spawn(const std::shared_ptr<State>& s, const std::shared_ptr
 void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
                         bool spare) {
   tPoolOf = s.get();
+  const SlotGuard slot(s->mutex, s->slots);
   for (;;) {
     try {
       if (!spare) {
@@ -138,9 +231,9 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
   }
 }
 
-// Sleeps while some thread is free; while none is, checks every
-// blockedAfter whether any command has ended meanwhile, and starts a spare
-// when none has.
+// Sleeps while some thread is free; while none is, looks every
+// blockedAfter and starts a spare when a thread is blocked in its command or
+// no command has ended meanwhile.
 void IoPool::watcherMain(const std::shared_ptr<State>& s) {
   std::unique_lock lock(s->mutex);
   unsigned quiet = 0;
@@ -152,11 +245,16 @@ void IoPool::watcherMain(const std::shared_ptr<State>& s) {
     s->wake.wait_for(lock, s->options.blockedAfter, [&] { return s->stopping; });
     if (s->stopping) return;
     const bool allBusy = s->busy.load() >= s->threads.size();
-    if (allBusy && allBusyBefore && s->done.load() == doneBefore) {
+    const std::size_t blocked = allBusy ? countBlocked(s->slots) : 0;
+    const bool stalled = allBusy && allBusyBefore && s->done.load() == doneBefore;
+    if (blocked > 0 || stalled) {
       quiet = 0;
       std::shared_ptr<boost::asio::io_context> io = s->io.lock();
       std::string problem;
-      if (io) problem = spawn(s, io, true);
+      // A thread for every blocked one: the cores stay fed.
+      for (std::size_t i = 0; io && problem.empty() && i < std::max<std::size_t>(blocked, 1); ++i) {
+        problem = spawn(s, io, true);
+      }
       std::vector<std::thread> reap;
       reap.swap(s->finished);
       // The I/O context (and the server with it) may go with the last
@@ -177,6 +275,7 @@ void IoPool::watcherMain(const std::shared_ptr<State>& s) {
 
 IoPool::Busy::Busy(IoPool& pool) : state_(pool.state_.get()) {
   State& s = *state_;
+  if (tSlot) tSlot->since = nowNs();
   const std::size_t busy = s.busy.fetch_add(1) + 1;
   if (busy < s.total.load() || s.watching.load()) return;
   std::lock_guard lock(s.mutex);
@@ -188,6 +287,7 @@ IoPool::Busy::Busy(IoPool& pool) : state_(pool.state_.get()) {
 
 IoPool::Busy::~Busy() {
   State& s = *state_;
+  if (tSlot) tSlot->since = 0;
   s.done.fetch_add(1);
   const std::size_t busy = s.busy.fetch_sub(1) - 1;
   // A starvation is over once a thread is free again.

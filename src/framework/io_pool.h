@@ -3,17 +3,21 @@
 // context, and on which commands run too.
 //
 // Commands run on the I/O thread that read them, which saves handing each
-// one to another thread and back. A command may block, though (a
-// transaction's retry pause, a wait for a database's write lock or for a
+// one to another thread and back. A command may block, though (a commit's
+// sync, a wait for a database's write lock, a transaction's retry pause, a
 // maintenance hold), and a blocked thread serves nobody else. So a command
-// runs inside a Busy scope, and a watcher thread starts a spare thread
-// whenever every thread has been inside commands for `blockedAfter` without
-// any of them finishing one: connections then wait at most about that long
-// however many commands block. (Starting a spare at once whenever every
-// thread is in a command would also do, but under load on few cores that
-// is nearly always the case: the pool would grow to one thread per busy
-// connection, and latency suffers from the crowd.) The watcher sleeps while
-// no thread is busy and polls every `blockedAfter` while all are.
+// runs inside a Busy scope, and while every thread is in one, a watcher
+// thread looks every `blockedAfter` and starts spare threads:
+//   - one when no command has finished since the last look (commands that
+//     sleep, wait for a lock or compute for long); and
+//   - one for every thread whose command waits for the disk (a commit's
+//     sync), so that writers of different databases sync side by side.
+// Other connections thus wait at most about `blockedAfter` for blocked
+// commands. Threads that are merely computing, waiting for a core or for a
+// mutex held by a thread that waits for a core, start no spare: starting
+// one whenever every thread is in a command would grow the pool to a
+// thread per busy connection under load on few cores, and latency suffers
+// from the crowd. The watcher sleeps while some thread is free.
 // Spares that have run nothing for `spareIdle` end, as long as one thread
 // stays free; the `base` threads stay until the I/O context stops.
 //

@@ -81,7 +81,9 @@ class SvcStub {
 
   // Sends the answer of a processed command and lets its connection go on
   // with the next request. For progress commands the answer is their
-  // progress stream, so this only marks the processing as done.
+  // progress stream, so this only marks the processing as done. Called on
+  // the command's own I/O thread, it is meant as processCmd's last step:
+  // the answer is written once processCmd has returned.
   void onRespReady(const std::shared_ptr<CmdI>& cmd);
 
  private:
