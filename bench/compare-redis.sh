@@ -1,48 +1,64 @@
 #!/usr/bin/env bash
-# Configuration reads and durable writes of cvdbserver against Redis GET and
-# SET (appendfsync always), and 1 MiB data files against the disk's own
-# sequential rate, all in one run on the same machine and disk.
+# cvdbserver against Redis and the disk, all in one run on the same machine
+# and disk: keep-alive, configuration reads and durable writes against
+# redis-benchmark's PING, GET and SET; packs against HGETALL and
+# MULTI/HSET+SET/EXEC; 1 MiB data files against dd. Redis syncs every
+# write before it answers (appendfsync always), as cvdbserver does.
 #
 #   bench/compare-redis.sh [build-dir]      (default: build)
 #
-# Needs redis-server and redis-benchmark, and the build's cvdbserver and
-# load_gen (configure with -DCVDB_BUILD_BENCH=ON). SECONDS_PER_RUN (default
-# 5) sets the length of each cvdbserver run. Everything lives in a temporary
-# folder on the disk of TMPDIR, removed at the end.
+# Settings (environment):
+#   RUNS=3             runs of every measurement; the table shows medians
+#   SECONDS_PER_RUN=5  length of each run
+#   ONLY="kv files packs"  groups to run
+#   FOLDER_PACKS=10000 packs in the folder that the listing reads
+#
+# Needs the build's cvdbserver and load_gen (-DCVDB_BUILD_BENCH=ON); installs
+# redis-server and redis-tools from Debian when they are missing. Both
+# servers and every file live in a temporary folder on the disk of TMPDIR,
+# removed at the end; neither server outlives the script.
 set -euo pipefail
 
 build=${1:-build}
+runs=${RUNS:-3}
 seconds=${SECONDS_PER_RUN:-5}
+only=${ONLY:-kv files packs}
+folder_packs=${FOLDER_PACKS:-10000}
 server_bin=$build/src/service/cvdbserver
 load_gen=$build/bench/load_gen
 for tool in "$server_bin" "$load_gen"; do
   [[ -x $tool ]] || { echo "compare-redis: $tool is missing (build with -DCVDB_BUILD_BENCH=ON)" >&2; exit 2; }
 done
-for tool in redis-server redis-benchmark redis-cli; do
-  command -v "$tool" >/dev/null || { echo "compare-redis: $tool is not installed" >&2; exit 2; }
-done
+if ! command -v redis-server >/dev/null || ! command -v redis-benchmark >/dev/null; then
+  echo "compare-redis: installing redis-server and redis-tools" >&2
+  apt-get install -y -q redis-server redis-tools >/dev/null
+fi
 
 work=$(mktemp -d)
 server_pid=
 redis_pid=
 cleanup() {
-  [[ -n $server_pid ]] && kill "$server_pid" 2>/dev/null && wait "$server_pid" 2>/dev/null
-  [[ -n $redis_pid ]] && kill "$redis_pid" 2>/dev/null && wait "$redis_pid" 2>/dev/null
+  if [[ -n $server_pid ]]; then kill "$server_pid" 2>/dev/null || true; wait "$server_pid" 2>/dev/null || true; fi
+  if [[ -n $redis_pid ]]; then kill "$redis_pid" 2>/dev/null || true; wait "$redis_pid" 2>/dev/null || true; fi
   rm -rf "$work"
 }
 trap cleanup EXIT
+trap 'exit 130' INT TERM
+
+echo "compare-redis: $(nproc) cores, $runs run(s) of ${seconds} s each; load average at start: $(cut -d' ' -f1-3 /proc/loadavg)"
 
 # cvdbserver on a free port, its databases in the temporary folder.
 mkdir -p "$work/home/db" "$work/log"
 echo '{"ServerPort": 0, "ForceIP4": true}' >"$work/home/db/config.json"
 "$server_bin" --home "$work/home" --log-dir "$work/log" --console >"$work/server.out" 2>&1 &
 server_pid=$!
+port=
 for _ in $(seq 200); do
   port=$(sed -n 's/.*Listening on port \([0-9]*\).*/\1/p' "$work/server.out" | head -1)
   [[ -n $port ]] && break
   sleep 0.05
 done
-[[ -n ${port:-} ]] || { echo "compare-redis: cvdbserver did not start" >&2; cat "$work/server.out" >&2; exit 1; }
+[[ -n $port ]] || { echo "compare-redis: cvdbserver did not start" >&2; cat "$work/server.out" >&2; exit 1; }
 
 # Redis with every write synced before it is answered.
 redis_port=$((port + 1))
@@ -54,52 +70,134 @@ for _ in $(seq 200); do
   redis-cli -p "$redis_port" ping >/dev/null 2>&1 && break
   sleep 0.05
 done
-redis-cli -p "$redis_port" set key:000000000000 "$(head -c 100 /dev/zero | tr '\0' x)" >/dev/null
+redis-cli -p "$redis_port" ping >/dev/null || { echo "compare-redis: redis-server did not start" >&2; exit 1; }
 
-# One field of load_gen's JSON line.
+# ---------------------------------------------------------------- measuring
+# Every measurement prints "ops/s p50-us p99-us".
+
+# A field of load_gen's JSON line.
 field() { sed -n "s/.*\"$2\":\([0-9.]*\).*/\1/p" <<<"$1"; }
-# load_gen: ops/s and p99 in microseconds.
-ours() { "$load_gen" --port "$port" --seconds "$seconds" --json "$@"; }
-# redis-benchmark --csv: "test","rps","avg","min","p50","p95","p99","max" (ms).
-theirs() {
-  redis-benchmark -p "$redis_port" --csv "$@" | tail -1 | tr -d '"' |
-    awk -F, '{ printf "%.1f %.1f\n", $2, $7 * 1000 }'
+
+ours() {  # load_gen arguments
+  local out
+  out=$("$load_gen" --port "$port" --seconds "$seconds" --json "$@") || {
+    echo "compare-redis: load_gen $* failed: $out" >&2
+    exit 1
+  }
+  echo "$(field "$out" ops_per_sec) $(field "$out" p50_us) $(field "$out" p99_us)"
 }
 
-printf '%-44s %12s %10s %12s %10s %7s\n' "workload" "ops/s" "p99 us" "Redis ops/s" "p99 us" "ratio"
-row() {  # name ours-json redis-ops redis-p99
-  local ops p99
-  ops=$(field "$2" ops_per_sec)
-  p99=$(field "$2" p99_us)
-  printf '%-44s %12.0f %10.0f %12.0f %10.0f %7.2f\n' "$1" "$ops" "$p99" "$3" "$4" "$(awk "BEGIN { print $ops / $3 }")"
+# The Redis counterpart of a load_gen command, through load_gen's own loop.
+redis_loop() {
+  local out
+  out=$("$load_gen" --redis --port "$redis_port" --seconds "$seconds" --json "$@") || {
+    echo "compare-redis: load_gen --redis $* failed: $out" >&2
+    exit 1
+  }
+  echo "$(field "$out" ops_per_sec) $(field "$out" p50_us) $(field "$out" p99_us)"
 }
 
-for c in 1 50; do
-  r=$(ours --command getcfg --size 100 --connections "$c")
-  read -r rops rp99 < <(theirs -t get -d 100 -c "$c" -n $((c == 1 ? 50000 : 300000)))
-  row "100 B config read, $c conn, 1 db" "$r" "$rops" "$rp99"
-done
+# redis-benchmark, sized to run about SECONDS_PER_RUN after a short probe.
+# CSV: "test","rps","avg","min","p50","p95","p99","max" (ms).
+redis_bench() {  # -c N and the test's arguments
+  local probe rps n
+  probe=$(redis-benchmark -p "$redis_port" --csv -n 2000 "$@" | tail -1 | tr -d '"' | cut -d, -f2)
+  rps=${probe%.*}
+  n=$((rps * seconds))
+  ((n < 2000)) && n=2000
+  redis-benchmark -p "$redis_port" --csv -n "$n" "$@" | tail -1 | tr -d '"' |
+    awk -F, '{ printf "%.1f %.1f %.1f\n", $2, $5 * 1000, $7 * 1000 }'
+}
 
-r=$(ours --command setcfg --size 100 --connections 1)
-read -r rops1 rp991 < <(theirs -t set -d 100 -c 1 -n 3000)
-row "100 B durable write, 1 conn, 1 db" "$r" "$rops1" "$rp991"
-r=$(ours --command setcfg --size 100 --connections 50 --databases 16)
-read -r rops rp99 < <(theirs -t set -d 100 -c 50 -n 30000)
-row "100 B durable write, 50 conn, 16 db" "$r" "$rops" "$rp99"
-printf '%-44s %12.0f ops/s; against Redis with 1 connection: %.2f\n' "  (target: at least Redis with 1 conn)" \
-  "$(field "$r" ops_per_sec)" "$(awk "BEGIN { print $(field "$r" ops_per_sec) / $rops1 }")"
+median() { sort -g | awk '{ v[NR] = $1 } END { if (NR == 0) print 0; else print v[int((NR + 1) / 2)] }'; }
 
-# The disk's sequential rate with a sync at the end, in MiB/s.
-dd_out=$(dd if=/dev/zero of="$work/dd.bin" bs=1M count=256 conv=fdatasync 2>&1 | tail -1)
-disk=$(awk -v line="$dd_out" 'BEGIN {
-  n = split(line, f, ",");
-  split(f[n - 1], t, " ");   # "1.23 s"
-  printf "%.1f", 256 / t[1] }')
-rm -f "$work/dd.bin"
-for cmd in setdata getdata; do
-  r=$(ours --command "$cmd" --size 1048576 --connections 1)
-  ops=$(field "$r" ops_per_sec)
-  what=$([[ $cmd == setdata ]] && echo write || echo read)
-  printf '%-44s %12.0f %10.0f %9.1f MiB/s against dd %.1f MiB/s: %.2f\n' "1 MiB data file $what, 1 conn" \
-    "$ops" "$(field "$r" p99_us)" "$ops" "$disk" "$(awk "BEGIN { print $ops / $disk }")"
-done
+# Runs both sides RUNS times, alternating, and prints one table row with
+# the medians: name, target ratio (or -), our command, their command (or -).
+printf '\n%-40s %10s %9s %9s %10s %9s %9s %6s  %s\n' "workload" "ops/s" "p50 us" "p99 us" \
+  "Redis" "p50 us" "p99 us" "ratio" "target"
+row() {
+  local name=$1 target=$2 our_cmd=$3 their_cmd=$4 i a b c
+  local -a oo=() op5=() op9=() to=() tp5=() tp9=()
+  for ((i = 0; i < runs; i++)); do
+    read -r a b c < <(eval "$our_cmd")
+    oo+=("$a"); op5+=("$b"); op9+=("$c")
+    [[ $their_cmd == - ]] && continue
+    read -r a b c < <(eval "$their_cmd")
+    to+=("$a"); tp5+=("$b"); tp9+=("$c")
+  done
+  local mo mp5 mp9
+  mo=$(printf '%s\n' "${oo[@]}" | median); mp5=$(printf '%s\n' "${op5[@]}" | median)
+  mp9=$(printf '%s\n' "${op9[@]}" | median)
+  last_ours=$mo
+  if [[ $their_cmd == - ]]; then
+    printf '%-40s %10.0f %9.0f %9.0f %10s %9s %9s %6s\n' "$name" "$mo" "$mp5" "$mp9" - - - -
+    return
+  fi
+  local mt mtp5 mtp9 ratio verdict=""
+  mt=$(printf '%s\n' "${to[@]}" | median); mtp5=$(printf '%s\n' "${tp5[@]}" | median)
+  mtp9=$(printf '%s\n' "${tp9[@]}" | median)
+  ratio=$(awk -v a="$mo" -v b="$mt" 'BEGIN { printf "%.2f", (b > 0 ? a / b : 0) }')
+  if [[ $target != - ]]; then
+    verdict=$(awk -v r="$ratio" -v t="$target" 'BEGIN { print (r >= t ? ">= " t " met" : ">= " t " MISSED") }')
+  fi
+  printf '%-40s %10.0f %9.0f %9.0f %10.0f %9.0f %9.0f %6s  %s\n' "$name" "$mo" "$mp5" "$mp9" "$mt" "$mtp5" "$mtp9" \
+    "$ratio" "$verdict"
+}
+
+wants() { [[ " $only " == *" $1 "* ]]; }
+
+if wants kv; then
+  row "ping, 1 conn" - "ours --command ping -c 1" "redis_bench -c 1 -t ping_mbulk"
+  row "ping, 50 conn" 0.8 "ours --command ping -c 50" "redis_bench -c 50 -t ping_mbulk"
+  row "100 B config read, 1 conn" - "ours --command getcfg -c 1" "redis_bench -c 1 -t get -d 100"
+  row "100 B config read, 50 conn" 0.6 "ours --command getcfg -c 50" "redis_bench -c 50 -t get -d 100"
+  row "  (Redis GET through load_gen's loop)" - "ours --command getcfg -c 50" "redis_loop --command getcfg -c 50"
+  row "100 B durable write, 1 conn" - "ours --command setcfg -c 1" "redis_bench -c 1 -t set -d 100"
+  redis_one=$(for ((i = 0; i < runs; i++)); do redis_bench -c 1 -t set -d 100; done | cut -d' ' -f1 | median)
+  row "100 B durable write, 50 conn, 16 db" - "ours --command setcfg -c 50 --databases 16" \
+    "redis_bench -c 50 -t set -d 100"
+  awk -v a="$last_ours" -v b="$redis_one" 'BEGIN {
+    r = a / b; printf "%-40s %10.0f %39.0f %6.2f  >= 1 %s\n", "  (against Redis SET with 1 conn)", a, b, r,
+      (r >= 1 ? "met" : "MISSED") }'
+fi
+
+if wants packs; then
+  packs() { ours "$@" --folder-packs "$folder_packs"; }
+  row "SavePack 1 KiB + 10 KiB, 1 conn" 1 "packs --command savepack -c 1" "redis_loop --command savepack -c 1"
+  row "SavePack, 50 conn, 1 db" - "packs --command savepack -c 50" "redis_loop --command savepack -c 50"
+  row "SavePack, 50 conn, 16 db" - "packs --command savepack -c 50 --databases 16" \
+    "redis_loop --command savepack -c 50"
+  row "GetPackInfo, 1 conn" - "packs --command getpackinfo -c 1" "redis_loop --command getpackinfo -c 1"
+  row "GetPackInfo, 50 conn, 1 db" 0.6 "packs --command getpackinfo -c 50" "redis_loop --command getpackinfo -c 50"
+  row "GetPackInfo, 50 conn, 16 db" 0.6 "packs --command getpackinfo -c 50 --databases 16" \
+    "redis_loop --command getpackinfo -c 50"
+  # Redis: HGETALL and GET of the content, sent together.
+  row "GetPack (record + 10 KiB), 1 conn" - "packs --command getpack -c 1" "redis_loop --command getpack -c 1"
+  row "GetPack, 50 conn, 1 db" 0.6 "packs --command getpack -c 50" "redis_loop --command getpack -c 50"
+  row "GetPack, 50 conn, 16 db" 0.6 "packs --command getpack -c 50 --databases 16" \
+    "redis_loop --command getpack -c 50"
+  echo "GetPackInfos of $folder_packs records (target: p50 under 50 ms with 1 connection):"
+  row "GetPackInfos, 1 conn" - "packs --command getpackinfos -c 1" -
+  row "GetPackInfos, 50 conn, 1 db" - "packs --command getpackinfos -c 50" -
+  row "GetPackInfos, 50 conn, 16 db" - "packs --command getpackinfos -c 50 --databases 16" -
+fi
+
+if wants files; then
+  # The disk's sequential rates in MiB/s: a write synced at its end, and a
+  # read that bypasses the page cache.
+  disk_write() {
+    dd if=/dev/zero of="$work/dd.bin" bs=1M count=256 conv=fdatasync 2>&1 | tail -1 |
+      awk '{ n = split($0, f, ","); split(f[n - 1], t, " "); printf "%.1f 0 0\n", 256 / t[1] }'
+  }
+  disk_read() {
+    dd if="$work/dd.bin" of=/dev/null bs=1M iflag=direct 2>&1 | tail -1 |
+      awk '{ n = split($0, f, ","); split(f[n - 1], t, " "); printf "%.1f 0 0\n", 256 / t[1] }'
+  }
+  echo "1 MiB data files in MiB/s (= ops/s), against dd on the same disk (the Redis columns):"
+  row "1 MiB data-file write, 1 conn" - "ours --command setdata --size 1048576 -c 1" disk_write
+  row "1 MiB data-file read, 1 conn" - "ours --command getdata --size 1048576 -c 1" disk_read
+  rm -f "$work/dd.bin"
+fi
+
+echo
+echo "compare-redis: load average at end: $(cut -d' ' -f1-3 /proc/loadavg)"
