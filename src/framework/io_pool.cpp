@@ -69,11 +69,13 @@ struct IoPool::State {
   Options options;
   const ErrorReport report;
 
-  // Threads in a Busy scope; Busy scopes ended; threads in all (a copy of
-  // threads.size() for the Busy scope, which takes no lock).
+  // Threads in a Busy scope; Busy scopes ended; threads that run the I/O
+  // context (a copy of active() for the Busy scope, which takes no lock).
   std::atomic<std::size_t> busy{0};
   std::atomic<std::uint64_t> done{0};
   std::atomic<std::size_t> total{0};
+  // Spares are not needed now: they park after their current handler.
+  std::atomic<bool> parkSpares{false};
   // The watcher polls (set under mutex).
   std::atomic<bool> watching{false};
   // A thread was needed and none could be started; reported once.
@@ -86,7 +88,14 @@ struct IoPool::State {
   std::vector<std::thread> finished;               // guarded by mutex: retired spares to join
   std::list<Slot> slots;                           // guarded by mutex: one per running thread
   std::thread watcher;                             // guarded by mutex
+  std::condition_variable unpark;                  // parked spares wait here
+  std::size_t parked = 0;                          // guarded by mutex: spares parked, not woken
+  std::size_t wakeups = 0;                         // guarded by mutex: wake-ups not yet taken
   bool stopping = false;                           // guarded by mutex
+
+  // Threads that run the I/O context (not parked). Under mutex.
+  std::size_t active() const { return threads.size() - parked; }
+  void countActive() { total = active(); }
 
   void tell(const std::string& text) const noexcept {
     if (!report) return;
@@ -188,7 +197,7 @@ std::string IoPool::spawn(const std::shared_ptr<State>& s, const std::shared_ptr
     std::thread t([s, io, spare] { threadMain(s, io, spare); });
     const auto id = t.get_id();
     s->threads.emplace(id, std::move(t));
-    s->total = s->threads.size();
+    s->countActive();
     return {};
   } catch (const std::system_error& e) {
     if (!spare) throw;
@@ -203,6 +212,10 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
   tPoolOf = s.get();
   const SlotGuard slot(s->mutex, s->slots);
   for (;;) {
+    if (spare && s->parkSpares.load()) {
+      if (!park(s)) return;
+      continue;
+    }
     try {
       if (!spare) {
         io->run();
@@ -221,14 +234,40 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
     // no thread free for the connections.
     std::lock_guard lock(s->mutex);
     if (s->stopping) return;  // join() owns the handles now
-    if (s->threads.size() - 1 <= s->busy.load()) continue;
-    const auto it = s->threads.find(std::this_thread::get_id());
-    if (it == s->threads.end()) return;
-    s->finished.push_back(std::move(it->second));
-    s->threads.erase(it);
-    s->total = s->threads.size();
+    if (s->active() - 1 <= s->busy.load()) continue;
+    retire(*s);
     return;
   }
+}
+
+// Moves the calling thread's handle to the threads to join. Under mutex.
+void IoPool::retire(State& s) {
+  const auto it = s.threads.find(std::this_thread::get_id());
+  if (it == s.threads.end()) return;
+  s.finished.push_back(std::move(it->second));
+  s.threads.erase(it);
+  s.countActive();
+}
+
+// A spare that is not needed waits outside the I/O context, where it takes
+// no part in the scheduling of handlers, until the watcher wakes it or
+// spareIdle passes (then it ends). Returns false when the thread must end.
+bool IoPool::park(const std::shared_ptr<State>& s) {
+  std::unique_lock lock(s->mutex);
+  if (s->stopping) return false;
+  if (!s->parkSpares.load()) return true;
+  ++s->parked;
+  s->countActive();
+  const bool woken =
+      s->unpark.wait_for(lock, s->options.spareIdle, [&] { return s->stopping || s->wakeups > 0; });
+  if (s->stopping) return false;
+  if (woken) {
+    --s->wakeups;  // the watcher counted this thread active again
+    return true;
+  }
+  --s->parked;
+  retire(*s);
+  return false;
 }
 
 // Sleeps while some thread is free; while none is, looks every
@@ -240,21 +279,28 @@ void IoPool::watcherMain(const std::shared_ptr<State>& s) {
   for (;;) {
     s->wake.wait(lock, [&] { return s->stopping || s->watching.load(); });
     if (s->stopping) return;
-    const bool allBusyBefore = s->busy.load() >= s->threads.size();
+    const bool allBusyBefore = s->busy.load() >= s->active();
     const std::uint64_t doneBefore = s->done.load();
     s->wake.wait_for(lock, s->options.blockedAfter, [&] { return s->stopping; });
     if (s->stopping) return;
-    const bool allBusy = s->busy.load() >= s->threads.size();
+    const bool allBusy = s->busy.load() >= s->active();
     const std::size_t blocked = allBusy ? countBlocked(s->slots) : 0;
     const bool stalled = allBusy && allBusyBefore && s->done.load() == doneBefore;
     if (blocked > 0 || stalled) {
       quiet = 0;
+      s->parkSpares = false;
       std::shared_ptr<boost::asio::io_context> io = s->io.lock();
       std::string problem;
-      // A thread for every blocked one: the cores stay fed.
-      for (std::size_t i = 0; io && problem.empty() && i < std::max<std::size_t>(blocked, 1); ++i) {
-        problem = spawn(s, io, true);
+      // A thread for every blocked one, so that the cores stay fed: parked
+      // spares first, new ones for the rest.
+      std::size_t wanted = std::max<std::size_t>(blocked, 1);
+      for (; wanted > 0 && s->parked > 0; --wanted) {
+        --s->parked;
+        ++s->wakeups;
+        s->unpark.notify_one();
       }
+      s->countActive();
+      for (; io && problem.empty() && wanted > 0; --wanted) problem = spawn(s, io, true);
       std::vector<std::thread> reap;
       reap.swap(s->finished);
       // The I/O context (and the server with it) may go with the last
@@ -267,8 +313,10 @@ void IoPool::watcherMain(const std::shared_ptr<State>& s) {
     } else if (allBusy) {
       quiet = 0;
     } else if (++quiet >= kQuietPolls) {
+      // No command has needed a spare for a while: they step aside.
       quiet = 0;
       s->watching = false;
+      s->parkSpares = true;
     }
   }
 }
@@ -308,6 +356,7 @@ void IoPool::join() {
     state_->total = 0;
   }
   state_->wake.notify_all();
+  state_->unpark.notify_all();
   for (auto& t : all) {
     if (own) {
       t.detach();

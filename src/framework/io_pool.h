@@ -18,8 +18,12 @@
 // one whenever every thread is in a command would grow the pool to a
 // thread per busy connection under load on few cores, and latency suffers
 // from the crowd. The watcher sleeps while some thread is free.
-// Spares that have run nothing for `spareIdle` end, as long as one thread
-// stays free; the `base` threads stay until the I/O context stops.
+// When no command has needed a spare for about 100 looks, the spares park
+// outside the I/O context after their current handler (a crowd of idle
+// threads in the I/O context's scheduling slows every request down), and
+// the watcher wakes parked spares before it starts new ones. Spares that
+// have run nothing, or stayed parked, for `spareIdle` end, as long as one
+// thread stays free; the `base` threads stay until the I/O context stops.
 //
 // At most `maxThreads` threads exist. At that limit, or when the system
 // refuses a thread, the connections wait for a command to end; the problem
@@ -95,6 +99,8 @@ class IoPool {
   static void threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
                          bool spare);
   static void watcherMain(const std::shared_ptr<State>& s);
+  static bool park(const std::shared_ptr<State>& s);
+  static void retire(State& s);
   // Called with the state's mutex held. Returns a problem to report, if
   // any; a base thread that cannot be started throws std::system_error.
   static std::string spawn(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
