@@ -373,6 +373,11 @@ std::size_t IoPool::threadCount() const {
   return state_->threads.size();
 }
 
+std::size_t IoPool::activeCount() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->active();
+}
+
 std::size_t IoPool::busyCount() const { return state_->busy.load(); }
 
 }  // namespace Ipc::detail

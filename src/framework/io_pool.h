@@ -92,7 +92,9 @@ class IoPool {
   // True on one of this pool's threads.
   bool runningInThisThread() const noexcept;
 
+  // Threads, parked spares included; threads that run the I/O context; threads in commands.
   std::size_t threadCount() const;
+  std::size_t activeCount() const;
   std::size_t busyCount() const;
 
  private:

@@ -103,6 +103,35 @@ TEST(IoPool, BlockedCommandsNeverKeepOtherWorkWaitingAndIdleSparesEnd) {
   EXPECT_EQ(after.get_future().wait_for(10s), std::future_status::ready);
 }
 
+TEST(IoPool, SparesNoLongerNeededParkAndAreWokenBeforeNewOnesStart) {
+  Rig rig({2, 64, 30s, 1000us});
+  // Six blocked commands, and plain I/O work that still runs: seven threads.
+  auto blockSixAndServe = [&](Gate& gate) {
+    for (int i = 0; i < 6; ++i) rig.command([&] { gate.pass(); });
+    ASSERT_TRUE(gate.waitForWaiting(6));
+    std::promise<void> ran;
+    asio::post(*rig.io, [&] { ran.set_value(); });
+    ASSERT_EQ(ran.get_future().wait_for(10s), std::future_status::ready);
+  };
+  Gate first;
+  blockSixAndServe(first);
+  first.open();
+  const std::size_t threads = rig.pool.threadCount();
+  EXPECT_GE(threads, 7u);
+  // Spares step aside after a handler once no command has needed them for
+  // a while; plain I/O work gives them handlers to finish.
+  ASSERT_TRUE(eventually([&] {
+    for (int i = 0; i < 50; ++i) asio::post(*rig.io, [] {});
+    return rig.pool.activeCount() == 2;
+  }));
+  EXPECT_EQ(rig.pool.threadCount(), threads);  // parked, not ended
+
+  Gate second;
+  blockSixAndServe(second);
+  EXPECT_EQ(rig.pool.threadCount(), threads);  // woken, none started
+  second.open();
+}
+
 TEST(IoPool, ShortCommandsDoNotMakeThePoolGrow) {
   Rig rig({2, 64, 30s, 1000us});
   std::atomic<int> left{20000};
