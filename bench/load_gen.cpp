@@ -189,7 +189,7 @@ void runClients(const Settings& s, const loadgen::Workload& w, std::vector<Strea
         const auto end = Clock::now();
         if (end > deadline) break;
         const auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
-        r.latenciesNs.push_back(static_cast<std::uint32_t>(std::min<std::int64_t>(ns, UINT32_MAX)));
+        r.latenciesNs.push_back(static_cast<std::uint64_t>(ns));
       }
     });
   }
@@ -199,7 +199,7 @@ void runClients(const Settings& s, const loadgen::Workload& w, std::vector<Strea
   for (auto& t : threads) t.join();
 }
 
-double percentile(const std::vector<std::uint32_t>& sorted, double p) {
+double percentile(const std::vector<std::uint64_t>& sorted, double p) {
   if (sorted.empty()) return 0;
   const auto i = static_cast<std::size_t>(p / 100.0 * static_cast<double>(sorted.size() - 1) + 0.5);
   return sorted[std::min(i, sorted.size() - 1)] / 1000.0;
@@ -294,7 +294,7 @@ int main(int argc, char** argv) {
   }
   const double elapsed = std::chrono::duration<double>(deadline - begin).count();
 
-  std::vector<std::uint32_t> all;
+  std::vector<std::uint64_t> all;
   std::uint64_t errors = 0;
   std::string firstError;
   for (auto& r : streams) {

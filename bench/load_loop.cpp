@@ -190,7 +190,7 @@ class Loop {
         if (c.s->errors++ == 0) c.s->firstError = problem;
       } else if (end <= deadline_) {
         const auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - c.start).count();
-        c.s->latenciesNs.push_back(static_cast<std::uint32_t>(std::min<std::int64_t>(ns, UINT32_MAX)));
+        c.s->latenciesNs.push_back(static_cast<std::uint64_t>(ns));
       }
       if (Clock::now() < deadline_) startRequest(c);
       return;

@@ -41,7 +41,7 @@ struct Stream {
   unsigned replies = 1;  // Resp: replies per request
 
   // Results.
-  std::vector<std::uint32_t> latenciesNs;
+  std::vector<std::uint64_t> latenciesNs;
   std::uint64_t errors = 0;
   std::string firstError;
 
