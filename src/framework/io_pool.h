@@ -11,7 +11,8 @@
 //   - one when no command has finished since the last look (commands that
 //     sleep, wait for a lock or compute for long); and
 //   - one for every thread whose command waits for the disk (a commit's
-//     sync), so that writers of different databases sync side by side.
+//     sync; state D in /proc/self/task/<tid>/stat), so that writers of
+//     different databases sync side by side.
 // Other connections thus wait at most about `blockedAfter` for blocked
 // commands. Threads that are merely computing, waiting for a core or for a
 // mutex held by a thread that waits for a core, start no spare: starting
