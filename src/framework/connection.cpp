@@ -389,7 +389,7 @@ void Connection::startWrite() {
     if (count == 0) return;
     boost::system::error_code ec = asio::error::would_block;
     const std::size_t n = writeAtOnce_ ? socket_.write_some(BufferSpan{gather_.data(), count}, ec) : 0;
-    if (ec == asio::error::would_block || ec == asio::error::try_again) {
+    if (ec == asio::error::would_block || ec == asio::error::try_again || (!ec && n == 0)) {
       writing_ = true;
       writeSince_ = Clock::now();
       socket_.async_write_some(BufferSpan{gather_.data(), count},
