@@ -42,6 +42,7 @@ class PartialCopy {
 // The destination is a new file that nobody else knows yet: no journal and
 // no syncs while it is written, one sync at the end.
 ConnectionPtr openCopy(const fs::path& file, const std::source_location& where) {
+  configureLibrary();
   sqlite3* raw = nullptr;
   const int rc = sqlite3_open_v2(file.c_str(), &raw,
                                  SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX |

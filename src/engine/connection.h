@@ -35,6 +35,10 @@ inline constexpr std::int64_t kWalSizeLimit = 64 * 1024 * 1024;
 
 enum class OpenMode { Existing, CreateNew };
 
+// Process-wide SQLite settings, applied once before the first connection
+// opens (openConnection calls it; other openers must too).
+void configureLibrary() noexcept;
+
 // Opens and configures a connection. Existing: the file must exist
 // (kFileNotFound otherwise) and be a database of this server
 // (checkIdentity, before anything is written to it). CreateNew: the file is
