@@ -19,7 +19,6 @@ namespace {
 using testing_support::LogCapture;
 using testing_support::TempDir;
 using testing_support::VerboseLog;
-using testing_support::writeFile;
 
 constexpr const char* kInitError = "Configuration initialization error: ";
 
@@ -29,7 +28,7 @@ class ConfigFile {
  public:
   explicit ConfigFile(const char* text) : root_(dir_.path().string() + "/db/") {
     std::filesystem::create_directories(root_);
-    if (text) writeFile(root_ + "config.json", text);
+    if (text) testing_support::writeFile(root_ + "config.json", text);
   }
   const std::string& root() const { return root_; }
   DBConfig load() const { return DBConfig::load(root_); }
@@ -45,9 +44,8 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
   VerboseLog quiet(false);
   LogCapture log;
   const ConfigFile file(nullptr);
-  const DBConfig c = file.load();
+  file.load();
   const std::string& r = file.root();
-
   const std::string expected = std::string("Starting with:\n") +
                                "\tversion: " + CVDB_VERSION + "\n"
                                "\tdb root folder: \"" + r + "\"\n"
@@ -67,24 +65,21 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
   ASSERT_EQ(entries.size(), 1u);
   EXPECT_EQ(entries[0].priority, Log::Notice);
   EXPECT_EQ(entries[0].text, expected);
-  EXPECT_FALSE(c.ForceIP4);
+  // A local root raises no network warning.
+  EXPECT_EQ(log.count(Log::Warning, "Network location"), 0u);
 }
 
 TEST(Config, UnusableFilesKeepDefaults) {
-  struct Case {
-    const char* text;
-    bool logsError;
-  };
-  for (const Case& k : {Case{"{}", false}, Case{"{\"DBRoot\": ", true}, Case{"", true},
-                        Case{"[1, 2]", true}, Case{"{} trailing", true}}) {
+  for (const auto& [text, logsError] : std::vector<std::pair<const char*, bool>>{
+           {"{}", false}, {"{\"DBRoot\": ", true}, {"", true}, {"[1, 2]", true}, {"{} trailing", true}}) {
+    SCOPED_TRACE(text);
     LogCapture log;
-    const DBConfig c = loadWith(k.text);
-    EXPECT_EQ(c.ServerPort, 45678) << k.text;
-    EXPECT_EQ(c.MaxActiveDBs, 100u) << k.text;
-    EXPECT_EQ(log.count(Log::Error, kInitError), k.logsError ? 1u : 0u) << k.text;
-    EXPECT_EQ(log.count(Log::Notice, "Starting with:"), 1u) << k.text;
+    const DBConfig c = loadWith(text);
+    EXPECT_EQ(c.ServerPort, 45678);
+    EXPECT_EQ(c.MaxActiveDBs, 100u);
+    EXPECT_EQ(log.count(Log::Error, kInitError), logsError ? 1u : 0u);
+    EXPECT_EQ(log.count(Log::Notice, "Starting with:"), 1u);
   }
-
   // Unreadable (here a folder in its place) counts as missing: no message.
   LogCapture log;
   const ConfigFile file(nullptr);
@@ -115,18 +110,38 @@ TEST(Config, WrongTypeStopsReadingInKeyOrderNotFileOrder) {
   EXPECT_EQ(log.count(Log::Error, "Wrong type: integer. Expected type: string"), 1u);
 }
 
-TEST(Config, LooselyTypedKeysNeverStopReading) {
-  LogCapture log;
-  VerboseLog quiet(false);
-  const DBConfig c = loadWith(R"({"DBRoot": 5, "DBLogRoot": [], "BackupFolder": null,
-      "ForceIP4": "yes", "ExtraLog": 1, "EnableEngineLogging": 1, "ServerPort": 1})");
-  EXPECT_EQ(log.count(Log::Error, kInitError), 0u);
-  EXPECT_EQ(c.ServerPort, 1);
-  EXPECT_FALSE(c.ForceIP4);
-  EXPECT_FALSE(c.EnableEngineLogging);
-  EXPECT_FALSE(g_LogVerbose);
-  EXPECT_EQ(c.BackupFolder, c.DBRoot + "db.backup/");
-  EXPECT_EQ(c.DBLogRoot, c.DBRoot);
+TEST(Config, LooselyTypedKeysNeverStopReadingAndSwitchesTakeOnlyTheLiteralTrue) {
+  {
+    LogCapture log;
+    VerboseLog quiet(false);
+    const DBConfig c = loadWith(R"({"DBRoot": 5, "DBLogRoot": [], "BackupFolder": null,
+        "ForceIP4": "yes", "ExtraLog": 1, "EnableEngineLogging": 1, "ServerPort": 1})");
+    EXPECT_EQ(log.count(Log::Error, kInitError), 0u);
+    EXPECT_EQ(c.ServerPort, 1);
+    EXPECT_FALSE(c.ForceIP4);
+    EXPECT_FALSE(c.EnableEngineLogging);
+    EXPECT_FALSE(g_LogVerbose);
+    EXPECT_EQ(c.BackupFolder, c.DBRoot + "db.backup/");
+    EXPECT_EQ(c.DBLogRoot, c.DBRoot);
+  }
+  {
+    VerboseLog quiet(false);
+    const DBConfig c = loadWith(R"({"ForceIP4": true, "ExtraLog": true, "EnableEngineLogging": true})");
+    EXPECT_TRUE(c.ForceIP4);
+    EXPECT_TRUE(c.EnableEngineLogging);
+    EXPECT_TRUE(g_LogVerbose);
+    EXPECT_NE(c.printout().find("\textra logging: enabled\n"), std::string::npos);
+    EXPECT_NE(c.printout().find("\tdb engine event logging: enabled\n"), std::string::npos);
+  }
+  {
+    // ExtraLog false leaves a flag that is already on alone.
+    VerboseLog verbose(true);
+    loadWith(R"({"ExtraLog": false})");
+    EXPECT_TRUE(g_LogVerbose);
+  }
+  for (const char* text : {R"({"ForceIP4": 1})", R"({"ForceIP4": "true"})", R"({"ForceIP4": false})"}) {
+    EXPECT_FALSE(loadWith(text).ForceIP4) << text;
+  }
 }
 
 TEST(Config, NumbersAreLimitedAndTruncatedAsStored) {
@@ -149,66 +164,31 @@ TEST(Config, NumbersAreLimitedAndTruncatedAsStored) {
   EXPECT_NE(b.printout().find("\tmaximum wait time maintenance operation: -1\n"), std::string::npos);
 }
 
-TEST(Config, PrefixIsPaddedOrCutToThreeCharactersAndFileNameKeptAsIs) {
+TEST(Config, TextsArePaddedCutOrNormalised) {
+  // The prefix is cut or padded to three characters, the file name is kept
+  // as it is, folders get "/" separators and one trailing "/".
   EXPECT_EQ(loadWith(R"({"DBFilesPrefix": "abcdef"})").DBFilesPrefix, "abc");
   EXPECT_EQ(loadWith(R"({"DBFilesPrefix": "x"})").DBFilesPrefix, "x__");
   EXPECT_EQ(loadWith(R"({"DBFilesPrefix": ""})").DBFilesPrefix, "___");
   EXPECT_EQ(loadWith(R"({"DBFileName": ""})").DBFileName, "");
   EXPECT_EQ(loadWith(R"({"DBFileName": "Main DB.edb"})").DBFileName, "Main DB.edb");
-}
 
-TEST(Config, SwitchesTakeOnlyTheLiteralTrue) {
-  {
-    VerboseLog quiet(false);
-    const DBConfig c = loadWith(R"({"ForceIP4": true, "ExtraLog": true, "EnableEngineLogging": true})");
-    EXPECT_TRUE(c.ForceIP4);
-    EXPECT_TRUE(c.EnableEngineLogging);
-    EXPECT_TRUE(g_LogVerbose);
-    EXPECT_NE(c.printout().find("\textra logging: enabled\n"), std::string::npos);
-    EXPECT_NE(c.printout().find("\tdb engine event logging: enabled\n"), std::string::npos);
-  }
-  {
-    // ExtraLog false leaves a flag that is already on alone.
-    VerboseLog verbose(true);
-    loadWith(R"({"ExtraLog": false})");
-    EXPECT_TRUE(g_LogVerbose);
-  }
-  for (const char* text : {R"({"ForceIP4": 1})", R"({"ForceIP4": "true"})", R"({"ForceIP4": false})"}) {
-    EXPECT_FALSE(loadWith(text).ForceIP4) << text;
-  }
-}
-
-TEST(Config, FoldersAreNormalisedAndTheBackupFolderFollowsTheRoot) {
   const DBConfig a = loadWith(R"({"DBRoot": "/srv\\cvdb"})");
   EXPECT_EQ(a.DBRoot, "/srv/cvdb/");
   EXPECT_EQ(a.DBLogRoot, "/srv/cvdb/");
   EXPECT_EQ(a.BackupFolder, "/srv/cvdb/db.backup/");
-
   const DBConfig b = loadWith(R"({"DBRoot": "/data/", "DBLogRoot": "/logs", "BackupFolder": "/data/"})");
   EXPECT_EQ(b.DBLogRoot, "/logs/");
   EXPECT_EQ(b.BackupFolder, "/data/db.backup/");
-
   EXPECT_EQ(loadWith(R"({"BackupFolder": "\\mnt\\bak"})").BackupFolder, "/mnt/bak/");
-  EXPECT_EQ(normaliseFolder(""), "");
   const ConfigFile empty(R"({"DBRoot": "", "DBLogRoot": "", "BackupFolder": ""})");
   const DBConfig d = empty.load();
   EXPECT_EQ(d.DBRoot, empty.root());
   EXPECT_EQ(d.DBLogRoot, empty.root());
   EXPECT_EQ(d.BackupFolder, empty.root() + "db.backup/");
-
   // Compared byte for byte before normalising: "/data" is not "/data/", so
   // the backup folder is the root itself, as it always has been.
-  const DBConfig c = loadWith(R"({"DBRoot": "/data", "BackupFolder": "/data"})");
-  EXPECT_EQ(c.BackupFolder, "/data/");
-}
-
-TEST(Config, LocalRootGivesNoNetworkWarning) {
-  LogCapture log;
-  TempDir data;
-  const ConfigFile file(
-      (std::string(R"({"DBRoot": ")") + data.path().string() + R"(/not/yet/created"})").c_str());
-  file.load();
-  EXPECT_EQ(log.count(Log::Warning, "Network location"), 0u);
+  EXPECT_EQ(loadWith(R"({"DBRoot": "/data", "BackupFolder": "/data"})").BackupFolder, "/data/");
 }
 
 TEST(NetworkPath, RemoteFileSystemsAreRecognised) {
@@ -218,22 +198,6 @@ TEST(NetworkPath, RemoteFileSystemsAreRecognised) {
   EXPECT_FALSE(DB::isNetworkFileSystem(FUSE_SUPER_MAGIC, "fuse.ntfs-3g"));
   EXPECT_FALSE(DB::isNetworkFileSystem(EXT4_SUPER_MAGIC, "fuse.sshfs"));
   EXPECT_FALSE(DB::isNetworkPath(""));
-}
-
-TEST(Config, InstOverrideNestsAndRestores) {
-  DBConfig a;
-  a.DBRoot = "/a/";
-  DBConfig b;
-  b.DBRoot = "/b/";
-  {
-    DBConfig::TestOverride first(a);
-    EXPECT_EQ(DBConfig::inst().DBRoot, "/a/");
-    {
-      DBConfig::TestOverride second(b);
-      EXPECT_EQ(DBConfig::inst().DBRoot, "/b/");
-    }
-    EXPECT_EQ(DBConfig::inst().DBRoot, "/a/");
-  }
 }
 
 // The only test that loads the process-wide record: it must happen once,
