@@ -96,16 +96,21 @@ void FixedUseClock::set(std::int64_t now) noexcept { g_clockNow = now; }
 
 void FixedUseClock::advance(std::int64_t seconds) noexcept { g_clockNow += seconds; }
 
+std::int64_t oldestUseKept(std::uint64_t limit) noexcept {
+  if (limit == 0 || limit > static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
+    return std::numeric_limits<std::int64_t>::min();
+  }
+  // Saturates: a clock set far into the past must not overflow.
+  const std::int64_t now = useClockNow();
+  const auto span = static_cast<std::int64_t>(limit);
+  return now < std::numeric_limits<std::int64_t>::min() + span ? std::numeric_limits<std::int64_t>::min() : now - span;
+}
+
 UseInfos::UseInfos(const json::Value& stored, std::uint64_t limit) {
   if (!stored.isObject()) return;
   json_t* list = json_object_get(stored.get(), kEntriesKey);
   if (!json_is_array(list)) return;
-  const std::int64_t now = useClockNow();
-  // Entries stamped before this moment are too old to be kept.
-  const std::int64_t oldest =
-      limit == 0 || limit > static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())
-          ? std::numeric_limits<std::int64_t>::min()
-          : now - static_cast<std::int64_t>(limit);
+  const std::int64_t oldest = oldestUseKept(limit);
   const std::size_t n = json_array_size(list);
   entries_.reserve(n);
   for (std::size_t i = 0; i < n; ++i) {

@@ -40,6 +40,11 @@ inline constexpr std::uint64_t kUseLimitSeconds = 25200;
 // that stamps use entries and against which their age is measured.
 std::int64_t useClockNow() noexcept;
 
+// The oldest time stamp that a read of a stored use list with this limit
+// keeps, measured against useClockNow(); the smallest int64 when limit 0
+// keeps every entry.
+std::int64_t oldestUseKept(std::uint64_t limit) noexcept;
+
 // For tests: while an object lives, useClockNow() returns its time.
 // Not for concurrent use with another FixedUseClock.
 class FixedUseClock {
