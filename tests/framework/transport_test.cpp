@@ -108,21 +108,16 @@ void expectBye(RawClient& c, const std::string& reasonStart) {
   EXPECT_EQ(last->text().rfind(reasonStart, 0), 0u) << last->text();
 }
 
-TEST_F(TransportTest, AnswersOverIpv4AndIpv6AndCarriesPayloads) {
-  RawClient v4(port());
-  EXPECT_TRUE(v4.ping());
+TEST_F(TransportTest, AnswersOverIpv4AndIpv6UnlessForcedToIpv4) {
+  EXPECT_TRUE(RawClient(port()).ping());
   RawClient v6(port(), true);
-  EXPECT_TRUE(v6.ping());
-
   v6.send(requestBytes(kEcho, strField("hello")));
   const auto f = v6.read();
   ASSERT_TRUE(f);
   EXPECT_EQ(f->tag, kEcho);
   EXPECT_EQ(f->kind, FrameKind::Answer);
   EXPECT_EQ(f->text(), "hello");
-}
 
-TEST_F(TransportTest, ForcedIpv4ListensOnIpv4Only) {
   stop();
   start(true);
   EXPECT_TRUE(RawClient(port()).ping());
@@ -144,55 +139,43 @@ TEST_F(TransportTest, UnknownTagsAreRefusedWithoutCommandAndTheConnectionGoesOn)
   EXPECT_EQ(proc->processed, 0);
 }
 
-struct BadInput {
-  const char* name;
-  std::string bytes;
-  const char* bye;
-  const char* report;
-};
-
 std::string lengthOnly(std::uint32_t length) {
   std::string s(4, '\0');
   for (int i = 0; i < 4; ++i) s[i] = static_cast<char>((length >> (8 * i)) & 0xFF);
   return s;
 }
 
-class MalformedInputTest : public TransportTest, public ::testing::WithParamInterface<BadInput> {};
-
-TEST_P(MalformedInputTest, EndsOnlyThatConnection) {
+TEST_F(TransportTest, MalformedInputEndsOnlyThatConnection) {
+  std::string truncated;
+  wire::Writer(truncated).u32(100);
+  truncated = requestBytes(kEcho, truncated + "abc");  // a string that runs past its frame
+  struct Case {
+    std::string bytes;
+    const char* bye;
+    const char* report;
+  };
+  const std::vector<Case> cases{
+      {lengthOnly(0), "Malformed frame: length", "length 0 is out of range"},
+      {lengthOnly(1) + "x", "Malformed frame: length", "length 1 is out of range"},
+      // Refused on the header alone: no body follows and none is awaited.
+      {lengthOnly(wire::kMaxBody + 1), "Malformed frame: length", "is out of range"},
+      {frameBytes(1, FrameKind::Answer), "Malformed frame: not a request", "is not a request"},
+      {truncated, "Malformed request Test10", "Malformed request Test10"},
+      {requestBytes(kEcho, strField("x") + "zz"), "Malformed request Test10", "trailing"},
+      {requestBytes(1, "p"), "Malformed request PingPong", "Malformed request PingPong"},
+      {requestBytes(kFactoryThrows), "Terminating client connection", "Cannot create a command for tag 18"},
+  };
   RawClient bystander(port());
-  ASSERT_TRUE(bystander.ping());
-  RawClient bad(port());
-  bad.send(GetParam().bytes);
-  expectBye(bad, GetParam().bye);
-  EXPECT_TRUE(reports.waitFor(GetParam().report));
-  EXPECT_TRUE(bystander.ping());
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.report);
+    RawClient bad(port());
+    bad.send(c.bytes);
+    expectBye(bad, c.bye);
+    EXPECT_TRUE(reports.waitFor(c.report));
+    EXPECT_TRUE(bystander.ping());
+  }
   EXPECT_EQ(proc->processed, 0);
 }
-
-std::string truncatedString() {
-  std::string p;
-  wire::Writer(p).u32(100);
-  return requestBytes(kEcho, p + "abc");
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Frames, MalformedInputTest,
-    ::testing::Values(
-        BadInput{"LengthZero", lengthOnly(0), "Malformed frame: length", "length 0 is out of range"},
-        BadInput{"LengthOne", lengthOnly(1) + "x", "Malformed frame: length", "length 1 is out of range"},
-        // Refused on the header alone: no body follows and none is awaited.
-        BadInput{"LengthBeyondLimit", lengthOnly(wire::kMaxBody + 1), "Malformed frame: length",
-                 "is out of range"},
-        BadInput{"AnswerKindFromClient", frameBytes(1, FrameKind::Answer), "Malformed frame: not a request",
-                 "is not a request"},
-        BadInput{"StringPastItsFrame", truncatedString(), "Malformed request Test10", "Malformed request Test10"},
-        BadInput{"TrailingGarbage", requestBytes(kEcho, strField("x") + "zz"), "Malformed request Test10",
-                 "trailing"},
-        BadInput{"PayloadOnPing", requestBytes(1, "p"), "Malformed request PingPong", "Malformed request PingPong"},
-        BadInput{"FactoryThrows", requestBytes(kFactoryThrows), "Terminating client connection",
-                 "Cannot create a command for tag 18"}),
-    [](const ::testing::TestParamInfo<BadInput>& p) { return std::string(p.param.name); });
 
 TEST_F(TransportTest, AStalledFrameIsDroppedWhileAnIdleConnectionIsKept) {
   RawClient idle(port());
@@ -207,7 +190,7 @@ TEST_F(TransportTest, AStalledFrameIsDroppedWhileAnIdleConnectionIsKept) {
   EXPECT_TRUE(idle.ping());
 }
 
-TEST_F(TransportTest, AClientVanishingMidRequestLeavesNothingBehind) {
+TEST_F(TransportTest, AClientVanishingMidRequestMidAnswerOrMidCommandLeavesNothingBehind) {
   {
     RawClient c(port());
     c.send(requestBytes(kEcho, strField(std::string(100000, 'x'))).substr(0, 50000));
@@ -216,9 +199,7 @@ TEST_F(TransportTest, AClientVanishingMidRequestLeavesNothingBehind) {
   EXPECT_TRUE(reports.waitFor("ended in the middle of a frame"));
   EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
   EXPECT_EQ(proc->processed, 0);
-}
 
-TEST_F(TransportTest, AClientVanishingMidAnswerOrMidCommandLeavesNothingBehind) {
   {
     RawClient c(port());
     c.send(requestBytes(kSlot, strField("slot")));
@@ -272,39 +253,16 @@ TEST_F(TransportTest, ProgressFromAnotherThreadPrecedesTheNextRequest) {
   EXPECT_EQ(pong->kind, FrameKind::Answer);
 }
 
-TEST_F(TransportTest, CommandsOfOneConnectionRunInOrderWhileOthersGoOn) {
-  RawClient a(port());
-  RawClient b(port());
-  a.send(requestBytes(kBlock, strField("a1")) + requestBytes(kEcho, strField("a2")));
-  ASSERT_TRUE(proc->waitStarted("a1"));
-
-  b.send(requestBytes(kEcho, strField("b1")));
-  const auto fb = b.read();
-  ASSERT_TRUE(fb);
-  EXPECT_EQ(fb->text(), "b1");
-  EXPECT_TRUE(b.ping());
-
-  proc->openGate();
-  const auto f1 = a.read();
-  const auto f2 = a.read();
-  ASSERT_TRUE(f1 && f2);
-  EXPECT_EQ(f1->text(), "a1");
-  EXPECT_EQ(f2->text(), "a2");
-  const auto ev = proc->events();
-  const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
-  EXPECT_LT(pos("start:b1"), pos("end:a1"));
-  EXPECT_LT(pos("end:a1"), pos("start:a2"));
-}
-
-TEST_F(TransportTest, CommandsBlockingEveryIoThreadAtOnceStallNoOtherConnection) {
-  // Twice as many blocked commands as the server has I/O threads.
+TEST_F(TransportTest, CommandsOfOneConnectionRunInOrderAndBlockedOnesStallNoOtherConnection) {
+  // Twice as many blocked connections as the server has I/O threads; the
+  // first has a second request waiting behind its blocked one.
   std::vector<RawClient> blocked;
   for (int i = 0; i < 4; ++i) {
     blocked.emplace_back(port());
-    blocked.back().send(requestBytes(kBlock, strField("b" + std::to_string(i))));
+    const std::string text = "b" + std::to_string(i);
+    blocked.back().send(requestBytes(kBlock, strField(text)) + (i == 0 ? requestBytes(kEcho, strField("after")) : ""));
+    ASSERT_TRUE(proc->waitStarted(text));
   }
-  for (int i = 0; i < 4; ++i) ASSERT_TRUE(proc->waitStarted("b" + std::to_string(i)));
-
   RawClient other(port());
   EXPECT_TRUE(other.ping());
   other.send(requestBytes(kEcho, strField("still served")));
@@ -318,6 +276,13 @@ TEST_F(TransportTest, CommandsBlockingEveryIoThreadAtOnceStallNoOtherConnection)
     ASSERT_TRUE(answer);
     EXPECT_EQ(answer->text(), "b" + std::to_string(i));
   }
+  const auto after = blocked[0].read();
+  ASSERT_TRUE(after);
+  EXPECT_EQ(after->text(), "after");
+  const auto ev = proc->events();
+  const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
+  EXPECT_LT(pos("start:still served"), pos("end:b0"));
+  EXPECT_LT(pos("end:b0"), pos("start:after"));
 }
 
 TEST_F(TransportTest, ProcessorFaultsEndTheirConnectionOnly) {
@@ -340,7 +305,7 @@ TEST_F(TransportTest, ProcessorFaultsEndTheirConnectionOnly) {
   }
 }
 
-TEST_F(TransportTest, LargeFramesRoundTripIntact) {
+TEST_F(TransportTest, LargeAndPipelinedFramesRoundTripIntactAndInOrder) {
   RawClient c(port());
   std::string text(8 << 20, '\0');
   for (std::size_t i = 0; i < text.size(); ++i) text[i] = static_cast<char>(i * 31 + 7);
@@ -358,20 +323,17 @@ TEST_F(TransportTest, LargeFramesRoundTripIntact) {
   bool same = true;
   for (std::size_t i = 0; i < bytes.size(); ++i) same &= bytes[i] == static_cast<char>(i * 7);
   EXPECT_TRUE(same);
-}
 
-TEST_F(TransportTest, PipelinedRequestsAreAllAnsweredInOrder) {
-  RawClient c(port());
   std::string burst;
   for (int i = 0; i < 2000; ++i) burst += i % 2 ? requestBytes(1) : requestBytes(kEcho, strField(std::to_string(i)));
   c.send(burst);
   for (int i = 0; i < 2000; ++i) {
-    const auto f = c.read();
-    ASSERT_TRUE(f);
+    const auto answer = c.read();
+    ASSERT_TRUE(answer);
     if (i % 2) {
-      ASSERT_EQ(f->tag, 1);
+      ASSERT_EQ(answer->tag, 1);
     } else {
-      ASSERT_EQ(f->text(), std::to_string(i));
+      ASSERT_EQ(answer->text(), std::to_string(i));
     }
   }
 }
@@ -381,21 +343,6 @@ TEST_F(TransportTest, AClientThatStopsReadingIsDisconnected) {
   c.send(requestBytes(kBig, strField("67108864")));
   EXPECT_TRUE(reports.waitFor("has not read its answers"));
   EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
-}
-
-TEST_F(TransportTest, StopDisconnectsIdleClientsPromptly) {
-  std::vector<RawClient> clients;
-  for (int i = 0; i < 50; ++i) clients.emplace_back(port(), i % 2 == 1);
-  for (auto& c : clients) ASSERT_TRUE(c.ping());
-
-  const auto t0 = std::chrono::steady_clock::now();
-  EXPECT_TRUE(server->signalStop());
-  EXPECT_FALSE(server->signalStop());
-  server->waitToFinish();
-  EXPECT_LT(std::chrono::steady_clock::now() - t0, 1s);
-  EXPECT_EQ(server->connectionCount(), 0u);
-  for (auto& c : clients) expectBye(c, "Server is stopping");
-  EXPECT_FALSE(RawClient::tryConnect(port(), false));
 }
 
 TEST_F(TransportTest, StopWaitsForARunningCommandAndReleasesItsConnection) {
@@ -415,19 +362,13 @@ TEST_F(TransportTest, StopWaitsForARunningCommandAndReleasesItsConnection) {
   EXPECT_EQ(proc->events().back(), "end:running");
 }
 
-TEST_F(TransportTest, DestroyingTheServerStopsIt) {
-  RawClient c(port());
-  ASSERT_TRUE(c.ping());
-  server.reset();
-  expectBye(c, "Server is stopping");
-}
-
-TEST_F(TransportTest, ASocketHeldBeyondTheServerStaysSafeToUse) {
+TEST_F(TransportTest, DestroyingTheServerStopsItAndASocketHeldBeyondItStaysSafeToUse) {
   {
     RawClient c(port());
     c.send(requestBytes(kSlot, strField("keep")));
     ASSERT_TRUE(c.read());
-    stop();
+    server.reset();
+    expectBye(c, "Server is stopping");
   }
   // What a maintenance thread may still do with its command's socket.
   auto socket = std::move(proc->keptSocket);
@@ -456,29 +397,35 @@ void raiseFileLimit() {
   ::setrlimit(RLIMIT_NOFILE, &l);
 }
 
-TEST_F(TransportTest, AThousandIdleConnectionsAreCheap) {
+TEST_F(TransportTest, AThousandIdleConnectionsAreCheapAndAStopLetsThemAllGoPromptly) {
   raiseFileLimit();
   rlimit l{};
   ::getrlimit(RLIMIT_NOFILE, &l);
-  if (l.rlim_cur < 2100) GTEST_SKIP() << "open-file limit too low: " << l.rlim_cur;
-
+  // Each connection costs this process two descriptors; with a low limit
+  // only the stop is checked.
+  const std::size_t n = std::min<std::size_t>(1000, (l.rlim_cur - 100) / 2);
   std::vector<RawClient> clients;
-  clients.reserve(1000);
-  for (int i = 0; i < 20; ++i) clients.emplace_back(port());  // warm the allocator and threads
+  clients.reserve(n);
+  for (std::size_t i = 0; i < 20; ++i) clients.emplace_back(port(), i % 2 == 1);  // warm the allocator and threads
   for (auto& c : clients) ASSERT_TRUE(c.ping());
   const long before = residentBytes();
-  for (int i = 0; i < 980; ++i) clients.emplace_back(port());
+  while (clients.size() < n) clients.emplace_back(port());
   for (auto& c : clients) ASSERT_TRUE(c.ping());
-  ASSERT_TRUE(eventually([&] { return server->connectionCount() == 1000; }));
+  ASSERT_TRUE(eventually([&] { return server->connectionCount() == n; }));
   const long grown = residentBytes() - before;
-  std::printf("[ measure  ] 980 more idle connections: %.1f MiB resident (%.1f KiB each)\n", grown / 1048576.0,
-              grown / 1024.0 / 980);
-  EXPECT_LT(grown, 64L << 20);
+  std::printf("[ measure  ] %zu more idle connections: %.1f MiB resident\n", n - 20, grown / 1048576.0);
+  if (n == 1000) {
+    EXPECT_LT(grown, 64L << 20);
+  }
 
   const auto t0 = std::chrono::steady_clock::now();
-  server->signalStop();
+  EXPECT_TRUE(server->signalStop());
+  EXPECT_FALSE(server->signalStop());
   server->waitToFinish();
   EXPECT_LT(std::chrono::steady_clock::now() - t0, 1s);
+  EXPECT_EQ(server->connectionCount(), 0u);
+  for (auto& c : clients) expectBye(c, "Server is stopping");
+  EXPECT_FALSE(RawClient::tryConnect(port(), false));
 }
 
 TEST_F(TransportTest, RunningOutOfDescriptorsRefusesNewConnectionsAndKeepsServing) {

@@ -2,16 +2,17 @@
 
 #include <gtest/gtest.h>
 
-#include "framework/frame.h"
+#include <cstring>
 
 namespace {
 
-TEST(Wire, RoundTripOfEveryFieldKind) {
+TEST(Wire, RoundTripOfEveryFieldKindInLittleEndian) {
   std::string out;
   wire::Writer w(out);
+  w.u32(0x01020304);
+  EXPECT_EQ(out, std::string("\x04\x03\x02\x01", 4));
   w.u8(0xAB);
   w.boolean(true);
-  w.u32(0xDEADBEEF);
   w.i32(-5);
   w.u64(0x0102030405060708ULL);
   w.i64(-1);
@@ -20,9 +21,9 @@ TEST(Wire, RoundTripOfEveryFieldKind) {
   w.strList({"", "one", "two"});
 
   wire::Reader r(out);
+  EXPECT_EQ(r.u32(), 0x01020304u);
   EXPECT_EQ(r.u8(), 0xAB);
   EXPECT_TRUE(r.boolean());
-  EXPECT_EQ(r.u32(), 0xDEADBEEFu);
   EXPECT_EQ(r.i32(), -5);
   EXPECT_EQ(r.u64(), 0x0102030405060708ULL);
   EXPECT_EQ(r.i64(), -1);
@@ -32,35 +33,20 @@ TEST(Wire, RoundTripOfEveryFieldKind) {
   EXPECT_NO_THROW(r.expectEnd());
 }
 
-TEST(Wire, IntegersAreLittleEndian) {
-  std::string out;
-  wire::Writer w(out);
-  w.u32(0x01020304);
-  EXPECT_EQ(out, std::string("\x04\x03\x02\x01", 4));
-}
-
-TEST(Wire, LengthsBeyondTheMessageAreRefusedBeforeAllocating) {
-  // A string that claims 4 GiB, a byte string that claims 2^63 bytes and a
-  // list that claims 2^32-1 entries, each in a message of a few bytes.
-  const std::string bigString("\xff\xff\xff\xff" "ab", 6);
-  const std::string bigBytes("\0\0\0\0\0\0\0\x80" "ab", 10);
-  const std::string bigList("\xff\xff\xff\xff", 4);
-  wire::Reader a(bigString), b(bigBytes), c(bigList);
-  EXPECT_THROW(a.str(), wire::DecodeError);
-  EXPECT_THROW(b.bytes(), wire::DecodeError);
-  EXPECT_THROW(c.strList(), wire::DecodeError);
-}
-
-TEST(Wire, TruncatedIntegersBadBooleansAndTrailingBytesAreMalformed) {
-  // Readers do not own their bytes: keep the messages alive.
-  const std::string shortMsg("\x01\x02\x03", 3), badBoolMsg("\x02", 1), trailingMsg("\x01\x02", 2);
-  wire::Reader shortInt(shortMsg);
-  EXPECT_THROW(shortInt.u32(), wire::DecodeError);
-  wire::Reader badBool(badBoolMsg);
-  EXPECT_THROW(badBool.boolean(), wire::DecodeError);
-  wire::Reader trailing(trailingMsg);
-  trailing.u8();
-  EXPECT_THROW(trailing.expectEnd(), wire::DecodeError);
+TEST(Wire, MalformedMessagesAreRefusedBeforeAnythingIsAllocated) {
+  // Readers do not own their bytes: keep the messages alive. A string that
+  // claims 4 GiB, a byte string that claims 2^63 bytes and a list that
+  // claims 2^32-1 entries, each in a message of a few bytes.
+  const std::string bigString("\xff\xff\xff\xff" "ab", 6), bigBytes("\0\0\0\0\0\0\0\x80" "ab", 10),
+      bigList("\xff\xff\xff\xff", 4), shortInt("\x01\x02\x03", 3), badBool("\x02", 1), trailing("\x01\x02", 2);
+  EXPECT_THROW(wire::Reader(bigString).str(), wire::DecodeError);
+  EXPECT_THROW(wire::Reader(bigBytes).bytes(), wire::DecodeError);
+  EXPECT_THROW(wire::Reader(bigList).strList(), wire::DecodeError);
+  EXPECT_THROW(wire::Reader(shortInt).u32(), wire::DecodeError);
+  EXPECT_THROW(wire::Reader(badBool).boolean(), wire::DecodeError);
+  wire::Reader r(trailing);
+  r.u8();
+  EXPECT_THROW(r.expectEnd(), wire::DecodeError);
 }
 
 TEST(Wire, SharedBytesTravelWithoutACopy) {
@@ -75,28 +61,14 @@ TEST(Wire, SharedBytesTravelWithoutACopy) {
 
   // A reader with an owner hands out views that keep the owner alive.
   std::string msg;
-  wire::Writer m(msg);
-  m.bytes("abc", 3);
+  wire::Writer(msg).bytes("abc", 3);
   std::shared_ptr<unsigned char> owner(ExportedUCharAlloc::alloc(msg.size()), ExportedUCharAlloc());
   std::memcpy(owner.get(), msg.data(), msg.size());
   wire::Reader r(owner, msg.size());
   SharedMemBuffer b = r.sharedBytes();
-  EXPECT_EQ(b.view(), "abc");
   EXPECT_EQ(b.data(), owner.get() + 8);
   owner.reset();
   EXPECT_EQ(b.view(), "abc");
-}
-
-TEST(Frame, HeaderCarriesLengthTagAndKind) {
-  wire::OutFrame f;
-  wire::beginFrame(f.head, 7, wire::FrameKind::Answer);
-  wire::Writer w(f.head, f.tail);
-  w.str("hi");
-  wire::endFrame(f);
-  ASSERT_EQ(f.head.size(), wire::kHeaderSize + 6);
-  EXPECT_EQ(wire::frameLength(reinterpret_cast<const unsigned char*>(f.head.data())), 8u);
-  EXPECT_EQ(f.head[4], 7);
-  EXPECT_EQ(f.head[5], static_cast<char>(wire::FrameKind::Answer));
 }
 
 }  // namespace
