@@ -1,7 +1,6 @@
 // Online backup under writes, and restore with its refusals.
 
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <atomic>
 #include <filesystem>
@@ -10,53 +9,19 @@
 
 #include "engine/backup.h"
 #include "engine/database_file.h"
-#include "engine/db_exc.h"
-#include "engine/engine_errors.h"
 #include "engine/restore.h"
-#include "engine/transaction.h"
 #include "engine_fixture.h"
-#include "support/temp_dir.h"
+#include "support/raw_db.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-namespace err = DB::err;
+using namespace engine_testing;
 using engine::StatusKind;
 using engine::StatusNotification;
-using engine_testing::EngineTest;
+using testing_support::RawDb;
 using testing_support::readFile;
 using testing_support::writeFile;
-
-int codeOf(const std::function<void()>& action) {
-  try {
-    action();
-  } catch (const DB::DBExc& e) {
-    return e.code();
-  }
-  return 0;
-}
-
-// Runs one-value queries on a database file outside the engine.
-class RawDb {
- public:
-  explicit RawDb(const fs::path& file) { EXPECT_EQ(sqlite3_open(file.c_str(), &db_), SQLITE_OK); }
-  ~RawDb() { sqlite3_close(db_); }
-  std::string text(const char* sql) {
-    sqlite3_stmt* s = nullptr;
-    std::string result = "<error>";
-    if (sqlite3_prepare_v2(db_, sql, -1, &s, nullptr) == SQLITE_OK && sqlite3_step(s) == SQLITE_ROW) {
-      const auto* t = sqlite3_column_text(s, 0);
-      result = t ? reinterpret_cast<const char*>(t) : "";
-    }
-    sqlite3_finalize(s);
-    return result;
-  }
-  std::int64_t number(const char* sql) { return std::stoll(text(sql)); }
-  void exec(const char* sql) { EXPECT_EQ(sqlite3_exec(db_, sql, nullptr, nullptr, nullptr), SQLITE_OK) << sql; }
-
- private:
-  sqlite3* db_ = nullptr;
-};
 
 class BackupRestore : public EngineTest {
  protected:
@@ -102,8 +67,7 @@ TEST_F(BackupRestore, BackupUnderContinuousWritesIsAConsistentSnapshot) {
   std::atomic<bool> stop{false};
   std::atomic<int> transfers{0};
   std::thread writer([&] {
-    auto own = instance->beginSession();
-    own->openDatabase();
+    auto own = openSession(instance);
     while (!stop) {
       DB::runInTransaction(*own, [&] {
         own->prepare("UPDATE counter SET value = value - 1 WHERE id = 1").run();
@@ -134,7 +98,7 @@ TEST_F(BackupRestore, BackupUnderContinuousWritesIsAConsistentSnapshot) {
   const fs::path copy = target / "cvdb.edb";
   EXPECT_EQ(fs::directory_iterator(target)->path(), copy);  // nothing but the copy
   RawDb db(copy);
-  EXPECT_EQ(db.text("PRAGMA integrity_check"), "ok");
+  EXPECT_EQ(db.value("PRAGMA integrity_check"), "ok");
   EXPECT_EQ(db.number("PRAGMA application_id"), engine::kApplicationId);
   EXPECT_EQ(db.number("SELECT sum(value) FROM counter"), 1000);
   EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
@@ -156,9 +120,7 @@ TEST_F(BackupRestore, FailedBackupLeavesNoCopy) {
                std::runtime_error);
   EXPECT_TRUE(fs::is_empty(target));
 
-  engine::InstanceSettings settings = instance->settings();
-  settings.key = "uninitialised";
-  EXPECT_EQ(codeOf([&] { engine::backupInstance(*engine::Instance::create(settings), target, record_); }),
+  EXPECT_EQ(codeOf([&] { engine::backupInstance(*engine::Instance::create(settingsFor("none")), target, record_); }),
             err::kNotInitialized);
 }
 
@@ -183,11 +145,7 @@ TEST_F(BackupRestore, RestorePlacesTheBackupAndDropsAStaleLog) {
   }
   fs::copy_file(savedWal, engine::walFile(file));
 
-  engine::InstanceSettings settings;
-  settings.key = "r";
-  settings.instanceFolder = root() + "r/";
-  settings.logFolder = root() + "r/";
-  settings.databaseFileName = "cvdb.edb";
+  const engine::InstanceSettings settings = settingsFor("r");
   auto held = engine::Instance::create(settings);
   engine::restoreInstance(*held, backup, settings.instanceFolder, record_);
   expectWellFormedReports(notes_, engine::SnapshotOperation::Restore);
@@ -195,16 +153,10 @@ TEST_F(BackupRestore, RestorePlacesTheBackupAndDropsAStaleLog) {
   EXPECT_TRUE(fs::exists(backup / "cvdb.edb"));  // the backup itself is left as it was
   held->term();
 
-  auto instance = makeInstance("r");
-  auto session = instance->beginSession();
-  session->attachDatabase(file);
-  EXPECT_EQ(counter(*session), 1000);
-  auto check = session->prepare("PRAGMA integrity_check");
-  ASSERT_TRUE(check.step());
-  EXPECT_EQ(check.columnText(0), "ok");
-  auto rows = session->prepare("SELECT count(*) FROM blobs");
-  ASSERT_TRUE(rows.step());
-  EXPECT_EQ(rows.columnInt64(0), 1000);
+  RawDb db(file);
+  EXPECT_EQ(db.number("SELECT value FROM counter WHERE id = 1"), 1000);
+  EXPECT_EQ(db.value("PRAGMA integrity_check"), "ok");
+  EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
 }
 
 TEST_F(BackupRestore, BackupUnderAnotherFileNameIsFound) {
@@ -217,10 +169,8 @@ TEST_F(BackupRestore, BackupUnderAnotherFileNameIsFound) {
   fs::rename(backup / "cvdb.edb", backup / "old-name.db");
   writeFile(backup / "originDB.txt", "x\r\nnamed");
 
-  engine::InstanceSettings settings;
-  settings.key = "named";
+  engine::InstanceSettings settings = settingsFor("named");
   settings.instanceFolder = root() + "restored/";
-  settings.databaseFileName = "cvdb.edb";
   engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr);
   EXPECT_TRUE(fs::exists(root() + "restored/cvdb.edb"));
 
@@ -261,13 +211,12 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
       {"not SQLite", [](const fs::path& f) { writeFile(f, std::string(4096, 'E')); }},
       {"another application",
        [](const fs::path& f) {
-         RawDb db(f);
-         db.exec("CREATE TABLE t(x); INSERT INTO t VALUES(1);");
+         RawDb(f, true).exec("CREATE TABLE t(x); INSERT INTO t VALUES(1);");
        }},
       {"newer format",
        [&](const fs::path& f) {
          writeFile(f, goodBytes);
-         RawDb(f).exec(("PRAGMA user_version=" + std::to_string(engine::kFormatVersion + 1)).c_str());
+         RawDb(f).exec("PRAGMA user_version=" + std::to_string(engine::kFormatVersion + 1));
        }},
       {"truncated", [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, goodBytes.size() / 2)); }},
       {"damaged",
@@ -281,11 +230,7 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
     SCOPED_TRACE(c.name);
     testing_support::TempDir backup;
     c.make(backup / "cvdb.edb");
-    engine::InstanceSettings settings;
-    settings.key = "dest";
-    settings.instanceFolder = dest;
-    settings.databaseFileName = "cvdb.edb";
-    auto held = engine::Instance::create(settings);
+    auto held = engine::Instance::create(settingsFor("dest"));
     EXPECT_EQ(codeOf([&] { engine::restoreInstance(*held, backup.path(), dest, nullptr); }), err::kBadBackupFormat);
     EXPECT_TRUE(readFile(dest + "cvdb.edb") == destBefore) << "database file changed";
     EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBefore) << "write-ahead log changed";

@@ -1,9 +1,26 @@
 #include "engine_fixture.h"
 
 #include "engine/instance_for_maintenance.h"
-#include "engine/transaction.h"
 
 namespace engine_testing {
+
+int codeOf(const std::function<void()>& action) {
+  try {
+    action();
+  } catch (const DB::DBExc& e) {
+    return e.code();
+  }
+  return 0;
+}
+
+std::string failureOf(const std::function<void()>& action) {
+  try {
+    action();
+  } catch (const std::exception& e) {
+    return e.what();
+  }
+  return "";
+}
 
 EngineTest::EngineTest() { applyConfig(config()); }
 
@@ -27,14 +44,23 @@ void EngineTest::applyConfig(const DBConfig& changed) {
   override_ = std::make_unique<DBConfig::TestOverride>(changed);
 }
 
-std::shared_ptr<engine::Instance> EngineTest::makeInstance(const std::string& key, std::uint64_t maxSessions) {
+engine::InstanceSettings EngineTest::settingsFor(const std::string& key) const {
   engine::InstanceSettings settings;
   settings.key = key;
   settings.instanceFolder = root() + key + "/";
   settings.logFolder = dir_.path().string() + "/logs/" + key + "/";
   settings.databaseFileName = "cvdb.edb";
-  settings.maxSessions = maxSessions;
   settings.busyTimeout = std::chrono::milliseconds(5000);
+  return settings;
+}
+
+std::shared_ptr<engine::Instance> EngineTest::makeInstance(const std::string& key, std::uint64_t maxSessions) {
+  engine::InstanceSettings settings = settingsFor(key);
+  settings.maxSessions = maxSessions;
+  return makeInstance(settings);
+}
+
+std::shared_ptr<engine::Instance> EngineTest::makeInstance(const engine::InstanceSettings& settings) {
   auto instance = engine::Instance::create(settings);
   instance->init();
   return instance;
@@ -49,6 +75,12 @@ std::unique_ptr<engine::Session> EngineTest::makeDatabase(const std::shared_ptr<
       "INSERT INTO counter VALUES(1, 0);"
       "CREATE TABLE blobs(id BLOB NOT NULL PRIMARY KEY, blob BLOB) STRICT;");
   txn.commit();
+  return session;
+}
+
+std::unique_ptr<engine::Session> EngineTest::openSession(const std::shared_ptr<engine::Instance>& instance) {
+  auto session = instance->beginSession();
+  session->openDatabase();
   return session;
 }
 

@@ -2,7 +2,6 @@
 // values on the engine layer.
 
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <filesystem>
 #include <numeric>
@@ -10,50 +9,41 @@
 
 #include "engine/blob_io.h"
 #include "engine/database_file.h"
-#include "engine/db_exc.h"
-#include "engine/engine_errors.h"
-#include "engine/instance.h"
-#include "engine/session.h"
-#include "engine/transaction.h"
 #include "engine_fixture.h"
-#include "support/temp_dir.h"
+#include "support/raw_db.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-namespace err = DB::err;
-using engine_testing::EngineTest;
+using namespace engine_testing;
 using testing_support::readFile;
 using testing_support::writeFile;
-
-int codeOf(const std::function<void()>& action) {
-  try {
-    action();
-  } catch (const DB::DBExc& e) {
-    return e.code();
-  }
-  return 0;
-}
 
 // Writes a SQLite file with the given identity, in rollback-journal mode.
 void writeSqliteFile(const fs::path& file, int applicationId, int version) {
   fs::create_directories(file.parent_path());
-  sqlite3* db = nullptr;
-  ASSERT_EQ(sqlite3_open(file.c_str(), &db), SQLITE_OK);
-  const std::string sql = "PRAGMA application_id=" + std::to_string(applicationId) +
-                          "; PRAGMA user_version=" + std::to_string(version) +
-                          "; CREATE TABLE t(x); INSERT INTO t VALUES(42);";
-  EXPECT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
-  sqlite3_close(db);
+  testing_support::RawDb(file, true).exec("PRAGMA application_id=" + std::to_string(applicationId) +
+                                          "; PRAGMA user_version=" + std::to_string(version) +
+                                          "; CREATE TABLE t(x); INSERT INTO t VALUES(42);");
 }
 
-class Sessions : public EngineTest {};
+using Sessions = EngineTest;
 
-TEST_F(Sessions, CreatedDatabaseIsAttachedByTheNextInstance) {
+
+TEST_F(Sessions, CreatedDatabaseIsDurableAndAttachedByTheNextInstance) {
   const fs::path file = root() + "a/cvdb.edb";
   {
     auto instance = makeInstance("a");
     auto session = makeDatabase(instance);
+    {
+      // Connections log ahead and sync fully.
+      auto mode = session->prepare("PRAGMA journal_mode");
+      ASSERT_TRUE(mode.step());
+      EXPECT_EQ(mode.columnText(0), "wal");
+      auto sync = session->prepare("PRAGMA synchronous");
+      ASSERT_TRUE(sync.step());
+      EXPECT_EQ(sync.columnInt64(0), 2);
+    }
     DB::runInTransaction(*session, [&] { session->prepare("UPDATE counter SET value = 7").run(); });
     EXPECT_EQ(instance->attachedDatabase(), file);
   }
@@ -68,17 +58,6 @@ TEST_F(Sessions, CreatedDatabaseIsAttachedByTheNextInstance) {
   second->openDatabase();
   EXPECT_EQ(counter(*second), 7);
   EXPECT_EQ(codeOf([&] { second->attachDatabase(root() + "other/cvdb.edb"); }), err::kTooManyAttachedDatabases);
-}
-
-TEST_F(Sessions, ConnectionsAreDurableAndLogAhead) {
-  auto instance = makeInstance("durable");
-  auto session = makeDatabase(instance);
-  auto mode = session->prepare("PRAGMA journal_mode");
-  ASSERT_TRUE(mode.step());
-  EXPECT_EQ(mode.columnText(0), "wal");
-  auto sync = session->prepare("PRAGMA synchronous");
-  ASSERT_TRUE(sync.step());
-  EXPECT_EQ(sync.columnInt64(0), 2);  // FULL
 }
 
 TEST_F(Sessions, CreationNeverReplacesAFileAndIgnoresLeftovers) {
@@ -135,10 +114,7 @@ TEST_F(Sessions, ForeignFilesAreRefusedUntouched) {
 }
 
 TEST_F(Sessions, InstanceStatesAndLimits) {
-  engine::InstanceSettings settings;
-  settings.key = "limits";
-  settings.instanceFolder = root() + "limits/";
-  settings.logFolder = dir_.path().string() + "/logs/limits/";
+  engine::InstanceSettings settings = settingsFor("limits");
   settings.maxSessions = 2;
   auto instance = engine::Instance::create(settings);
   EXPECT_EQ(codeOf([&] { instance->beginSession(); }), err::kNotInitialized);
@@ -173,8 +149,7 @@ TEST_F(Sessions, ProcessWideInstanceLimit) {
 TEST_F(Sessions, StatementsAreResetAfterUseAndNestedUsesAreIndependent) {
   auto instance = makeInstance("stmts");
   auto writer = makeDatabase(instance);
-  auto reader = instance->beginSession();
-  reader->openDatabase();
+  auto reader = openSession(instance);
   {
     DB::runInTransaction(*writer, [&] { writer->prepare("INSERT INTO counter VALUES(2, 20), (3, 30)").run(); });
     auto outer = reader->prepare("SELECT id FROM counter ORDER BY id");
@@ -207,8 +182,7 @@ TEST_F(Sessions, LongValuesGoThroughBlobIoInChunks) {
     return *id;
   });
 
-  auto reader = instance->beginSession();
-  reader->openDatabase();
+  auto reader = openSession(instance);
   EXPECT_EQ(engine::findRowid(*reader, "blobs", "id", "big"), rowid);
   EXPECT_FALSE(engine::findRowid(*reader, "blobs", "id", "small"));
   EXPECT_EQ(engine::blobSize(*reader, "blobs", "blob", rowid), static_cast<std::int64_t>(value.size()));
