@@ -365,6 +365,8 @@ TEST_F(StoredRecordReader, CasesThatTellTheParsersApart) {
            // Surrogates: a pair is one character; a lone one is refused.
            std::string(R"({"name":"\ud83d\ude00"})"), std::string(R"({"name":"\udc00"})"),
            std::string(R"({"x":"\ud800\u0041"})"), std::string("{\"name\":\"\xed\xa0\x80\"}"),
+           // Raw control characters in a string; jansson skips a NUL after a number.
+           std::string("{\"name\":\"0123456789abcdef0123456789\x1c\"}"), std::string("{\"docCount\":4\0}", 15),
            // Integers beyond 64 bits are refused; reals are not integers.
            std::string(R"({"x":9223372036854775808})"), std::string(R"({"created":-9223372036854775808})"),
            std::string(R"({"created":5.0,"modified":1e3})"), std::string(R"({"x":1.8e308})"),
