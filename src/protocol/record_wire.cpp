@@ -31,6 +31,20 @@ std::int64_t presentTime(wire::Reader& in, const char* what) {
   return v;
 }
 
+// The bytes writePackInfo writes for p.
+std::size_t encodedSize(const PackInfo& p) {
+  std::size_t n = 4 + p.id().size() + 1 + 4;
+  if (p.folderValid()) n += 4 + p.folder().size();
+  if (p.statusValid()) n += 4;
+  if (p.name != PackInfoPartial::STR_INVALID) n += 4 + p.name.size();
+  if (p.owner != PackInfoPartial::STR_INVALID) n += 4 + p.owner.size();
+  if (p.created != PackInfoPartial::TIME_INVALID) n += 8;
+  if (p.modified != PackInfoPartial::TIME_INVALID) n += 8;
+  if (p.docCount != PackInfoPartial::LONG_INVALID) n += 4;
+  for (const UseInfo& u : p.uses) n += kMinUseSize + u.host.size() + u.user.size();
+  return n;
+}
+
 }  // namespace
 
 void writeJson(wire::Writer& out, const json::Value& v) {
@@ -128,6 +142,11 @@ PackInfoPtr readOptPackInfo(wire::Reader& in) {
 
 void writePackInfos(wire::Writer& out, const PackInfos& list) {
   if (list.size() > std::numeric_limits<std::uint32_t>::max()) throw std::length_error("pack list too long for the wire");
+  // A listing runs to megabytes: sized once, the answer is not copied over
+  // and over as it grows.
+  std::size_t size = 4;
+  for (const PackInfo& p : list) size += encodedSize(p);
+  out.buffer().reserve(out.buffer().size() + size);
   out.u32(static_cast<std::uint32_t>(list.size()));
   for (const PackInfo& p : list) writePackInfo(out, p);
 }
