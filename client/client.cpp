@@ -242,7 +242,8 @@ Ipc::PackInfos Client::packInfos(const std::string& folder) {
   Ipc::DB::GetPackInfos cmd;
   cmd.setRequest(folder);
   run(cmd);
-  return *cmd.respInfos();
+  // The command dies here: its decoded list is moved out, not copied.
+  return std::move(*cmd.respInfos());
 }
 
 Ipc::PackInfoPtr Client::packInfo(const std::string& id) {
