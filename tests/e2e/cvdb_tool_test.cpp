@@ -1,108 +1,129 @@
 // The cvdb tool against the real server: what it prints and which exit
-// status it gives for success, for the server's refusals and for a server
-// that cannot be reached.
+// status it gives, for every command, for the server's refusals and for a
+// server that cannot be reached.
 
 #include <gtest/gtest.h>
 
-#include "support/server_process.h"
+#include "e2e_support.h"
 #include "support/temp_dir.h"
 
 namespace {
 
-using testing_support::ServerProcess;
+using namespace e2e;
+using testing_support::readFile;
+using testing_support::writeFile;
 
-const char* const kServer = CVDB_SERVER_PATH;
-const char* const kTool = CVDB_TOOL_PATH;
-
-struct Tool {
-  std::uint16_t port;
-  ServerProcess::Result operator()(std::vector<std::string> args) const {
-    args.insert(args.begin(), {"--port", std::to_string(port)});
-    return ServerProcess::run(kTool, args);
-  }
-};
-
-bool has(const ServerProcess::Result& r, const std::string& text) {
-  return r.output.find(text) != std::string::npos;
-}
-
-TEST(CvdbTool, PingsTheServer) {
+TEST(CvdbTool, PingsAndListsDatabases) {
   ServerProcess server(kServer);
-  const Tool cvdb{server.port()};
-  auto r = cvdb({"ping"});
-  EXPECT_EQ(r.status, 0) << r.output;
-  EXPECT_TRUE(has(r, "pong from 127.0.0.1:" + std::to_string(server.port()))) << r.output;
-
-  r = cvdb({"--json", "ping"});
-  EXPECT_EQ(r.status, 0) << r.output;
-  EXPECT_EQ(r.output.rfind("{\"ok\":true,\"ms\":", 0), 0u) << r.output;
-
-  r = cvdb({"--json", "dbs"});
-  EXPECT_EQ(r.status, 0) << r.output;
-  EXPECT_EQ(r.output, "[]\n");
-}
-
-TEST(CvdbTool, SaysPlainlyWhenTheServerEndsTheConnection) {
-  ServerProcess server(kServer);
-  const Tool cvdb{server.port()};
-  // Bound to a database without opening it: the command fails on the
-  // server, which ends the connection.
-  const auto r = cvdb({"--db", "demo", "--open-mode", "2", "cfg", "get", "layout"});
-  EXPECT_EQ(r.status, 1) << r.output;
-  EXPECT_TRUE(has(r, "cvdb: the server ended the connection: Terminating client connection due to processing error"))
-      << r.output;
-  EXPECT_TRUE(server.waitForLogLine("Dispatching command "));
+  const Tool cvdb = toolOf(server);
+  EXPECT_TRUE(has(ok(cvdb({"ping"})), "pong from 127.0.0.1:" + std::to_string(server.port())));
+  EXPECT_TRUE(ok(cvdb({"--json", "ping"})).starts_with("{\"ok\":true,\"ms\":"));
+  EXPECT_EQ(ok(cvdb({"--json", "dbs"})), "[]\n");
 }
 
 TEST(CvdbTool, ConfigurationPartsAndDataFilesFromFilesAndBack) {
   ServerProcess server(kServer);
-  const Tool cvdb{server.port()};
+  const Tool cvdb = toolOf(server, {"--db", "Plant\\Line 2"});
   testing_support::TempDir dir;
-  std::string bytes(300000, '\0');
-  for (std::size_t i = 0; i < bytes.size(); ++i) bytes[i] = static_cast<char>(i * 7 + 3);
-  testing_support::writeFile(dir / "in.bin", bytes);
-  testing_support::writeFile(dir / "part.json", R"({"columns": ["id", "name"], "width": 3})");
+  std::string content(300000, '\0');
+  for (std::size_t i = 0; i < content.size(); ++i) content[i] = static_cast<char>(i * 7 + 3);
+  writeFile(dir / "in.bin", content);
+  writeFile(dir / "part.json", R"({"columns": ["id", "name"], "width": 3})");
 
-  const auto ok = [](const ServerProcess::Result& r) {
-    EXPECT_EQ(r.status, 0) << r.output;
-    return r.output;
-  };
-  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "set", "layout", "--file", (dir / "part.json").string()}));
-  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "set", "other", R"({"a": 1})"}));
-  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "get", "layout"})),
-            "{\"columns\":[\"id\",\"name\"],\"width\":3}\n");
-  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "ls", "lay"})), "[\"layout\"]\n");
-  ok(cvdb({"--db", "Plant\\Line 2", "cfg", "rm", "layout"}));
-  EXPECT_EQ(ok(cvdb({"--db", "Plant\\Line 2", "--json", "cfg", "get", "layout"})), "null\n");
+  ok(cvdb({"cfg", "set", "layout", "--file", (dir / "part.json").string()}));
+  ok(cvdb({"cfg", "set", "other", R"({"a": 1})"}));
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "get", "layout"})), "{\"columns\":[\"id\",\"name\"],\"width\":3}\n");
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "ls", "lay"})), "[\"layout\"]\n");
+  ok(cvdb({"cfg", "rm", "layout"}));
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "get", "layout"})), "null\n");
 
-  ok(cvdb({"--db", "Plant\\Line 2", "data", "put", "doc-1", "scan.bin", (dir / "in.bin").string()}));
-  ok(cvdb({"--db", "Plant\\Line 2", "data", "get", "doc-1", "scan.bin", "-o", (dir / "out.bin").string()}));
-  EXPECT_EQ(testing_support::readFile(dir / "out.bin"), bytes);
-
-  EXPECT_EQ(ok(cvdb({"--json", "dbs"})), "[\"plant\\\\line 2\"]\n");
-
-  const auto missing = cvdb({"--db", "nowhere", "--open-mode", "1", "cfg", "ls"});
-  EXPECT_EQ(missing.status, 1) << missing.output;
-  EXPECT_TRUE(has(missing, "cvdb: Database nowhere does not exist")) << missing.output;
+  ok(cvdb({"data", "put", "doc-1", "scan.bin", (dir / "in.bin").string()}));
+  ok(cvdb({"data", "get", "doc-1", "scan.bin", "-o", (dir / "out.bin").string()}));
+  EXPECT_EQ(readFile(dir / "out.bin"), content);
+  EXPECT_EQ(ok(toolOf(server)({"--json", "dbs"})), "[\"plant\\\\line 2\"]\n");
 }
 
-TEST(CvdbTool, LocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
+TEST(CvdbTool, EveryPackCommand) {
+  ServerProcess server(kServer);
+  const Tool cvdb = toolOf(server, {"--db", "Tool"});
+  testing_support::TempDir dir;
+  writeFile(dir / "content.bin", "pack bytes");
+
+  EXPECT_TRUE(has(ok(cvdb({"pack", "save", "P1", "--folder", "inbox", "--status", "3", "--name", "March", "--content",
+                           (dir / "content.bin").string()})),
+                  "saved \"P1\" with 10 bytes"));
+  ok(cvdb({"pack", "save", "P2", "--folder", "inbox", "--status", "1", "--content", (dir / "content.bin").string()}));
+
+  const std::string table = ok(cvdb({"pack", "ls", "inbox"}));
+  EXPECT_TRUE(has(table, "ID")) << table;
+  EXPECT_LT(table.find("P2"), table.find("P1")) << table;  // status order
+  EXPECT_TRUE(has(table, "March")) << table;
+  EXPECT_TRUE(json::strToValue(ok(cvdb({"--json", "pack", "ls"}))).isArray());
+  EXPECT_EQ(json::strToValue(ok(cvdb({"--json", "pack", "ls", "nowhere"}))).dump(), "[]");
+
+  const json::Object info = json::strToObject(ok(cvdb({"--json", "pack", "info", "P1"})));
+  EXPECT_EQ(info.get("folder"), json::Value::string("inbox"));
+  EXPECT_EQ(info.get("status"), json::Value::integer(3));
+  EXPECT_EQ(ok(cvdb({"--json", "pack", "info", "none"})), "null\n");
+  const json::Object updated = json::strToObject(ok(cvdb({"--json", "pack", "update", "P1", "--status", "8"})));
+  EXPECT_EQ(updated.get("status"), json::Value::integer(8));
+
+  // Fetch into a file while opening for edit; the record goes to standard
+  // output then.
+  const std::string opened = ok(cvdb({"--json", "pack", "get", "P1", "--open-for-edit", "--host", "ws-7", "--process",
+                                      "77", "-o", (dir / "out.bin").string()}));
+  EXPECT_EQ(readFile(dir / "out.bin"), "pack bytes");
+  EXPECT_TRUE(has(opened, "\"host\":\"ws-7\"")) << opened;
+  EXPECT_TRUE(has(opened, "\"process\":77")) << opened;
+  EXPECT_TRUE(has(ok(cvdb({"pack", "get", "P2"})), "pack bytes"));
+
+  EXPECT_TRUE(has(ok(cvdb({"pack", "lock", "P1", "--host", "scan-1"})), "locked \"P1\" for host \"scan-1\""));
+  EXPECT_EQ(cvdb({"pack", "lock", "P1", "--host", "scan-2"}).status, 1);
+  EXPECT_TRUE(has(ok(cvdb({"pack", "info", "P1"})), "LockForUpload host \"scan-1\""));
+  EXPECT_TRUE(has(ok(cvdb({"pack", "unlock", "P1", "--host", "scan-1"})), "unlocked \"P1\" for host \"scan-1\""));
+  EXPECT_EQ(cvdb({"pack", "unlock", "P1", "--host", "scan-1"}).status, 1);
+  ok(cvdb({"pack", "get", "P1", "--close", "--host", "ws-7", "--process", "77", "-o", (dir / "out.bin").string()}));
+  EXPECT_TRUE(has(ok(cvdb({"pack", "info", "P1"})), "uses:      none"));
+
+  ok(cvdb({"data", "put", "doc-1", "a.txt", (dir / "content.bin").string()}));
+  EXPECT_TRUE(has(ok(cvdb({"pack", "change-id", "doc-1", "doc-2"})), "copied the data of \"doc-1\" to \"doc-2\""));
+  ok(cvdb({"data", "get", "doc-2", "a.txt", "-o", (dir / "copied.bin").string()}));
+  EXPECT_EQ(readFile(dir / "copied.bin"), "pack bytes");
+
+  EXPECT_TRUE(has(ok(cvdb({"pack", "rm", "P1"})), "erased \"P1\""));
+  EXPECT_TRUE(has(ok(cvdb({"pack", "info", "P1"})), "no pack \"P1\""));
+}
+
+// 1: the server refused or ended the connection; 2: a local mistake, found
+// before the server is contacted; 3: no server.
+TEST(CvdbTool, RefusalsLocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
   std::uint16_t port;
   {
     ServerProcess server(kServer);
     port = server.port();
-    const Tool cvdb{port};
-    auto r = cvdb({"pack", "info", "P1"});
-    EXPECT_EQ(r.status, 2) << r.output;
-    EXPECT_TRUE(has(r, "needs --db NAME")) << r.output;
-    r = cvdb({"--db", "demo", "cfg", "set", "k", "[1,2]"});
-    EXPECT_EQ(r.status, 2) << r.output;
-    r = cvdb({"no-such-subcommand"});
-    EXPECT_EQ(r.status, 2) << r.output;
+    const Tool cvdb = toolOf(server);
+    const std::vector<std::tuple<std::vector<std::string>, int, std::string>> cases = {
+        {{"--db", "nowhere", "--open-mode", "1", "cfg", "ls"}, 1, "cvdb: Database nowhere does not exist"},
+        {{"--db", "..", "cfg", "ls"}, 1, "Database name .. is not valid"},
+        // Bound to a database without opening it: the command fails on the
+        // server, which ends the connection.
+        {{"--db", "demo", "--open-mode", "2", "cfg", "get", "layout"},
+         1,
+         "cvdb: the server ended the connection: Terminating client connection due to processing error"},
+        {{"pack", "info", "P1"}, 2, "needs --db NAME"},
+        {{"--db", "demo", "cfg", "set", "k", "[1,2]"}, 2, ""},
+        {{"no-such-subcommand"}, 2, ""},
+    };
+    for (const auto& [args, status, text] : cases) {
+      const auto r = cvdb(args);
+      EXPECT_EQ(r.status, status) << r.output;
+      EXPECT_TRUE(has(r.output, text)) << r.output;
+    }
+    EXPECT_TRUE(server.waitForLogLine("Dispatching command "));
   }
-  const auto r = Tool{port}({"ping"});
+  const auto r = Tool{{"--port", std::to_string(port)}}({"ping"});
   EXPECT_EQ(r.status, 3) << r.output;
-  EXPECT_TRUE(has(r, "cannot connect")) << r.output;
+  EXPECT_TRUE(has(r.output, "cannot connect")) << r.output;
 }
 
 }  // namespace

@@ -5,8 +5,6 @@
 // it ran and how many transactions the server had to retry.
 
 #include <gtest/gtest.h>
-#include <jansson.h>
-#include <sqlite3.h>
 
 #include <algorithm>
 #include <atomic>
@@ -17,21 +15,17 @@
 #include <set>
 #include <thread>
 
-#include "client/client.h"
-#include "support/server_process.h"
+#include "e2e_support.h"
+#include "support/raw_db.h"
 
 namespace {
 
-using namespace std::chrono_literals;
+using namespace e2e;
 using Ipc::PackInfo;
 using Ipc::UseInfo;
 using testing_support::ServerOptions;
-using testing_support::ServerProcess;
 using Clock = std::chrono::steady_clock;
 
-const char* const kServer = CVDB_SERVER_PATH;
-const char* const kTool = CVDB_TOOL_PATH;
-constexpr const char* kTerminating = "Terminating client connection due to processing error";
 constexpr const char* kLocked = "Attept to lock for upload a pack which is already locked from another host.";
 constexpr const char* kRetry = "Transaction::retry";
 
@@ -42,31 +36,14 @@ ServerOptions verbose() {
   return o;
 }
 
-std::unique_ptr<cvdb::Client> connectedTo(const ServerProcess& server, const std::string& db) {
-  cvdb::ClientOptions o;
-  o.port = server.port();
-  o.ioTimeout = 30s;
-  auto c = std::make_unique<cvdb::Client>(o);
-  EXPECT_TRUE(c->connect(db));
-  return c;
-}
-
 PackInfo complete(const std::string& id, std::int32_t status, const std::string& name) {
-  Ipc::PackInfoPartial p;
-  p.name = name;
-  p.owner = "anna";
-  p.created = 1700000000;
-  p.modified = 1700000100;
-  p.docCount = 2;
-  return PackInfo(id, "race", status, p);
+  return e2e::complete(id, "race", status, name);
 }
-
-SharedMemBuffer bytes(const std::string& text) { return SharedMemBuffer(MemBuffer::copyOf(text)); }
 
 // Lines written before a later line of the server are in its output once
 // that later line is: a fresh read that logs a known line marks the point.
 void settleLog(ServerProcess& server, const std::string& db, const std::string& marker) {
-  auto c = connectedTo(server, db);
+  auto c = clientOf(server, db);
   c->packInfo(marker);
   ASSERT_TRUE(server.waitForLogLine("Can not find info for " + marker));
 }
@@ -86,7 +63,7 @@ TEST(PackConcurrency, ExactlyOneHostWinsTheUploadLockAndTheRefusedLeaveNoTrace) 
   for (int round = 0; round < kRounds; ++round) {
     const std::string id = "race-" + std::to_string(round);
     std::vector<std::unique_ptr<cvdb::Client>> clients;
-    for (int i = 0; i < kRacers; ++i) clients.push_back(connectedTo(server, "Race"));
+    for (int i = 0; i < kRacers; ++i) clients.push_back(clientOf(server, "Race"));
     // Each racer would create the pack, with fields and content of its
     // own, and take its lock in the same request.
     std::vector<int> won(kRacers, -1);
@@ -116,7 +93,7 @@ TEST(PackConcurrency, ExactlyOneHostWinsTheUploadLockAndTheRefusedLeaveNoTrace) 
     ASSERT_EQ(std::count(won.begin(), won.end(), 1), 1);
     const int w = static_cast<int>(std::find(won.begin(), won.end(), 1) - won.begin());
     const std::string winner = "host-" + std::to_string(w);
-    const auto seen = connectedTo(server, "Race")->getPack(id);
+    const auto seen = clientOf(server, "Race")->getPack(id);
     ASSERT_NE(seen.info, nullptr);
     EXPECT_EQ(*seen.info, [&] {
       PackInfo expected = complete(id, w, "by " + winner);
@@ -134,94 +111,6 @@ TEST(PackConcurrency, ExactlyOneHostWinsTheUploadLockAndTheRefusedLeaveNoTrace) 
   report("upload lock race, 5 rounds of 16 hosts", racing, server.countLogLines(kRetry));
 }
 
-// The use entries of a record printed by cvdb --json, as (host, process).
-using Editors = std::multiset<std::pair<std::string, std::int64_t>>;
-Editors editorsIn(const std::string& output) {
-  const json::Object record = json::strToObject(output);
-  Editors out;
-  const json::Value uses = record.get("uses");
-  for (std::size_t i = 0; i < json_array_size(uses.get()); ++i) {
-    const json::Object e(json::Value::borrow(json_array_get(uses.get(), i)));
-    EXPECT_EQ(e.get("state"), json::Value::string("OpenForEdit"));
-    out.emplace(e.get("host").asString(), e.get("process").asInteger());
-  }
-  return out;
-}
-
-TEST(PackConcurrency, ProcessesOpeningAndClosingAtOnceAreListedExactly) {
-  ServerProcess server(kServer, verbose());
-  connectedTo(server, "Edit")->savePack(complete("P", 1, "shared"), bytes("content"));
-  constexpr int kEditors = 8;
-  const auto editor = [](int i) { return std::make_pair("ws-" + std::to_string(i), std::int64_t{500 + i}); };
-  Editors all;
-  for (int i = 0; i < kEditors; ++i) all.insert(editor(i));
-
-  // Every editor is a cvdb process of its own; each prints the record as
-  // its request left it.
-  const auto runAll = [&](const char* flag) {
-    std::vector<Editors> answers(kEditors);
-    std::vector<std::thread> processes;
-    for (int i = 0; i < kEditors; ++i) {
-      processes.emplace_back([&, i] {
-        const auto r = ServerProcess::run(
-            kTool, {"--port", std::to_string(server.port()), "--db", "Edit", "--json", "pack", "get", "P", flag,
-                    "--host", editor(i).first, "--process", std::to_string(editor(i).second), "-o", "/dev/null"});
-        EXPECT_EQ(r.status, 0) << r.output;
-        if (r.status == 0) answers[i] = editorsIn(r.output);
-      });
-    }
-    for (auto& t : processes) t.join();
-    return answers;
-  };
-  const auto began = Clock::now();
-
-  // The requests are applied one after another: each answer holds its own
-  // entry and those applied before it, so the sizes are 1 to N, each once.
-  const auto opened = runAll("--open-for-edit");
-  std::vector<std::size_t> sizes;
-  for (int i = 0; i < kEditors; ++i) {
-    EXPECT_EQ(opened[i].count(editor(i)), 1u) << i;
-    EXPECT_TRUE(std::includes(all.begin(), all.end(), opened[i].begin(), opened[i].end())) << i;
-    sizes.push_back(opened[i].size());
-  }
-  std::sort(sizes.begin(), sizes.end());
-  for (int i = 0; i < kEditors; ++i) EXPECT_EQ(sizes[i], static_cast<std::size_t>(i + 1));
-  auto c = connectedTo(server, "Edit");
-  Editors listed;
-  const auto afterOpening = c->packInfo("P");
-  for (const UseInfo& u : afterOpening->uses) listed.emplace(u.host, u.process);
-  EXPECT_EQ(listed, all);
-
-  // Closing: each answer lacks its own entry, and the sizes are N-1 to 0.
-  const auto closed = runAll("--close");
-  sizes.clear();
-  for (int i = 0; i < kEditors; ++i) {
-    EXPECT_EQ(closed[i].count(editor(i)), 0u) << i;
-    sizes.push_back(closed[i].size());
-  }
-  std::sort(sizes.begin(), sizes.end());
-  for (int i = 0; i < kEditors; ++i) EXPECT_EQ(sizes[i], static_cast<std::size_t>(i));
-  const auto took = Clock::now() - began;
-  EXPECT_TRUE(c->packInfo("P")->uses.empty());
-
-  // No use key is left in the stored object.
-  sqlite3* raw = nullptr;
-  const auto file = server.home() / "db" / "edit" / "cvdb.edb";
-  ASSERT_EQ(sqlite3_open_v2(file.c_str(), &raw, SQLITE_OPEN_READONLY, nullptr), SQLITE_OK);
-  sqlite3_stmt* s = nullptr;
-  ASSERT_EQ(sqlite3_prepare_v2(raw, "SELECT blob FROM info WHERE id = CAST('P' AS BLOB)", -1, &s, nullptr), SQLITE_OK);
-  ASSERT_EQ(sqlite3_step(s), SQLITE_ROW);
-  const std::string stored(static_cast<const char*>(sqlite3_column_blob(s, 0)),
-                           static_cast<std::size_t>(sqlite3_column_bytes(s, 0)));
-  sqlite3_finalize(s);
-  sqlite3_close(raw);
-  EXPECT_FALSE(json::strToObject(stored).has("uses")) << stored;
-  EXPECT_EQ(json::strToObject(stored).get("name"), json::Value::string("shared"));
-
-  settleLog(server, "Edit", "marker");
-  report("8 editors opening, then closing, as processes", took, server.countLogLines(kRetry));
-}
-
 // The content that a save with this name stores: long enough to be
 // streamed, and tied to the name so that a reader can tell whether record
 // and content come from the same save.
@@ -231,11 +120,11 @@ std::string contentFor(const std::string& name) {
   return s;
 }
 
-TEST(PackConcurrency, ConcurrentSavesAndUpdatesLoseNothingAndReadersSeeWholeSaves) {
+TEST(PackConcurrency, ConcurrentSavesUpdatesAndClosesLoseNothingAndReadersSeeWholeSaves) {
   ServerProcess server(kServer, verbose());
   constexpr int kWriters = 8;
   constexpr int kRounds = 30;
-  connectedTo(server, "Busy")->savePack(complete("P", 0, "start"), bytes(contentFor("start")));
+  clientOf(server, "Busy")->savePack(complete("P", 0, "start"), bytes(contentFor("start")));
 
   // Every write also opens the pack for a distinct (host, process): a lost
   // update would lose an entry of the list, which every write reads,
@@ -248,7 +137,7 @@ TEST(PackConcurrency, ConcurrentSavesAndUpdatesLoseNothingAndReadersSeeWholeSave
   std::vector<std::thread> threads;
   for (int w = 0; w < kWriters; ++w) {
     threads.emplace_back([&, w] {
-      auto c = connectedTo(server, "Busy");
+      auto c = clientOf(server, "Busy");
       start.arrive_and_wait();
       for (int r = 0; r < kRounds; ++r) {
         PackInfo p("P");
@@ -268,7 +157,7 @@ TEST(PackConcurrency, ConcurrentSavesAndUpdatesLoseNothingAndReadersSeeWholeSave
   }
   for (int reader = 0; reader < 2; ++reader) {
     threads.emplace_back([&] {
-      auto c = connectedTo(server, "Busy");
+      auto c = clientOf(server, "Busy");
       start.arrive_and_wait();
       while (writing > 0) {
         const auto seen = c->getPack("P");
@@ -283,7 +172,7 @@ TEST(PackConcurrency, ConcurrentSavesAndUpdatesLoseNothingAndReadersSeeWholeSave
   const auto took = Clock::now() - began;
 
   EXPECT_EQ(torn.load(), 0) << "of " << reads.load() << " reads";
-  const auto final = connectedTo(server, "Busy")->getPack("P");
+  const auto final = clientOf(server, "Busy")->getPack("P");
   ASSERT_NE(final.info, nullptr);
   std::set<std::pair<std::string, std::uint32_t>> entries;
   for (const UseInfo& u : final.info->uses) entries.emplace(u.host, u.process);
@@ -296,9 +185,34 @@ TEST(PackConcurrency, ConcurrentSavesAndUpdatesLoseNothingAndReadersSeeWholeSave
   EXPECT_EQ(final.info->status() % 1000, kRounds - 1);
   EXPECT_EQ(final.content.view(), contentFor(final.info->name));
 
+  // Every writer closes its entries again, all at once, through fetches:
+  // each answer lacks its own entry, and the list sizes are N-1 to 0, each
+  // once.
+  std::vector<std::size_t> closeSizes;
+  threads.clear();
+  for (int w = 0; w < kWriters; ++w) {
+    threads.emplace_back([&, w] {
+      auto c = clientOf(server, "Busy");
+      for (std::uint32_t r = 0; r < kRounds; ++r) {
+        const auto answer = c->getPack("P", UseInfo(UseInfo::CloseEdit, "w-" + std::to_string(w), "u", r)).info;
+        std::lock_guard lock(m);
+        closeSizes.push_back(answer->uses.size());
+      }
+    });
+  }
+  for (auto& t : threads) t.join();
+  std::sort(closeSizes.begin(), closeSizes.end());
+  for (std::size_t i = 0; i < closeSizes.size(); ++i) ASSERT_EQ(closeSizes[i], i);
+  // No use key is left in the stored object, and the record is intact.
+  const json::Object stored = json::strToObject(
+      *testing_support::RawDb(server.home() / "db" / "busy" / "cvdb.edb")
+           .value("SELECT blob FROM info WHERE id = CAST('P' AS BLOB)"));
+  EXPECT_FALSE(stored.has("uses")) << stored.dump();
+  EXPECT_EQ(stored.get("name"), json::Value::string(final.info->name));
+
   settleLog(server, "Busy", "marker");
   const std::size_t retries = server.countLogLines(kRetry);
-  report("8 writers x 30 saves and updates of one pack, 2 readers", took, retries);
+  report("8 writers x 30 saves and updates of one pack, 2 readers, then 240 closes", took, retries);
   std::cout << "[ measure  ] " << reads.load() << " reads of the pack meanwhile" << std::endl;
   // Writers queue on the database's write lock instead of colliding.
   EXPECT_EQ(retries, 0u);

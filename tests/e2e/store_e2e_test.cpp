@@ -2,50 +2,22 @@
 // server over loopback, driven by the client library and the cvdb tool.
 
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <algorithm>
 #include <thread>
 
-#include "client/client.h"
-#include "support/server_process.h"
+#include "e2e_support.h"
+#include "support/raw_db.h"
 #include "support/temp_dir.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-using namespace std::chrono_literals;
-using testing_support::ServerProcess;
+using namespace e2e;
 using Keys = std::vector<std::string>;
-
-const char* const kServer = CVDB_SERVER_PATH;
-const char* const kTool = CVDB_TOOL_PATH;
-constexpr const char* kTerminating = "Terminating client connection due to processing error";
-
-std::unique_ptr<cvdb::Client> clientOf(const ServerProcess& server, const std::string& db = "") {
-  cvdb::ClientOptions o;
-  o.port = server.port();
-  o.ioTimeout = 20s;
-  auto c = std::make_unique<cvdb::Client>(o);
-  if (!db.empty()) {
-    EXPECT_TRUE(c->connect(db)) << db;
-  }
-  return c;
-}
 
 fs::path dbRoot(const ServerProcess& server) { return server.home() / "db"; }
 json::Object obj(const std::string& text) { return json::strToObject(text); }
-SharedMemBuffer bytes(const std::string& text) { return SharedMemBuffer(MemBuffer::copyOf(text)); }
-
-// Runs op, which must end the connection; returns the server's reason.
-std::string endedBy(const std::function<void()>& op) {
-  try {
-    op();
-  } catch (const cvdb::ConnectionEnded& e) {
-    return e.reason();
-  }
-  return "(not ended)";
-}
 
 TEST(StoreEndToEnd, ConnectOpensCreatesOrOnlySelectsAndKeepsOneBindingPerConnection) {
   ServerProcess server(kServer);
@@ -103,12 +75,9 @@ TEST(StoreEndToEnd, ConfigurationPartsAndAStoredValueThatIsNoObject) {
   EXPECT_EQ(c->cfgIds("ab"), (Keys{"ab", "abc"}));
 
   // A pack's content shares the table and may hold any bytes.
-  sqlite3* raw = nullptr;
-  ASSERT_EQ(sqlite3_open((dbRoot(server) / "cfg" / "cvdb.edb").c_str(), &raw), SQLITE_OK);
-  sqlite3_busy_timeout(raw, 10000);
-  EXPECT_EQ(sqlite3_exec(raw, "INSERT INTO meta VALUES(CAST('pack-1' AS BLOB), x'00ff6e6f74')", nullptr, nullptr, nullptr),
-            SQLITE_OK);
-  sqlite3_close(raw);
+  EXPECT_EQ(testing_support::RawDb(dbRoot(server) / "cfg" / "cvdb.edb")
+                .exec("INSERT INTO meta VALUES(CAST('pack-1' AS BLOB), x'00ff6e6f74')"),
+            0);
   auto bystander = clientOf(server, "cfg");
   EXPECT_EQ(endedBy([&] { c->getCfg("pack-1"); }), kTerminating);
   EXPECT_TRUE(server.waitForLogLine("Dispatching command GetCfgPart failed with"));
@@ -156,28 +125,6 @@ TEST(StoreEndToEnd, TwoConnectionsWritingTheSameKeyLoseNothing) {
   EXPECT_EQ(c->cfgIds("a-").size() + c->cfgIds("b-").size(), 2u * kRounds);
   const std::string last = c->getCfg("shared").dump();
   EXPECT_TRUE(last == R"({"who":"a","n":29})" || last == R"({"who":"b","n":29})") << last;
-}
-
-TEST(StoreEndToEnd, TheCvdbToolCoversTheCommands) {
-  ServerProcess server(kServer);
-  const auto cvdb = [&](std::vector<std::string> args) {
-    args.insert(args.begin(), {"--port", std::to_string(server.port()), "--json", "--db", "Tool"});
-    return ServerProcess::run(kTool, args);
-  };
-  EXPECT_EQ(cvdb({"cfg", "set", "layout", R"({"a":[1,2]})"}).status, 0);
-  EXPECT_EQ(cvdb({"cfg", "get", "layout"}).output, "{\"a\":[1,2]}\n");
-  EXPECT_EQ(cvdb({"cfg", "ls", "lay"}).output, "[\"layout\"]\n");
-  EXPECT_EQ(cvdb({"cfg", "rm", "layout"}).status, 0);
-  EXPECT_EQ(cvdb({"cfg", "get", "layout"}).output, "null\n");
-  testing_support::TempDir local;
-  testing_support::writeFile(local / "in", "file content");
-  EXPECT_EQ(cvdb({"data", "put", "doc", "page", (local / "in").string()}).status, 0);
-  EXPECT_EQ(cvdb({"data", "get", "doc", "page", "-o", (local / "out").string()}).status, 0);
-  EXPECT_EQ(testing_support::readFile(local / "out"), "file content");
-  EXPECT_EQ(cvdb({"dbs"}).output, "[\"tool\"]\n");
-  const auto refused = ServerProcess::run(kTool, {"--port", std::to_string(server.port()), "--db", "..", "cfg", "ls"});
-  EXPECT_EQ(refused.status, 1);
-  EXPECT_NE(refused.output.find("Database name .. is not valid"), std::string::npos) << refused.output;
 }
 
 }  // namespace
