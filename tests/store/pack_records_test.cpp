@@ -9,8 +9,6 @@
 
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
-#include "pack_test_util.h"
-#include "store/pack_sql.h"
 #include "store_fixture.h"
 #include "support/log_capture.h"
 
@@ -18,10 +16,11 @@ namespace {
 
 using Ipc::PackInfo;
 using Ipc::PackInfoPartial;
-using pack_testing::complete;
-using pack_testing::RawDb;
-using pack_testing::useRequest;
+using store_testing::complete;
+using store_testing::storedRecord;
 using store_testing::StoreTest;
+using store_testing::useRequest;
+using testing_support::RawDb;
 using testing_support::LogCapture;
 using testing_support::VerboseLog;
 
@@ -91,10 +90,10 @@ TEST_F(PackRecords, KeysTheStoredObjectDoesNotKnowSurviveUpdatesAndUseChanges) {
   auto db = open("p");
   db->updateInfo(complete("P1", "f", 1));
   RawDb raw(db->dbFile());
-  json::Object stored = raw.object("P1");
+  json::Object stored = storedRecord(raw, "P1");
   stored.set("reviewer", json::Value::string("bo"));  // written by a later version
   stored.set("created", json::Value::string("yesterday"));  // of the wrong type
-  raw.setBlob("P1", stored.dump());
+  raw.value("UPDATE info SET blob = ?2 WHERE id = ?1", {"P1", stored.dump()});
 
   EXPECT_EQ(db->infoFor("P1")->created, PackInfoPartial::TIME_INVALID);
   PackInfo partial("P1");
@@ -103,7 +102,7 @@ TEST_F(PackRecords, KeysTheStoredObjectDoesNotKnowSurviveUpdatesAndUseChanges) {
   db->packMetadata(useRequest("P1", Ipc::UseInfo::OpenForEdit, "ws-1"));
   db->packMetadata(useRequest("P1", Ipc::UseInfo::CloseEdit, "ws-1"));
 
-  const json::Object after = raw.object("P1");
+  const json::Object after = storedRecord(raw, "P1");
   EXPECT_EQ(after.get("reviewer"), json::Value::string("bo"));
   EXPECT_EQ(after.get("created"), json::Value::string("yesterday"));
   EXPECT_EQ(after.get("docCount"), json::Value::integer(12));
@@ -167,23 +166,6 @@ TEST_F(PackRecords, ListingsComeInFolderStatusIdOrderAndAFolderIsExact) {
   for (const auto& p : *all) EXPECT_TRUE(p.allValid()) << p.id();
 }
 
-TEST_F(PackRecords, ListingsAndLookupsUseTheIndexesWithoutASort) {
-  auto db = open("p");
-  for (int i = 0; i < 50; ++i) db->updateInfo(complete("P" + std::to_string(i), "F" + std::to_string(i % 5), i % 3));
-  RawDb raw(db->dbFile());
-  raw.count("ANALYZE");  // statistics must not talk the planner out of the index either
-
-  for (const char* sql : {DB::pack_sql::kInfosOfFolder, DB::pack_sql::kAllInfos}) {
-    const std::string plan = raw.plan(sql);
-    EXPECT_NE(plan.find("USING INDEX fldStaIdx"), std::string::npos) << plan;
-    EXPECT_EQ(plan.find("TEMP B-TREE"), std::string::npos) << plan;
-  }
-  EXPECT_NE(raw.plan(DB::pack_sql::kInfosOfFolder).find("SEARCH info USING INDEX fldStaIdx (folder=?)"),
-            std::string::npos);
-  EXPECT_NE(raw.plan(DB::pack_sql::kSelectInfo).find("USING PRIMARY KEY (id=?)"), std::string::npos);
-  EXPECT_EQ(db->infos("F1")->size(), 10u);
-}
-
 TEST_F(PackRecords, ContentsAreReplacedWholeAndErasedWithTheirRecord) {
   auto db = open("p");
   // Both sides of the limit between bound and streamed values.
@@ -234,11 +216,10 @@ TEST_F(PackRecords, AWriteTheEngineRefusesLeavesRecordAndContentAsTheyWere) {
   // The content is written after the record: a refused content must take
   // the record's new fields back with it.
   RawDb raw(db->dbFile());
-  raw.count("CREATE TRIGGER no_update BEFORE UPDATE ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END");
-  raw.count("CREATE TRIGGER no_insert BEFORE INSERT ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END");
+  raw.exec("CREATE TRIGGER no_update BEFORE UPDATE ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END;"
+           "CREATE TRIGGER no_insert BEFORE INSERT ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END");
   EXPECT_THROW(save(*db, changed, "second"), DB::DBExc);
-  raw.count("DROP TRIGGER no_update");
-  raw.count("DROP TRIGGER no_insert");
+  raw.exec("DROP TRIGGER no_update; DROP TRIGGER no_insert");
   EXPECT_EQ(*db->infoFor("P1"), first);
   EXPECT_EQ(contentOf(*db, "P1"), "first");
 

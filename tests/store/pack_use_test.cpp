@@ -5,7 +5,6 @@
 #include <gtest/gtest.h>
 
 #include "engine/db_exc.h"
-#include "pack_test_util.h"
 #include "store_fixture.h"
 #include "support/log_capture.h"
 
@@ -13,10 +12,12 @@ namespace {
 
 using Ipc::PackInfo;
 using Ipc::UseInfo;
-using pack_testing::complete;
-using pack_testing::RawDb;
-using pack_testing::useRequest;
+using store_testing::complete;
+using store_testing::storedRecord;
+using store_testing::storedText;
 using store_testing::StoreTest;
+using store_testing::useRequest;
+using testing_support::RawDb;
 using testing_support::LogCapture;
 using testing_support::VerboseLog;
 
@@ -76,11 +77,11 @@ TEST_F(PackUse, EditorsArePerHostAndProcessAndTheKeyGoesWithTheLastOne) {
   EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-1", 11}, {0, "ws-1", 10}}));
 
   RawDb raw(db->dbFile());
-  EXPECT_TRUE(raw.object("P").has("uses"));
+  EXPECT_TRUE(storedRecord(raw, "P").has("uses"));
   fetch(UseInfo::CloseEdit, "ws-1", 10);
   fetch(UseInfo::CloseEdit, "ws-1", 11);
   EXPECT_TRUE(usesOf(*db, "P").empty());
-  EXPECT_FALSE(raw.object("P").has("uses"));
+  EXPECT_FALSE(storedRecord(raw, "P").has("uses"));
   EXPECT_EQ(db->infoFor("P")->name, "name");
 }
 
@@ -94,12 +95,12 @@ TEST_F(PackUse, TheUploadLockBelongsToOneHostAndARefusalLeavesNoTrace) {
   PackInfo fromB = complete("P", "other", 8, "by B");
   fromB.uses.append(UseInfo(UseInfo::LockForUpload, "scan-B", "b", 6));
   RawDb raw(db->dbFile());
-  const auto before = raw.blob("P");
+  const auto before = storedText(raw, "P");
   EXPECT_EQ(refusal([&] { db->savePackMeta(fromB, "B's", 3); }), kLocked);
   EXPECT_EQ(refusal([&] { db->updateInfo(fromB); }), kLocked);
   EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "scan-B"); }), kLocked);
   EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "SCAN-A"); }), kLocked);  // hosts are exact bytes
-  EXPECT_EQ(raw.blob("P"), before);
+  EXPECT_EQ(storedText(raw, "P"), before);
   EXPECT_EQ(db->packMetadata(PackInfo("P")).content.view(), "content");
   EXPECT_EQ(db->infoFor("P")->folder(), "f");
 
@@ -137,7 +138,7 @@ TEST_F(PackUse, ALockOlderThanSevenHoursNoLongerBlocksAnotherHost) {
   EXPECT_EQ(taken->uses[0].host, "scan-B");
   // The old entries are gone from the stored list too.
   RawDb raw(db->dbFile());
-  EXPECT_EQ(raw.object("P").get("uses").dump().find("crashed"), std::string::npos);
+  EXPECT_EQ(storedRecord(raw, "P").get("uses").dump().find("crashed"), std::string::npos);
 }
 
 TEST_F(PackUse, AnUpdateAnswersTheListOnlyWhenItOpenedOrLocked) {

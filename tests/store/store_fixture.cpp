@@ -55,4 +55,22 @@ std::vector<std::string> entries(const std::filesystem::path& folder) {
   return names;
 }
 
+Ipc::PackInfo complete(const std::string& id, const std::string& folder, std::int32_t status,
+                       const std::string& name) {
+  Ipc::PackInfoPartial p;
+  p.name = name;
+  p.owner = "anna";
+  p.created = 1700000000;
+  p.modified = 1700003600;
+  p.docCount = 3;
+  return Ipc::PackInfo(id, folder, status, p);
+}
+
+Ipc::PackInfo useRequest(const std::string& id, Ipc::UseInfo::State state, const std::string& host,
+                         std::uint32_t process, const std::string& user) {
+  Ipc::PackInfo p(id);
+  p.uses.append(Ipc::UseInfo(state, host, user, process));
+  return p;
+}
+
 }  // namespace store_testing

@@ -1,7 +1,7 @@
 #pragma once
 // Shared set-up of the store tests: settings whose folders lie in a
-// temporary folder, a fresh engine pool per test, and a file-system double
-// that fails chosen calls.
+// temporary folder, a fresh engine pool per test, a file-system double
+// that fails chosen calls, and pack records to send.
 
 #include <gtest/gtest.h>
 
@@ -11,9 +11,12 @@
 #include <string>
 #include <vector>
 
+#include "framework/json.h"
+#include "protocol/pack_info.h"
 #include "service/config.h"
 #include "store/db_local.h"
 #include "store/file_ops.h"
+#include "support/raw_db.h"
 #include "support/temp_dir.h"
 
 namespace store_testing {
@@ -55,5 +58,19 @@ class FailingFileOps : public DB::FileOps {
 
 // The names in a folder, sorted; empty when it is missing.
 std::vector<std::string> entries(const std::filesystem::path& folder);
+
+// A complete pack record.
+Ipc::PackInfo complete(const std::string& id, const std::string& folder, std::int32_t status,
+                       const std::string& name = "name");
+// A request that names the pack and carries one use entry.
+Ipc::PackInfo useRequest(const std::string& id, Ipc::UseInfo::State state, const std::string& host,
+                         std::uint32_t process = 7, const std::string& user = "u");
+// The JSON text stored for a pack's record; none without a row.
+inline std::optional<std::string> storedText(const testing_support::RawDb& raw, const std::string& id) {
+  return raw.value("SELECT blob FROM info WHERE id = ?1", {id});
+}
+inline json::Object storedRecord(const testing_support::RawDb& raw, const std::string& id) {
+  return json::strToObject(storedText(raw, id).value());
+}
 
 }  // namespace store_testing
