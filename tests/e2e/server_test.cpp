@@ -1,6 +1,7 @@
 // The cvdbserver executable end to end: its command line, its lifecycle
 // under signals, and what crosses the wire when clients misbehave (the
-// transport and Listener tests pin the rules case by case).
+// transport and Listener tests pin the rules case by case: malformed
+// frames, vanishing clients, commands before Connect).
 
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -42,7 +43,7 @@ TEST(ServerLifecycle, EitherSignalStopsItPromptlyAndCleanlyWithIdleClientsConnec
     if (sig == SIGINT) o.configJson = R"({"ServerPort": 0, "ExtraLog": true})";  // shows the service's steps
     ServerProcess server(kServer, o);
     std::vector<std::unique_ptr<cvdb::Client>> idle;
-    for (int i = 0; i < 20; ++i) {
+    for (int i = 0; i < 8; ++i) {
       idle.push_back(clientOf(server));
       idle.back()->ping();
     }
@@ -71,7 +72,7 @@ TEST(ServerLifecycle, APortInUseEndsTheServerWithAFailure) {
   EXPECT_TRUE(second.waitForLogLine("Service main failed. Cannot listen on port " + std::to_string(first.port())));
 }
 
-TEST(ServerRequests, MisbehavingClientsEndOnlyTheirOwnConnectionWithTheirReason) {
+TEST(ServerRequests, ARefusalKeepsTheConnectionAndAMalformedRequestEndsOnlyItsOwn) {
   ServerProcess server(kServer);
   auto bystander = clientOf(server);
   bystander->ping();
@@ -82,26 +83,11 @@ TEST(ServerRequests, MisbehavingClientsEndOnlyTheirOwnConnectionWithTheirReason)
   EXPECT_TRUE(server.waitForLogLine(std::string("Ipc attempt to generate command with unknown tag: ") + '\x14'));
   refused->ping();
 
-  EXPECT_EQ(endedBy([&] { clientOf(server)->getData("42", "scan.tif"); }), kTerminating);
-  EXPECT_TRUE(server.waitForLogLine(
-      "Dispatching command GetData failed with No database associated with current connection. "
-      "Connect command failed?"));
-
   // GetData (tag 7) with a string length that runs past its frame.
-  const std::string truncated = lengthPrefix(2 + 4 + 3) + std::string("\x07\x00", 2) + lengthPrefix(1000) + "abc";
-  for (const auto& [input, reason] : std::vector<std::pair<std::string, std::string>>{
-           {lengthPrefix(0xFFFFFFFF), "Malformed frame: length out of range"},
-           {lengthPrefix(2) + std::string("\x01\x01", 2), "Malformed frame: not a request"},
-           {truncated, "Malformed request GetData"}}) {
-    auto c = clientOf(server);
-    c->sendRaw(input);
-    EXPECT_TRUE(endedBy([&] { c->awaitEnd(); }).starts_with(reason)) << reason;
-  }
+  auto malformed = clientOf(server);
+  malformed->sendRaw(lengthPrefix(2 + 4 + 3) + std::string("\x07\x00", 2) + lengthPrefix(1000) + "abc");
+  EXPECT_TRUE(endedBy([&] { malformed->awaitEnd(); }).starts_with("Malformed request GetData"));
   EXPECT_TRUE(server.waitForLogLine("Ipc Malformed request GetData from 127.0.0.1:"));
-  EXPECT_EQ(server.countLogLines("Ipc Malformed frame from"), 2u);
-
-  clientOf(server)->sendRaw(lengthPrefix(100) + std::string("\x07\x00", 2) + "partial");
-  EXPECT_TRUE(server.waitForLogLine("ended in the middle of a frame (13 of 104 bytes)"));
   bystander->ping();
 }
 

@@ -1,10 +1,9 @@
 // Databases, configuration parts and data files end to end: the real
-// server over loopback, driven by the client library and the cvdb tool.
+// server over loopback, driven by the client library.
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <thread>
 
 #include "e2e_support.h"
 #include "support/raw_db.h"
@@ -105,26 +104,6 @@ TEST(StoreEndToEnd, DataFilesRoundTripAndNamesCannotReachOtherFiles) {
   EXPECT_TRUE(server.waitForLogLine("Dispatching command SetData failed with Data id \"..\" is not valid"));
   EXPECT_EQ(testing_support::readFile(dbRoot(server) / "config.json"), config);
   EXPECT_EQ(std::distance(fs::directory_iterator(dbRoot(server) / "docs" / "d"), fs::directory_iterator()), 1);
-}
-
-TEST(StoreEndToEnd, TwoConnectionsWritingTheSameKeyLoseNothing) {
-  ServerProcess server(kServer);
-  constexpr int kRounds = 30;
-  const auto writer = [&](const std::string& who) {
-    auto c = clientOf(server, "busy");
-    for (int i = 0; i < kRounds; ++i) {
-      c->setCfg("shared", obj(R"({"who":")" + who + R"(","n":)" + std::to_string(i) + "}"));
-      c->setCfg(who + "-" + std::to_string(i), json::Object());
-    }
-  };
-  std::thread a(writer, "a");
-  std::thread b(writer, "b");
-  a.join();
-  b.join();
-  auto c = clientOf(server, "busy");
-  EXPECT_EQ(c->cfgIds("a-").size() + c->cfgIds("b-").size(), 2u * kRounds);
-  const std::string last = c->getCfg("shared").dump();
-  EXPECT_TRUE(last == R"({"who":"a","n":29})" || last == R"({"who":"b","n":29})") << last;
 }
 
 }  // namespace
