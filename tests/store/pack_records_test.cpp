@@ -109,7 +109,7 @@ TEST_F(PackRecords, KeysTheStoredObjectDoesNotKnowSurviveUpdatesAndUseChanges) {
   EXPECT_EQ(after.get("name"), json::Value::string("name"));
 }
 
-TEST_F(PackRecords, APartialRecordForAMissingPackIsRefusedAndWritesNothing) {
+TEST_F(PackRecords, AMissingPackIsCreatedOnlyByACompleteRecordAndAClosingOfItChangesNothing) {
   auto db = open("p");
   PackInfo partial = complete("P2", "f", 1);
   partial.docCount = PackInfoPartial::LONG_INVALID;  // one field short
@@ -126,15 +126,12 @@ TEST_F(PackRecords, APartialRecordForAMissingPackIsRefusedAndWritesNothing) {
   EXPECT_EQ(db->infoFor("P2"), nullptr);
   EXPECT_TRUE(db->infos("")->empty());
   EXPECT_TRUE(db->loadMetaBlob("P2").empty());
-}
 
-TEST_F(PackRecords, ClosingAMissingPackIsAcceptedAndChangesNothing) {
-  auto db = open("p");
-  // A configuration part under the same key must neither be overwritten
-  // nor handed out as a pack's content.
+  // Closing a missing pack is accepted and changes nothing: a
+  // configuration part under the same key must neither be overwritten nor
+  // handed out as a pack's content.
   const std::string part = R"({"kept":true})";
   db->saveMetaBlob(part.data(), part.size(), "P3");
-
   const auto close = useRequest("P3", Ipc::UseInfo::CloseEdit, "ws-1");
   EXPECT_EQ(db->updateInfo(close), nullptr);
   const auto fetched = db->packMetadata(close);
@@ -241,44 +238,6 @@ TEST_F(PackRecords, AWriteTheEngineRefusesLeavesRecordAndContentAsTheyWere) {
   save(*db, changed, "third");
   EXPECT_EQ(db->infoFor("P1")->name, "changed");
   EXPECT_EQ(contentOf(*db, "P1"), "third");
-}
-
-TEST_F(PackRecords, OperationsLogWhatTheyDidWhenVerbose) {
-  auto db = open("p");
-  const auto s = " S:" + std::to_string(db->sessionId());
-  {
-    LogCapture quiet;
-    save(*db, complete("P0", "f", 1), "c");
-    EXPECT_TRUE(quiet.entries().empty());
-  }
-  VerboseLog verbose;
-  LogCapture log;
-  db->updateInfo(complete("P1", "f", 1));
-  PackInfo partial("P1");
-  partial.setStatus(3);
-  db->updateInfo(partial);
-  save(*db, partial, "content");
-  db->infoFor("P1");
-  db->infoFor("none");
-  db->infos("f");
-  db->packMetadata(PackInfo("P1"));
-  db->packMetadata(useRequest("P1", Ipc::UseInfo::OpenForEdit, "h"));
-  db->removePack("P1");
-  db->removePack("none");
-  for (const std::string& line : std::vector<std::string>{
-           "DB:updateInfo" + s + " Info for P1 fully updated",
-           "DB:updateInfo" + s + " Info for P1 updated",
-           "DB:savePackMeta" + s + " Stored pack metadata for P1",
-           "DB:infoFor" + s + " Returning full info for P1",
-           "DB:infoFor" + s + " Can not find info for none",
-           "DB:infos" + s + " Returning 2 item(s) for folder \"f\"",
-           "DB:packMetadata" + s + " Returning pack metadata for P1",
-           "DB:packMetadata" + s + " Returning pack metadata for P1. Pack use updated",
-           "DB:removePack" + s + " Deleted pack metadata for P1",
-       }) {
-    EXPECT_TRUE(log.contains(Log::Debug, line)) << line;
-  }
-  EXPECT_EQ(log.count("DB:removePack"), 1u);
 }
 
 }  // namespace

@@ -164,10 +164,41 @@ TEST_F(PackUse, AnUpdateAnswersTheListOnlyWhenItOpenedOrLocked) {
   EXPECT_EQ(db->infoFor("P")->uses.size(), 1u);
 }
 
-TEST_F(PackUse, EveryTransitionIsLoggedWithItsEntryWhenVerbose) {
+TEST_F(PackUse, OperationsAndEveryUseTransitionAreLoggedWhenVerbose) {
+  {
+    LogCapture quiet;
+    db->savePackMeta(complete("Q", "f", 1), "c", 1);
+    EXPECT_TRUE(quiet.entries().empty());
+  }
   VerboseLog verbose;
   LogCapture log;
-  const auto s = "DB:updateUseInfo S:" + std::to_string(db->sessionId()) + " Pack P ";
+  const auto session = " S:" + std::to_string(db->sessionId());
+  db->updateInfo(complete("P1", "f", 1));
+  PackInfo partial("P1");
+  partial.setStatus(3);
+  db->updateInfo(partial);
+  db->savePackMeta(partial, "content", 7);
+  db->infoFor("P1");
+  db->infoFor("none");
+  db->infos("f");
+  db->packMetadata(PackInfo("P1"));
+  db->removePack("P1");
+  db->removePack("none");
+  for (const std::string& line : std::vector<std::string>{
+           "DB:updateInfo" + session + " Info for P1 fully updated",
+           "DB:updateInfo" + session + " Info for P1 updated",
+           "DB:savePackMeta" + session + " Stored pack metadata for P1",
+           "DB:infoFor" + session + " Returning full info for P1",
+           "DB:infoFor" + session + " Can not find info for none",
+           "DB:infos" + session + " Returning 3 item(s) for folder \"f\"",
+           "DB:packMetadata" + session + " Returning pack metadata for P1",
+           "DB:removePack" + session + " Deleted pack metadata for P1",
+       }) {
+    EXPECT_TRUE(log.contains(Log::Debug, line)) << line;
+  }
+  EXPECT_EQ(log.count("DB:removePack"), 1u);
+
+  const auto s = "DB:updateUseInfo" + session + " Pack P ";
   db->packMetadata(useRequest("P", UseInfo::OpenForEdit, "ws-1", 0, ""));  // the server's own tools
   fetch(UseInfo::OpenForEdit, "ws-1", 42);
   fetch(UseInfo::CloseEdit, "ws-1", 42);
@@ -196,6 +227,7 @@ TEST_F(PackUse, EveryTransitionIsLoggedWithItsEntryWhenVerbose) {
     seen.push_back(e.text.substr(e.text.find("DB:updateUseInfo")));
   }
   EXPECT_EQ(seen, expected);
+  EXPECT_TRUE(log.contains(Log::Debug, "DB:packMetadata" + session + " Returning pack metadata for P. Pack use updated"));
 }
 
 }  // namespace
