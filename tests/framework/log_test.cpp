@@ -5,29 +5,9 @@
 #include <filesystem>
 
 #include "framework/platform.h"
-#include "support/log_capture.h"
 #include "support/temp_dir.h"
 
 namespace {
-
-using testing_support::LogCapture;
-using testing_support::VerboseLog;
-
-TEST(Log, DebugEntriesOnlyWhenVerbose) {
-  LogCapture capture;
-  {
-    VerboseLog quiet(false);
-    Log::Lock(Log::Debug).logStreamLine() << "hidden";
-    Log::Lock(Log::Notice).logStreamLine() << "shown";
-  }
-  {
-    VerboseLog verbose;
-    Log::Lock(Log::Debug).logStreamLine() << "debug shown";
-  }
-  EXPECT_EQ(capture.count("hidden"), 0u);
-  EXPECT_TRUE(capture.contains(Log::Notice, "shown"));
-  EXPECT_TRUE(capture.contains(Log::Debug, "debug shown"));
-}
 
 TEST(Log, EntriesCarryTimeThreadPriorityAndTextAndTheFileRotatesAtTheRecycleSize) {
   testing_support::TempDir dir;
