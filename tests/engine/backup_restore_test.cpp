@@ -124,9 +124,10 @@ TEST_F(BackupRestore, FailedBackupLeavesNoCopy) {
             err::kNotInitialized);
 }
 
-// The restored file replaces the destination's; a write-ahead log left
-// beside the destination is not replayed onto it.
-TEST_F(BackupRestore, RestorePlacesTheBackupAndDropsAStaleLog) {
+// The restored file replaces the destination's, whatever its name in the
+// backup; a write-ahead log left beside the destination is not replayed
+// onto it.
+TEST_F(BackupRestore, RestorePlacesTheBackupUnderAnyNameAndDropsAStaleLog) {
   const fs::path backup = dir_.path() / "backup";
   const fs::path file = root() + "r/cvdb.edb";
   const fs::path savedWal = dir_.path() / "saved-wal";
@@ -144,42 +145,26 @@ TEST_F(BackupRestore, RestorePlacesTheBackupAndDropsAStaleLog) {
     fs::copy_file(engine::walFile(file), savedWal);
   }
   fs::copy_file(savedWal, engine::walFile(file));
+  fs::rename(backup / "cvdb.edb", backup / "old-name.db");
+  writeFile(backup / "originDB.txt", "x\r\nr");
 
   const engine::InstanceSettings settings = settingsFor("r");
   auto held = engine::Instance::create(settings);
   engine::restoreInstance(*held, backup, settings.instanceFolder, record_);
   expectWellFormedReports(notes_, engine::SnapshotOperation::Restore);
   EXPECT_FALSE(fs::exists(engine::walFile(file)));
-  EXPECT_TRUE(fs::exists(backup / "cvdb.edb"));  // the backup itself is left as it was
+  EXPECT_TRUE(fs::exists(backup / "old-name.db"));  // the backup itself is left as it was
   held->term();
+  // Two files with our identity: neither is taken.
+  fs::copy_file(backup / "old-name.db", backup / "other.db");
+  EXPECT_EQ(codeOf([&] { engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder,
+                                                 nullptr); }),
+            err::kBadBackupFormat);
 
   RawDb db(file);
   EXPECT_EQ(db.number("SELECT value FROM counter WHERE id = 1"), 1000);
   EXPECT_EQ(db.value("PRAGMA integrity_check"), "ok");
   EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
-}
-
-TEST_F(BackupRestore, BackupUnderAnotherFileNameIsFound) {
-  const fs::path backup = dir_.path() / "backup";
-  {
-    auto instance = makeInstance("named");
-    auto session = makeDatabase(instance);
-    engine::backupInstance(*instance, backup, nullptr);
-  }
-  fs::rename(backup / "cvdb.edb", backup / "old-name.db");
-  writeFile(backup / "originDB.txt", "x\r\nnamed");
-
-  engine::InstanceSettings settings = settingsFor("named");
-  settings.instanceFolder = root() + "restored/";
-  engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr);
-  EXPECT_TRUE(fs::exists(root() + "restored/cvdb.edb"));
-
-  // Two files with our identity: neither is taken.
-  fs::copy_file(backup / "old-name.db", backup / "other.db");
-  EXPECT_EQ(codeOf([&] {
-              engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr);
-            }),
-            err::kBadBackupFormat);
 }
 
 // Backups that are not ours, are newer, or are damaged are refused with

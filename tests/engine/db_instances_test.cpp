@@ -74,7 +74,9 @@ class Pool : public EngineTest {
   std::atomic<int> opened_{0};
 };
 
-TEST_F(Pool, TwoClientsOfANewDatabaseShareOneInstance) {
+TEST_F(Pool, TheEngineStartIsLoggedAndTwoClientsOfANewDatabaseShareOneInstance) {
+  VerboseLog verbose;
+  LogCapture log;
   std::barrier start(2);
   std::unique_ptr<engine::Session> sessions[2];
   std::vector<std::thread> threads;
@@ -92,6 +94,11 @@ TEST_F(Pool, TwoClientsOfANewDatabaseShareOneInstance) {
   EXPECT_TRUE(sessions[1]->isOpen());
   close("shared", std::move(sessions[0]));
   EXPECT_EQ(record("shared")->sessions, 1u);
+  const std::string started = "DBInstances: Engine initialized\n\t\"" + root() +
+                              "\" is the databases root\n\t100 maximum active databases\n"
+                              "\t100 maximum active clients per database\n\t\"cvd\" database file names prefix\n"
+                              "\t\"cvdb.edb\" database file name\n";
+  EXPECT_EQ(log.count(Log::Debug, started), 1u);
 }
 
 TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimitOrWhenAsked) {
@@ -135,11 +142,19 @@ TEST_F(Pool, InstanceAndSessionLimitsAreTheEngines) {
   EXPECT_FALSE(record("b"));
 }
 
-TEST_F(Pool, ExclusiveHoldRefusesSessionsAtOnceAndLeavesForANewInstance) {
-  close("r", open("r"));
+TEST_F(Pool, ExclusiveHoldWaitsForTheLastClientRefusesSessionsAtOnceAndLeavesForANewInstance) {
+  configure(100, 100, 20);
+  auto s = open("r");
   const auto firstInstance = record("r")->instanceId;
   {
-    InstanceForMaintenance hold("r", nullptr, true);
+    Recorder progress;
+    progress.then = [&](std::size_t n) {
+      if (n == 3) close("r", std::move(s));
+    };
+    InstanceForMaintenance hold("r", &progress, true);
+    ASSERT_EQ(progress.texts.size(), 3u);
+    EXPECT_EQ(progress.texts[2], "Waiting for all clients connected to the database to exit (3/20seconds passed)");
+    EXPECT_TRUE(record("r")->maintenance);
     EXPECT_FALSE(hold.instance()->state() == engine::Instance::State::Initialised);
     EXPECT_NE(hold.instance()->id(), firstInstance);
     const auto start = std::chrono::steady_clock::now();
@@ -150,7 +165,7 @@ TEST_F(Pool, ExclusiveHoldRefusesSessionsAtOnceAndLeavesForANewInstance) {
   }
   EXPECT_FALSE(record("r"));
   const int before = opened_;
-  auto s = open("r");
+  s = open("r");
   EXPECT_EQ(opened_, before + 1);
   EXPECT_TRUE(record("r")->initialised);
 }
@@ -180,19 +195,6 @@ TEST_F(Pool, SharedHoldNeedsAnOpenInstanceWaitsWithItsMessagesAndLeavesTheInstan
   }
   EXPECT_FALSE(record("busy")->maintenance);
   EXPECT_EQ(record("busy")->instanceId, id);
-}
-
-TEST_F(Pool, ExclusiveHoldWaitsUntilTheLastClientLeaves) {
-  configure(100, 100, 20);
-  auto s = open("leaving");
-  Recorder progress;
-  progress.then = [&](std::size_t n) {
-    if (n == 3) close("leaving", std::move(s));
-  };
-  InstanceForMaintenance hold("leaving", &progress, true);
-  ASSERT_EQ(progress.texts.size(), 3u);
-  EXPECT_EQ(progress.texts[2], "Waiting for all clients connected to the database to exit (3/20seconds passed)");
-  EXPECT_TRUE(record("leaving")->maintenance);
 }
 
 // A restore never runs beside a backup, a cleanup or another restore of the
@@ -276,17 +278,6 @@ TEST_F(Pool, TeardownInterruptsAWaitingHold) {
   DBInstances::teardown();
   ASSERT_EQ(hold.wait_for(std::chrono::seconds(10)), std::future_status::ready);
   EXPECT_EQ(codeOf([&] { hold.get(); }), err::kTermInProgress);
-}
-
-TEST_F(Pool, EngineStartIsLogged) {
-  VerboseLog verbose;
-  LogCapture log;
-  DBInstances::inst();
-  const std::string expected = "DBInstances: Engine initialized\n\t\"" + root() +
-                               "\" is the databases root\n\t100 maximum active databases\n"
-                               "\t100 maximum active clients per database\n\t\"cvd\" database file names prefix\n"
-                               "\t\"cvdb.edb\" database file name\n";
-  EXPECT_EQ(log.count(Log::Debug, expected), 1u);
 }
 
 }  // namespace

@@ -42,22 +42,6 @@ TEST_F(Conflicts, StaleSnapshotWriteIsAWriteConflict) {
   EXPECT_EQ(counter(*reader), 1);
 }
 
-// A connection that already reads and then wants to write while another
-// holds the write lock gets BUSY at once (no busy wait could help it).
-TEST_F(Conflicts, WriteWhileAnotherHoldsTheLockIsAWriteConflict) {
-  auto instance = makeInstance("busy");
-  auto holder = makeDatabase(instance);
-  auto other = openSession(instance);
-  other->execute("BEGIN");
-  EXPECT_EQ(counter(*other), 0);
-  holder->execute("BEGIN IMMEDIATE");
-  const auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(codeOf([&] { other->prepare("UPDATE counter SET value = 2").run(); }), err::kWriteConflict);
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
-  other->execute("ROLLBACK");
-  holder->execute("ROLLBACK");
-}
-
 // A writer that waits longer than the busy timeout for the write lock gets
 // a write conflict, and the lock holder is not disturbed.
 TEST_F(Conflicts, WaitForTheWriteLockBeyondTheTimeoutIsAWriteConflict) {

@@ -136,16 +136,6 @@ TEST_F(Sessions, InstanceStatesAndLimits) {
   EXPECT_EQ(codeOf([&] { one->createDatabase(root() + "limits/cvdb.edb"); }), err::kTermInProgress);
 }
 
-TEST_F(Sessions, ProcessWideInstanceLimit) {
-  engine::setMaxInstances(engine::liveInstances() + 2);
-  auto a = makeInstance("i1");
-  auto b = makeInstance("i2");
-  EXPECT_EQ(codeOf([&] { makeInstance("i3"); }), err::kTooManyInstances);
-  a->term();
-  auto c = makeInstance("i3");
-  engine::setMaxInstances(100);
-}
-
 TEST_F(Sessions, StatementsAreResetAfterUseAndNestedUsesAreIndependent) {
   auto instance = makeInstance("stmts");
   auto writer = makeDatabase(instance);

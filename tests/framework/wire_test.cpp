@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstring>
-
 namespace {
 
 TEST(Wire, RoundTripOfEveryFieldKindInLittleEndian) {
@@ -47,28 +45,6 @@ TEST(Wire, MalformedMessagesAreRefusedBeforeAnythingIsAllocated) {
   wire::Reader r(trailing);
   r.u8();
   EXPECT_THROW(r.expectEnd(), wire::DecodeError);
-}
-
-TEST(Wire, SharedBytesTravelWithoutACopy) {
-  std::string head;
-  SharedMemBuffer tail;
-  wire::Writer w(head, tail);
-  SharedMemBuffer content(MemBuffer::copyOf("payload"));
-  w.sharedBytes(content);
-  EXPECT_EQ(tail.data(), content.data());
-  EXPECT_EQ(head.size(), 8u);  // only the length went into the head
-  EXPECT_THROW(w.sharedBytes(content), std::logic_error);
-
-  // A reader with an owner hands out views that keep the owner alive.
-  std::string msg;
-  wire::Writer(msg).bytes("abc", 3);
-  std::shared_ptr<unsigned char> owner(ExportedUCharAlloc::alloc(msg.size()), ExportedUCharAlloc());
-  std::memcpy(owner.get(), msg.data(), msg.size());
-  wire::Reader r(owner, msg.size());
-  SharedMemBuffer b = r.sharedBytes();
-  EXPECT_EQ(b.data(), owner.get() + 8);
-  owner.reset();
-  EXPECT_EQ(b.view(), "abc");
 }
 
 }  // namespace
