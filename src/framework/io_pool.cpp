@@ -213,6 +213,12 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
   const SlotGuard slot(s->mutex, s->slots);
   for (;;) {
     if (spare && s->parkSpares.load()) {
+      // What the last handler deferred (a read's command, a command's
+      // answer) went back to the shared queue when run_one_for returned,
+      // and Asio woke no thread for it: this thread was to run it next.
+      // Run it, and whatever it defers, before stepping aside; otherwise it
+      // would wait for some unrelated event to wake a thread.
+      if (!drain(*s, *io)) return;
       if (!park(s)) return;
       continue;
     }
@@ -237,6 +243,21 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
     if (s->active() - 1 <= s->busy.load()) continue;
     retire(*s);
     return;
+  }
+}
+
+// Runs the handlers that are ready, without waiting for more. False when
+// the I/O context has stopped.
+bool IoPool::drain(State& s, boost::asio::io_context& io) {
+  for (;;) {
+    try {
+      io.poll();
+      return !io.stopped();
+    } catch (const std::exception& e) {
+      s.tell(std::string("Unexpected failure in an I/O thread: ") + e.what());
+    } catch (...) {
+      s.tell("Unexpected failure in an I/O thread");
+    }
   }
 }
 

@@ -102,6 +102,7 @@ class IoPool {
   static void threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
                          bool spare);
   static void watcherMain(const std::shared_ptr<State>& s);
+  static bool drain(State& s, boost::asio::io_context& io);
   static bool park(const std::shared_ptr<State>& s);
   static void retire(State& s);
   // Called with the state's mutex held. Returns a problem to report, if

@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <boost/asio/defer.hpp>
 #include <boost/asio/executor_work_guard.hpp>
 #include <boost/asio/post.hpp>
 #include <chrono>
@@ -119,10 +120,24 @@ TEST(IoPool, SparesNoLongerNeededParkAndAreWokenBeforeNewOnesStart) {
   }));
   EXPECT_EQ(rig.pool.threadCount(), threads);  // parked, not ended
 
-  Gate second;
-  blockSixAndServe(rig, second);
-  EXPECT_EQ(rig.pool.threadCount(), threads);  // woken, none started
-  second.open();
+  // Woken again, then stepping aside again, several times over. Handlers
+  // run one at a time, each deferring a follow-up as a read defers its
+  // command. A spare that steps aside after such a handler must run the
+  // follow-up first: Asio hands it back to the shared queue without waking
+  // a thread, so it would wait for an unrelated event (with a lone client,
+  // for ever).
+  for (int cycle = 0; cycle < 3; ++cycle) {
+    Gate again;
+    blockSixAndServe(rig, again);
+    EXPECT_EQ(rig.pool.threadCount(), threads);  // woken, none started
+    again.open();
+    for (int round = 0; rig.pool.activeCount() > 2; ++round) {
+      ASSERT_LT(round, 1000000);
+      std::promise<void> followed;
+      asio::post(*rig.io, [&] { asio::defer(*rig.io, [&] { followed.set_value(); }); });
+      ASSERT_EQ(followed.get_future().wait_for(10s), std::future_status::ready) << "a follow-up was left unrun";
+    }
+  }
 }
 
 TEST(IoPool, ShortCommandsDoNotMakeThePoolGrow) {
