@@ -14,10 +14,13 @@ TEST(Log, EntriesCarryTimeThreadPriorityAndTextAndTheFileRotatesAtTheRecycleSize
   const auto old = Platform::inst().logDir();
   Platform::inst().changeLogDir(dir.path());
   Log::Lock(Log::Warning).logStreamLine() << "disk nearly full";
-  Log::flush();
+  Log::Lock(Log::Notice).logStreamLine() << "client connected";
+  // Read without a flush: an operator following the file sees each entry
+  // as soon as it is written.
   // [2026-12-06 07:37:38.123] [1234] [warning] disk nearly full
   const std::string text = testing_support::readFile(dir.path() / Log::kLogFileName);
   EXPECT_NE(text.find("] [warning] disk nearly full"), std::string::npos) << text;
+  EXPECT_NE(text.find("] [notice] client connected"), std::string::npos) << text;
   EXPECT_EQ(text.substr(0, 1) + text.substr(5, 1), "[-");
 
   const std::string line(64 * 1024, 'x');
