@@ -20,7 +20,8 @@
 // thread per busy connection under load on few cores, and latency suffers
 // from the crowd. The watcher sleeps while some thread is free.
 // When no command has needed a spare for about 100 looks, the spares park
-// outside the I/O context after their current handler (a crowd of idle
+// outside the I/O context after their current handler and what it deferred
+// (a crowd of idle
 // threads in the I/O context's scheduling slows every request down), and
 // the watcher wakes parked spares before it starts new ones. Spares that
 // have run nothing, or stayed parked, for `spareIdle` end, as long as one
