@@ -87,8 +87,7 @@ ConnectionPtr openConnection(const std::filesystem::path& file, OpenMode mode, s
   }
   const std::string pragmas = "PRAGMA synchronous=FULL; PRAGMA cache_size=-" + std::to_string(kConnectionCacheKiB) +
                               "; PRAGMA journal_size_limit=" + std::to_string(kWalSizeLimit) +
-                              "; PRAGMA secure_delete=FAST; PRAGMA mmap_size=" +
-                              std::to_string(kConnectionMmapBytes) + ";";
+                              "; PRAGMA secure_delete=FAST;";
   execute(db.get(), pragmas.c_str(), where);
   return db;
 }

@@ -29,15 +29,6 @@ using ConnectionPtr = std::unique_ptr<sqlite3, ConnectionCloser>;
 // would be 2 GiB, so the cache is kept small and the operating system's
 // page cache does the rest.
 inline constexpr int kConnectionCacheKiB = 256;
-// Bytes of a database file that a connection reads through a memory map
-// rather than by copying pages out of the operating system's cache: a scan
-// of a large table costs a third less. Pages are mapped shared, so a
-// thousand connections of one database share them. SQLite maps the file
-// for reads only; writes still go through write(2) and the WAL. The price:
-// a read error of the disk under a mapped page ends the process with
-// SIGBUS instead of failing the one request (committed data is safe
-// either way).
-inline constexpr std::int64_t kConnectionMmapBytes = 1024 * 1024 * 1024;
 // After a checkpoint the WAL file is cut back to this size, so that one big
 // value does not leave a write-ahead log of its size behind.
 inline constexpr std::int64_t kWalSizeLimit = 64 * 1024 * 1024;

@@ -15,7 +15,7 @@
 
 namespace {
 
-// The highest private resident size of the process while it runs, sampled every
+// The highest resident size of the process while it runs, sampled every
 // millisecond from /proc.
 class PeakRss {
  public:
@@ -35,14 +35,11 @@ class PeakRss {
     return peak_;
   }
 
-  // Resident pages of the process's own, not the database file's pages
-  // that the engine reads through a shared map (those belong to the
-  // operating system's cache).
   static std::int64_t current() {
     std::ifstream statm("/proc/self/statm");
-    std::int64_t size = 0, resident = 0, shared = 0;
-    statm >> size >> resident >> shared;
-    return (resident - shared) * sysconf(_SC_PAGESIZE);
+    std::int64_t size = 0, resident = 0;
+    statm >> size >> resident;
+    return resident * sysconf(_SC_PAGESIZE);
   }
 
  private:
