@@ -5,10 +5,8 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cstdint>
 #include <ostream>
-#include <random>
 #include <string>
 #include <vector>
 
@@ -60,16 +58,10 @@ Outcome viaReader(const std::string& text) {
   return o;
 }
 
-// What the comparison saw, so that a generator that stops making useful
-// texts fails loudly instead of passing.
-struct Tally {
-  int accepted = 0, refused = 0, withName = 0, withEntries = 0;
-};
-
 // Same record or same message through the public reader; the streaming
 // part alone must agree with jansson on acceptance too, unless the text is
 // one it may leave to jansson (a raw NUL byte, or mayDefer).
-void expectSame(const std::string& text, Tally* tally = nullptr, bool mayDefer = false) {
+void expectSame(const std::string& text, bool mayDefer = false) {
   SCOPED_TRACE("text: " + testing::PrintToString(text));
   const Outcome want = viaJansson(text);
   const Outcome got = viaReader(text);
@@ -87,261 +79,37 @@ void expectSame(const std::string& text, Tally* tally = nullptr, bool mayDefer =
   } else if (!mayDefer && text.find('\0') == std::string::npos) {
     EXPECT_FALSE(want.ok) << "the streaming reader refused a text jansson takes";
   }
-  if (tally) {
-    ++(want.ok ? tally->accepted : tally->refused);
-    if (want.ok && want.value.name != PackInfoPartial::STR_INVALID) ++tally->withName;
-    if (want.ok && !want.value.uses.empty()) ++tally->withEntries;
-  }
 }
-
-// Seeded generator of stored texts: mostly records of the stored form,
-// with wrong types, unknown keys, nested junk, duplicates, boundary
-// numbers, escapes, and now and then a fault that makes the text invalid.
-class TextGen {
- public:
-  explicit TextGen(std::uint64_t seed) : rng_(seed) {}
-
-  std::string text() {
-    // A third of the texts carry faults of the generator's own making;
-    // the mutations below may break any of them.
-    faults_ = chance(33);
-    std::string t;
-    const int top = pick(100);
-    if (top < 2) {
-      t = "[" + junk(1) + "]";
-    } else if (top < 3) {
-      t = junk(3);
-    } else {
-      t = record();
-    }
-    t = ws() + t + ws();
-    if (chance(3)) t += oneOf({"x", "{}", "}", "\n", " 1", ",", std::string(1, '\0')});
-    if (chance(4) && !t.empty()) t[pick(static_cast<int>(t.size()))] = static_cast<char>(pick(256));
-    if (chance(2)) t.insert(static_cast<std::size_t>(pick(static_cast<int>(t.size()) + 1)), 1, '\0');
-    if (chance(3)) t.resize(static_cast<std::size_t>(pick(static_cast<int>(t.size()) + 1)));
-    return t;
-  }
-
-  // A record of the stored form with valid fields only.
-  std::string validRecord() {
-    faults_ = false;
-    return record();
-  }
-
- private:
-  bool chance(int percent) { return pick(100) < percent; }
-  int pick(int n) { return static_cast<int>(rng_() % static_cast<std::uint64_t>(n)); }
-  std::string oneOf(const std::vector<std::string>& options) { return options[pick(static_cast<int>(options.size()))]; }
-  bool fault(int percent) { return faults_ && chance(percent); }
-
-  std::string ws() {
-    if (!chance(15)) return "";
-    if (fault(2)) return oneOf({"\f", "\v", "\xC2\xA0"});
-    return oneOf({" ", "\t", "\n", "\r\n", "  "});
-  }
-
-  std::string object(const std::vector<std::pair<std::string, std::string>>& members) {
-    std::string o = "{" + ws();
-    for (std::size_t i = 0; i < members.size(); ++i) {
-      if (i) o += ws() + "," + ws();
-      o += members[i].first + ws() + ":" + ws() + members[i].second;
-    }
-    return o + ws() + "}";
-  }
-
-  std::string hex4(unsigned v) {
-    static const char* digits[] = {"0123456789abcdef", "0123456789ABCDEF"};
-    const char* d = digits[pick(2)];
-    return {'\\', 'u', d[(v >> 12) & 15], d[(v >> 8) & 15], d[(v >> 4) & 15], d[v & 15]};
-  }
-
-  static std::string utf8(unsigned cp) {
-    std::string s;
-    if (cp < 0x80) {
-      s += static_cast<char>(cp);
-    } else if (cp < 0x800) {
-      s += static_cast<char>(0xC0 | (cp >> 6));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    } else if (cp < 0x10000) {
-      s += static_cast<char>(0xE0 | (cp >> 12));
-      s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    } else {
-      s += static_cast<char>(0xF0 | (cp >> 18));
-      s += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
-      s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    }
-    return s;
-  }
-
-  // A string token; key strings refuse \u0000, which is why they differ.
-  std::string str(bool key = false) {
-    std::string s = "\"";
-    const int pieces = pick(key ? 3 : 12);
-    for (int i = 0; i < pieces; ++i) {
-      const int k = pick(100);
-      if (k < 45) {
-        s += static_cast<char>(0x20 + pick(95));
-        if (s.back() == '"' || s.back() == '\\') s.back() = 'q';
-      } else if (k < 55) {
-        s += oneOf({"\\\"", "\\\\", "\\/", "\\b", "\\f", "\\n", "\\r", "\\t"});
-      } else if (k < 65) {
-        unsigned cp = static_cast<unsigned>(1 + pick(0xFFFE));
-        if (cp >= 0xD800 && cp <= 0xDFFF) cp = 0xE000;
-        s += hex4(cp);
-      } else if (k < 72) {
-        s += hex4(0xD800 + static_cast<unsigned>(pick(0x400))) + hex4(0xDC00 + static_cast<unsigned>(pick(0x400)));
-      } else if (k < 90) {
-        static const unsigned starts[] = {0x80, 0x800, 0xE000, 0x10000};
-        static const unsigned spans[] = {0x780, 0xD000, 0x2000, 0x100000};
-        const int w = pick(4);
-        s += utf8(starts[w] + static_cast<unsigned>(pick(static_cast<int>(spans[w]))));
-      } else if (k < 92) {
-        s += "\\u0000";
-      } else if (fault(10)) {
-        s += oneOf({hex4(0xD800) + "x", hex4(0xDBFF) + hex4(0x41), hex4(0xDC00), hex4(0xDFFF) + hex4(0xDC00),
-                    "\x80", "\xC0\x80", "\xED\xA0\x80", "\xF5\x80\x80\x80", "\xE2\x82", "\xF4\x90\x80\x80",
-                    "\x01", "\x1F", "\\x", "\\u12", "\\U0041"});
-      }
-    }
-    return s + "\"";
-  }
-
-  std::string integer() {
-    const int k = pick(100);
-    if (k < 40) return std::to_string(static_cast<std::int64_t>(rng_()) >> pick(64));
-    if (k < 60) return std::to_string(pick(2000) - 1000);
-    if (fault(10)) return oneOf({"01", "-", "+1", "1.", ".5", "1e", "0x10", "--1", "1-"});
-    if (fault(30)) {  // beyond long long
-      return oneOf({"9223372036854775808", "-9223372036854775809", "18446744073709551615",
-                    "123456789012345678901234567890", std::string(400, '9')});
-    }
-    return oneOf({"0", "-0", "2147483647", "2147483648", "-2147483648", "-2147483647", "-2147483649",
-                  "4294967295", "4294967296", "9223372036854775807", "-9223372036854775808"});
-  }
-
-  std::string real() {
-    if (fault(30)) return oneOf({"1e309", "-1e309", "1.8e308", "10e308", "9" + std::string(400, '9') + ".5"});
-    return oneOf({"1.5", "-0.0", "1e5", "1E-5", "2.5e+3", "0.1e309", "1e-400", "1e308", "123.456e-7", "7.0"});
-  }
-
-  std::string junk(int depth) {
-    const int k = pick(depth > 3 ? 7 : 9);
-    switch (k) {
-      case 0: case 1: return integer();
-      case 2: return real();
-      case 3: case 4: return str();
-      case 5: return oneOf({"true", "false", "null"});
-      case 6: return fault(5) ? oneOf({"tru", "nul", "True", "NaN", "Infinity", "'x'"}) : "null";
-      case 7: {
-        std::string a = "[" + ws();
-        for (int i = pick(4); i > 0; --i) a += junk(depth + 1) + (i > 1 ? "," : "");
-        return a + ws() + "]";
-      }
-      default: {
-        std::vector<std::pair<std::string, std::string>> m;
-        for (int i = pick(4); i > 0; --i) m.emplace_back(str(true), junk(depth + 1));
-        return object(m);
-      }
-    }
-  }
-
-  std::string time() {
-    const int k = pick(10);
-    if (k < 6) return std::to_string(kNow - pick(static_cast<int>(2 * kLimit)));
-    if (k < 8) return std::to_string(kNow - kLimit - pick(2));
-    return integer();
-  }
-
-  // A key of the record: mostly plain, sometimes spelt with escapes.
-  std::string key(const std::string& name) {
-    if (!chance(5)) return "\"" + name + "\"";
-    std::string k = "\"";
-    for (char c : name) k += chance(30) ? hex4(static_cast<unsigned char>(c)) : std::string(1, c);
-    return k + "\"";
-  }
-
-  std::string entry() {
-    if (chance(8)) return junk(3);
-    std::vector<std::pair<std::string, std::string>> m;
-    auto add = [&](const std::string& k, std::string v) {
-      if (chance(10)) return;                  // absent
-      if (chance(10)) v = junk(4);             // wrong type, mostly
-      m.emplace_back(key(k), v);
-      if (chance(4)) m.emplace_back(key(k), junk(4));  // a duplicate wins
-    };
-    add("state", oneOf({"0", "2", "100", "101", integer()}));
-    add("host", str());
-    add("user", str());
-    add("process", chance(70) ? std::to_string(pick(70000)) : integer());
-    add("time", time());
-    if (chance(10)) m.emplace_back(str(true), junk(4));
-    std::shuffle(m.begin(), m.end(), rng_);
-    return object(m);
-  }
-
-  std::string uses() {
-    if (chance(5)) return junk(2);
-    std::vector<std::pair<std::string, std::string>> m;
-    std::string list = "[" + ws();
-    for (int i = pick(6); i > 0; --i) list += entry() + (i > 1 ? "," : "");
-    list += ws() + "]";
-    m.emplace_back(key("entries"), chance(95) ? list : junk(3));
-    if (chance(10)) m.emplace_back(str(true), junk(3));
-    if (chance(5)) m.emplace_back(key("entries"), chance(50) ? "[]" : junk(3));
-    std::shuffle(m.begin(), m.end(), rng_);
-    return object(m);
-  }
-
-  std::string record() {
-    std::vector<std::pair<std::string, std::string>> m;
-    auto add = [&](const std::string& k, const std::string& v) {
-      if (chance(5)) return;
-      m.emplace_back(key(k), chance(8) ? junk(2) : v);
-      if (chance(3)) m.emplace_back(key(k), chance(50) ? v : junk(2));
-    };
-    add("name", str());
-    add("owner", str());
-    add("created", time());
-    add("modified", time());
-    add("docCount", chance(80) ? std::to_string(pick(5000)) : integer());
-    add("uses", uses());
-    for (int i = pick(3); i > 0; --i) {
-      m.emplace_back(chance(50) ? str(true) : key(oneOf({"Name", "names", "", "entries", "state"})), junk(1));
-    }
-    std::shuffle(m.begin(), m.end(), rng_);
-    return object(m);
-  }
-
-  std::mt19937_64 rng_;
-  bool faults_ = false;
-};
 
 class StoredRecordReader : public testing::Test {
  protected:
   Ipc::FixedUseClock clock_{kNow};
 };
 
-TEST_F(StoredRecordReader, MatchesJanssonOnGeneratedTexts) {
-  constexpr std::uint64_t kSeed = 20240611;
-  TextGen gen(kSeed);
-  Tally tally;
-  for (int i = 0; i < 20000 && !HasFatalFailure(); ++i) expectSame(gen.text(), &tally);
-  // The generator must keep making both kinds, and records worth reading.
-  EXPECT_GT(tally.accepted, 10000);
-  EXPECT_GT(tally.refused, 4000);
-  EXPECT_GT(tally.withName, 8000);
-  EXPECT_GT(tally.withEntries, 2500);
+// Valid records of the stored form, each exercising a different part of
+// the grammar: escapes and raw UTF-8 in strings, entries at and beyond the
+// age limit, unknown keys with nested values, duplicates, keys spelt with
+// escapes, boundary integers, reals and white space.
+std::vector<std::string> validRecords() {
+  const std::string now = std::to_string(kNow);
+  const std::string old = std::to_string(kNow - kLimit - 1);
+  return {
+      R"({"name":"P \"1\" \\ \/ \b\f\n\r\t","owner":"\u00e9\u4E2D\ud83d\ude00","created":-9223372036854775808,)"
+      R"("modified":9223372036854775807,"docCount":2147483647,"uses":{"entries":[{"state":0,"host":"h","user":"u",)"
+      R"("process":4294967295,"time":)" + now + R"(},{"state":2,"host":"x","time":)" + old + "}]}}",
+      " {\n\t\"n\\u0061me\" : \"caf\xC3\xA9 \xE2\x82\xAC \xF0\x9F\x98\x80\" ,\r\n\"extra\":[1,-0,1.5e3,true,false,null,"
+      "{\"a\":[[]],\"\":{}}],\"docCount\":-2147483648,\"docCount\":3, \"uses\" : {\"other\":1,\"entries\":["
+      "{\"time\":" + now + ",\"host\":\"a\\u0000b\",\"state\":101,\"state\":100,\"user\":\"\",\"process\":0}]}} ",
+      R"({"created":5,"modified":-1,"owner":"","uses":{"entries":[]},"name":"x","unknown":"\u0041","name":"y"})",
+  };
 }
 
 TEST_F(StoredRecordReader, MatchesJanssonOnEveryTruncationAndByte) {
-  TextGen gen(7);
-  for (int r = 0; r < 4 && !HasFatalFailure(); ++r) {
-    const std::string text = gen.validRecord();
+  for (const std::string& text : validRecords()) {
+    ASSERT_TRUE(viaJansson(text).ok) << text;  // a sweep of refusals alone would prove little
     for (std::size_t cut = 0; cut <= text.size(); ++cut) expectSame(text.substr(0, cut));
     // Each byte replaced by a quote, a backslash, a high byte and a NUL.
-    for (std::size_t i = 0; i < text.size(); ++i) {
+    for (std::size_t i = 0; i < text.size() && !HasFatalFailure(); ++i) {
       for (char c : {'"', '\\', '\xFF', '\0'}) {
         std::string t = text;
         t[i] = c;
@@ -402,7 +170,7 @@ TEST_F(StoredRecordReader, RealsAtTheEdgeOfTheDoubleRangeMayBeLeftToJansson) {
                                                    "0000000000000000000000000000000000000000000000000000000000000000"
                                                    "0000000000000000000000000000000000000000000000000000000000000000"
                                                    "0000000000000000000000000000000000000000000000000000.0"}) {
-    expectSame(std::string(R"({"name":"n","x":)") + real + "}", nullptr, true);
+    expectSame(std::string(R"({"name":"n","x":)") + real + "}", true);
   }
 }
 
