@@ -69,29 +69,19 @@ PackInfo fullRecord(const std::string& id) {
   return PackInfo(id, std::string("f\0x", 3), INT32_MAX, p);
 }
 
-TEST(CommandCodec, ConnectAndItsTwoAnswers) {
+TEST(CommandCodec, AnswersWhoseAbsenceMeansSomething) {
   Connect c;
   c.setRequest("Main\\Sub", 0xFFFFFFFFu);
   auto s = toServer(c);
   EXPECT_EQ(s->dbName(), "Main\\Sub");
   EXPECT_EQ(s->openMode(), 0xFFFFFFFFu);
-
-  s->setResp("Database Foo does not exist");
-  toClient(*s, c);
-  EXPECT_TRUE(c.respFailed());
-  EXPECT_EQ(c.respError(), "Database Foo does not exist");
-
   s->setResp();
   toClient(*s, c);
   EXPECT_FALSE(c.respFailed());
-  EXPECT_EQ(c.respError(), "");
-
   s->setResp("");  // a failure with an empty text is still a failure
   toClient(*s, c);
   EXPECT_TRUE(c.respFailed());
-}
 
-TEST(CommandCodec, ConfigurationParts) {
   GetCfgPart g;
   g.setRequest("layout");
   auto gs = toServer(g);
@@ -102,36 +92,52 @@ TEST(CommandCodec, ConfigurationParts) {
   toClient(*gs, g);
   ASSERT_TRUE(g.respCfg().isObject());
   EXPECT_EQ(json::Object(g.respCfg()).size(), 0u);
-  const json::Object obj = json::strToObject(R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})");
-  gs->setResp(obj);
-  toClient(*gs, g);
-  EXPECT_EQ(g.respCfg(), obj);
 
   SetCfgPart set;
-  set.setRequest("layout", obj);
-  auto ss = toServer(set);
-  EXPECT_EQ(ss->key(), "layout");
-  EXPECT_FALSE(ss->deleteData());
-  EXPECT_EQ(ss->jCfgData(), obj);
   set.setDeleteRequest("old");
-  ss = toServer(set);
+  auto ss = toServer(set);
   EXPECT_EQ(ss->key(), "old");
   EXPECT_TRUE(ss->deleteData());
-  EXPECT_EQ(ss->jCfgData().size(), 0u);
 
-  CfgIds ids;
-  ids.setRequest("ab");
-  auto is = toServer(ids);
-  EXPECT_EQ(is->prefix(), "ab");
-  is->setResp({"ab", "", "abc"});
-  toClient(*is, ids);
-  EXPECT_EQ(ids.respList(), (std::vector<std::string>{"ab", "", "abc"}));
+  UpdatePackInfo up;
+  const PackInfo bare("P-2");  // only the id
+  up.setRequest(bare);
+  auto us = toServer(up);
+  EXPECT_EQ(*us->pInf(), bare);
+  EXPECT_FALSE(us->pInf()->folderValid());
+  EXPECT_FALSE(us->pInf()->statusValid());
+  EXPECT_EQ(us->pInf()->name, PackInfoPartial::STR_INVALID);
+  toClient(*us, up);
+  EXPECT_EQ(up.respInfo(), nullptr);
 
-  DBNames names;
-  auto ns = toServer(names);
-  ns->setResp({"root.db", "a\\b"});
-  toClient(*ns, names);
-  EXPECT_EQ(names.respList(), (std::vector<std::string>{"root.db", "a\\b"}));
+  GetPackInfo one;
+  one.setRequest("P-1");
+  toClient(*toServer(one), one);
+  EXPECT_EQ(one.respInfo(), nullptr);
+
+  GetPackInfos list;
+  list.setRequest("2024");
+  toClient(*toServer(list), list);  // no list set: answered as an empty one
+  ASSERT_NE(list.respInfos(), nullptr);
+  EXPECT_TRUE(list.respInfos()->empty());
+
+  GetPack get;
+  get.setRequest(PackInfo("P-1"));
+  auto ps = toServer(get);
+  toClient(*ps, get);
+  EXPECT_EQ(get.respInfo(), nullptr);
+  EXPECT_TRUE(get.respData().empty());
+  ps->setResp(std::make_shared<PackInfo>(fullRecord("P-1")), SharedMemBuffer());
+  toClient(*ps, get);
+  EXPECT_NE(get.respInfo(), nullptr);
+  EXPECT_TRUE(get.respData().empty());
+
+  Backup backup;
+  backup.setRequest("/srv/backups/", true);
+  EXPECT_TRUE(toServer(backup)->streamsProgress());
+  Cleanup cleanup;
+  cleanup.setRequest({"b", "a", "", "a"});
+  EXPECT_EQ(toServer(cleanup)->usedIds(), (std::set<std::string>{"", "a", "b"}));
 }
 
 TEST(CommandCodec, DataFilesTravelWithoutCopies) {
@@ -148,8 +154,6 @@ TEST(CommandCodec, DataFilesTravelWithoutCopies) {
   SetData server;
   wire::Reader in = r.reader();
   server.readRequest(in);
-  EXPECT_EQ(server.id(), "doc-1");
-  EXPECT_EQ(server.fileName(), "page 1.tif");
   ASSERT_EQ(server.data().size(), size);
   EXPECT_EQ(server.data().view(), content.view());
   // The server's data points into the received frame.
@@ -159,8 +163,6 @@ TEST(CommandCodec, DataFilesTravelWithoutCopies) {
   GetData get;
   get.setRequest("doc-1", "page 1.tif");
   auto gs = toServer(get);
-  EXPECT_EQ(gs->id(), "doc-1");
-  EXPECT_EQ(gs->fileName(), "page 1.tif");
   toClient(*gs, get);
   EXPECT_TRUE(get.respData().empty());  // a missing file
   const unsigned char* raw = bytes.data();
@@ -168,116 +170,15 @@ TEST(CommandCodec, DataFilesTravelWithoutCopies) {
   EXPECT_EQ(gs->answerFrame().tail.data(), raw);  // handed over, not copied
   toClient(*gs, get);
   EXPECT_EQ(get.respData().view(), content.view());
-}
 
-TEST(CommandCodec, PackRecordsWithEveryFieldPresentOrAbsent) {
-  UpdatePackInfo up;
-  const PackInfo full = fullRecord("P-1");
-  up.setRequest(full);
-  auto us = toServer(up);
-  EXPECT_EQ(*us->pInf(), full);
-  EXPECT_TRUE(us->pInf()->allValid());
-
-  const PackInfo bare("P-2");  // only the id
-  up.setRequest(bare);
-  us = toServer(up);
-  EXPECT_EQ(*us->pInf(), bare);
-  EXPECT_FALSE(us->pInf()->folderValid());
-  EXPECT_FALSE(us->pInf()->statusValid());
-  EXPECT_EQ(us->pInf()->name, PackInfoPartial::STR_INVALID);
-
-  toClient(*us, up);
-  EXPECT_EQ(up.respInfo(), nullptr);
-  us->setResp(std::make_shared<PackInfo>(full));
-  toClient(*us, up);
-  ASSERT_NE(up.respInfo(), nullptr);
-  EXPECT_EQ(*up.respInfo(), full);
-
-  GetPackInfo one;
-  one.setRequest("P-1");
-  auto os = toServer(one);
-  EXPECT_EQ(os->id(), "P-1");
-  toClient(*os, one);
-  EXPECT_EQ(one.respInfo(), nullptr);
-  os->setResp(std::make_shared<PackInfo>(bare));
-  toClient(*os, one);
-  ASSERT_NE(one.respInfo(), nullptr);
-  EXPECT_EQ(*one.respInfo(), bare);
-
-  GetPackInfos list;
-  list.setRequest("2024");
-  auto ls = toServer(list);
-  EXPECT_EQ(ls->folder(), "2024");
-  toClient(*ls, list);  // no list set: answered as an empty one
-  ASSERT_NE(list.respInfos(), nullptr);
-  EXPECT_TRUE(list.respInfos()->empty());
-  ls->setResp(std::make_shared<Ipc::PackInfos>(Ipc::PackInfos{full, bare, fullRecord("P-3")}));
-  toClient(*ls, list);
-  ASSERT_EQ(list.respInfos()->size(), 3u);
-  EXPECT_EQ((*list.respInfos())[0], full);
-  EXPECT_EQ((*list.respInfos())[1], bare);
-}
-
-TEST(CommandCodec, SaveAndFetchPacks) {
-  const SharedMemBuffer content(MemBuffer::copyOf("pack content"));
   SavePack save;
   save.setRequest(fullRecord("P-1"), content);
   EXPECT_EQ(save.requestFrame().tail.data(), content.data());
-  auto ss = toServer(save);
-  EXPECT_EQ(ss->inf(), fullRecord("P-1"));
-  EXPECT_EQ(ss->packData().view(), "pack content");
-  save.setRequest(PackInfo("P-2"), SharedMemBuffer());
-  ss = toServer(save);
-  EXPECT_TRUE(ss->packData().empty());
-
-  GetPack get;
-  PackInfo request("P-1");
-  request.uses.append(UseInfo(UseInfo::OpenForEdit, "ws-1", "anna", 321));
-  get.setRequest(request);
-  auto gs = toServer(get);
-  EXPECT_EQ(gs->inf(), request);
-  toClient(*gs, get);
-  EXPECT_EQ(get.respInfo(), nullptr);
-  EXPECT_TRUE(get.respData().empty());
-  gs->setResp(std::make_shared<PackInfo>(fullRecord("P-1")), content);
-  EXPECT_EQ(gs->answerFrame().tail.data(), content.data());
-  toClient(*gs, get);
-  ASSERT_NE(get.respInfo(), nullptr);
-  EXPECT_EQ(*get.respInfo(), fullRecord("P-1"));
-  EXPECT_EQ(get.respData().view(), "pack content");
-  gs->setResp(std::make_shared<PackInfo>(fullRecord("P-1")), SharedMemBuffer());
-  toClient(*gs, get);
-  EXPECT_NE(get.respInfo(), nullptr);
-  EXPECT_TRUE(get.respData().empty());
-
-  ChangeDocId change;
-  change.setRequest("old", "new");
-  auto cs = toServer(change);
-  EXPECT_EQ(cs->oldId(), "old");
-  EXPECT_EQ(cs->newId(), "new");
-
-  ErasePack erase;
-  erase.setRequest("P-9");
-  EXPECT_EQ(toServer(erase)->id(), "P-9");
-}
-
-TEST(CommandCodec, MaintenanceRequests) {
-  Backup b;
-  b.setRequest("/srv/backups/", true);
-  auto bs = toServer(b);
-  EXPECT_EQ(bs->pth(), "/srv/backups/");
-  EXPECT_TRUE(bs->all());
-  EXPECT_TRUE(bs->streamsProgress());
-
-  Restore r;
-  r.setRequest("", false);
-  auto rs = toServer(r);
-  EXPECT_EQ(rs->pth(), "");
-  EXPECT_FALSE(rs->all());
-
-  Cleanup c;
-  c.setRequest({"b", "a", ""});
-  EXPECT_EQ(toServer(c)->usedIds(), (std::set<std::string>{"", "a", "b"}));
+  GetPack pack;
+  pack.setRequest(PackInfo("P-1"));
+  auto ps = toServer(pack);
+  ps->setResp(std::make_shared<PackInfo>(fullRecord("P-1")), content);
+  EXPECT_EQ(ps->answerFrame().tail.data(), content.data());
 }
 
 // Requests of every command as a client would send them.
@@ -285,13 +186,13 @@ std::vector<std::shared_ptr<Ipc::CmdI>> sampleRequests() {
   std::vector<std::shared_ptr<Ipc::CmdI>> out;
   out.push_back(std::make_shared<Ipc::PingPong>());
   auto connect = std::make_shared<Connect>();
-  connect->setRequest("db", 1);
+  connect->setRequest("Main\\Sub", 0xFFFFFFFFu);
   out.push_back(connect);
   auto getCfg = std::make_shared<GetCfgPart>();
   getCfg->setRequest("k");
   out.push_back(getCfg);
   auto setCfg = std::make_shared<SetCfgPart>();
-  setCfg->setRequest("k", json::strToObject(R"({"a":[1,2]})"));
+  setCfg->setRequest("k", json::strToObject(R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})"));
   out.push_back(setCfg);
   auto delCfg = std::make_shared<SetCfgPart>();
   delCfg->setDeleteRequest("k");
@@ -333,7 +234,7 @@ std::vector<std::shared_ptr<Ipc::CmdI>> sampleRequests() {
   restore->setRequest("t", false);
   out.push_back(restore);
   auto cleanup = std::make_shared<Cleanup>();
-  cleanup->setRequest({"x", "y"});
+  cleanup->setRequest({"x", "", "y"});
   out.push_back(cleanup);
   out.push_back(std::make_shared<DBNames>());
   return out;
@@ -355,11 +256,16 @@ bool refused(Ipc::CmdI& cmd, const std::string& payload, bool request) {
   }
 }
 
-TEST(CommandCodec, EveryTruncatedOrExtendedRequestIsRefused) {
+std::string payloadOf(const wire::OutFrame& f) { return splitFrame(f.head + std::string(f.tail.view())).payload; }
+
+// Every request and answer read back whole writes the same bytes again, so
+// no field is lost, swapped or altered on the way; cut short or extended by
+// a byte, it is refused.
+TEST(CommandCodec, EveryRequestRoundTripsAndEveryTruncatedOrExtendedOneIsRefused) {
   std::set<std::uint8_t> covered;
   for (const auto& sample : sampleRequests()) {
     covered.insert(sample->tag());
-    const std::string payload = splitFrame(sample->requestFrame().head + std::string(sample->requestFrame().tail.view())).payload;
+    const std::string payload = payloadOf(sample->requestFrame());
     auto fresh = makeCommand(sample->tag(), nullptr);
     ASSERT_NE(fresh, nullptr);
     for (std::size_t cut = 0; cut < payload.size(); ++cut) {
@@ -367,18 +273,19 @@ TEST(CommandCodec, EveryTruncatedOrExtendedRequestIsRefused) {
     }
     EXPECT_TRUE(refused(*fresh, payload + '\0', true)) << sample->name() << " with a trailing byte";
     EXPECT_FALSE(refused(*fresh, payload, true)) << sample->name();
+    EXPECT_EQ(payloadOf(fresh->requestFrame()), payload) << sample->name();
   }
   EXPECT_EQ(covered.size(), kCommandTable.size());
 }
 
-TEST(CommandCodec, EveryTruncatedAnswerIsRefused) {
+TEST(CommandCodec, EveryAnswerRoundTripsAndEveryTruncatedOrExtendedOneIsRefused) {
   // Answers with content in every field.
   auto connect = std::make_shared<Connect>();
   connect->setResp("no");
   auto getCfg = std::make_shared<GetCfgPart>();
-  getCfg->setResp(json::strToObject(R"({"a":1})"));
+  getCfg->setResp(json::strToObject(R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})"));
   auto ids = std::make_shared<CfgIds>();
-  ids->setResp({"a", "bc"});
+  ids->setResp({"ab", "", "abc"});
   auto getData = std::make_shared<GetData>();
   getData->setResp(MemBuffer::copyOf("data"));
   auto infos = std::make_shared<GetPackInfos>();
@@ -388,17 +295,17 @@ TEST(CommandCodec, EveryTruncatedAnswerIsRefused) {
   auto getPack = std::make_shared<GetPack>();
   getPack->setResp(std::make_shared<PackInfo>(fullRecord("a")), SharedMemBuffer(MemBuffer::copyOf("c")));
   auto names = std::make_shared<DBNames>();
-  names->setResp({"x"});
+  names->setResp({"root.db", "a\\b"});
   for (const std::shared_ptr<Ipc::CmdI>& answer :
        std::vector<std::shared_ptr<Ipc::CmdI>>{connect, getCfg, ids, getData, infos, info, getPack, names}) {
-    const wire::OutFrame f = answer->answerFrame();
-    const std::string payload = splitFrame(f.head + std::string(f.tail.view())).payload;
+    const std::string payload = payloadOf(answer->answerFrame());
     auto fresh = makeCommand(answer->tag(), nullptr);
     for (std::size_t cut = 0; cut < payload.size(); ++cut) {
       EXPECT_TRUE(refused(*fresh, payload.substr(0, cut), false)) << answer->name() << " cut at " << cut;
     }
     EXPECT_TRUE(refused(*fresh, payload + '\x01', false)) << answer->name();
     EXPECT_FALSE(refused(*fresh, payload, false)) << answer->name();
+    EXPECT_EQ(payloadOf(fresh->answerFrame()), payload) << answer->name();
   }
 }
 
