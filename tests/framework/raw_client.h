@@ -50,7 +50,6 @@ class RawClient {
   bool ping(std::chrono::milliseconds timeout = std::chrono::seconds(10));
   // Closes the socket now; with reset, the peer sees a connection reset.
   void close(bool reset = false);
-  int fd() const { return fd_; }
 
  private:
   RawClient() = default;

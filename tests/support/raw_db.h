@@ -55,7 +55,6 @@ class RawDb {
     return out;
   }
   std::int64_t number(const std::string& sql) const { return std::stoll(value(sql).value_or("-1")); }
-  int changes() const { return sqlite3_changes(db_); }
 
   // The lines of EXPLAIN QUERY PLAN, joined by "; ".
   std::string plan(const std::string& sql) const {

@@ -120,14 +120,7 @@ ServerProcess::ServerProcess(std::filesystem::path binary, ServerOptions options
   std::vector<std::string> args{"--home", home_.string(), "--log-dir", logDir_.string(), "--console"};
   args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
 
-  Pipe out;
-  pid_ = spawn(binary, args, options.env, out.write);
-  ::close(out.write);
-  out.write = -1;
-  const int readFd = out.read;
-  out.read = -1;
-  reader_ = std::thread([this, readFd] { readOutput(readFd); });
-
+  start(binary, args, options.env);
   if (!options.waitUntilListening) return;
   static const std::regex listening("Listening on port ([0-9]+)");
   std::unique_lock lock(mutex_);
@@ -146,15 +139,27 @@ ServerProcess::ServerProcess(std::filesystem::path binary, ServerOptions options
   throwStartFailure(found ? "the server ended before it listened" : "the server did not listen in time");
 }
 
+void ServerProcess::start(const std::filesystem::path& binary, const std::vector<std::string>& args,
+                          const std::vector<std::string>& env) {
+  Pipe out;
+  pid_ = spawn(binary, args, env, out.write);
+  ::close(out.write);
+  out.write = -1;
+  const int readFd = out.read;
+  out.read = -1;
+  reader_ = std::thread([this, readFd] { readOutput(readFd); });
+}
+
 void ServerProcess::throwStartFailure(const std::string& why) {
   stop(SIGKILL);
+  if (reader_.joinable()) reader_.join();  // a joinable thread left to a throwing constructor ends the process
   std::string text = why + "; its output:\n";
   for (const auto& l : lines()) text += l + "\n";
   throw std::runtime_error(text);
 }
 
 ServerProcess::~ServerProcess() {
-  if (!status_) {
+  if (!status_ && pid_ > 0) {  // never a signal to pid -1: that is every process we may signal
     const int status = stop();
     EXPECT_EQ(status, 0) << "the server did not stop cleanly";
   }
@@ -230,34 +235,11 @@ int ServerProcess::wait(std::chrono::milliseconds timeout) {
 
 ServerProcess::Result ServerProcess::run(const std::filesystem::path& binary, const std::vector<std::string>& args,
                                          std::chrono::milliseconds timeout) {
-  Pipe out;
-  const pid_t pid = spawn(binary, args, {}, out.write);
-  ::close(out.write);
-  out.write = -1;
+  ServerProcess process(Bare{});
+  process.start(binary, args, {});
   Result result;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  char buf[4096];
-  for (;;) {
-    const auto left =
-        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
-    if (left <= 0) break;
-    pollfd p{out.read, POLLIN, 0};
-    if (::poll(&p, 1, static_cast<int>(left)) <= 0) continue;
-    const ssize_t n = ::read(out.read, buf, sizeof buf);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) break;
-    result.output.append(buf, static_cast<std::size_t>(n));
-  }
-  auto status = waitFor(pid, std::chrono::milliseconds(std::max<long>(
-                                 0, std::chrono::duration_cast<std::chrono::milliseconds>(
-                                        deadline - std::chrono::steady_clock::now())
-                                        .count())));
-  if (!status) {
-    ::kill(pid, SIGKILL);
-    waitFor(pid, std::chrono::seconds(10));
-    status = -1;
-  }
-  result.status = *status;
+  result.status = process.wait(timeout);
+  for (const auto& line : process.lines()) result.output += line + "\n";
   return result;
 }
 

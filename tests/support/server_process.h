@@ -50,7 +50,6 @@ class ServerProcess {
   ServerProcess& operator=(const ServerProcess&) = delete;
 
   std::uint16_t port() const noexcept { return port_; }
-  pid_t pid() const noexcept { return pid_; }
   const std::filesystem::path& home() const noexcept { return home_; }
   const std::filesystem::path& logDir() const noexcept { return logDir_; }
 
@@ -69,7 +68,7 @@ class ServerProcess {
   int wait(std::chrono::milliseconds timeout = std::chrono::seconds(20));
 
   // Runs the binary with the arguments to completion; its exit status and
-  // everything it wrote.
+  // every line it wrote, each ending in "\n".
   struct Result {
     int status = -1;
     std::string output;
@@ -78,6 +77,11 @@ class ServerProcess {
                     std::chrono::milliseconds timeout = std::chrono::seconds(20));
 
  private:
+  struct Bare {};
+  // Nothing started yet; run() starts the binary with its own arguments.
+  explicit ServerProcess(Bare) : home_(dir_ / "home"), logDir_(dir_ / "log") {}
+  void start(const std::filesystem::path& binary, const std::vector<std::string>& args,
+             const std::vector<std::string>& env);
   void readOutput(int fd);
   void throwStartFailure(const std::string& why);
 
