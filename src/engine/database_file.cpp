@@ -12,26 +12,12 @@
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
 #include "framework/log.h"
+#include "framework/unique_fd.h"
 
 namespace engine {
 namespace {
 
 namespace fs = std::filesystem;
-
-// A file descriptor closed at scope exit.
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 [[noreturn]] void throwErrno(int error, const std::source_location& where) {
   DB::throwEngineError(engineCodeOfErrno(error), where);
@@ -158,13 +144,13 @@ std::optional<FileHeader> readHeader(const fs::path& file) {
 }
 
 void syncFile(const fs::path& file, const std::source_location& where) {
-  const Fd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
+  const UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
   if (fd.get() < 0) throwErrno(errno, where);
   if (::fsync(fd.get()) != 0) throwErrno(errno, where);
 }
 
 void syncFolder(const fs::path& folder, const std::source_location& where) {
-  const Fd fd(::open(folder.empty() ? "." : folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const UniqueFd fd(::open(folder.empty() ? "." : folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (fd.get() < 0) throwErrno(errno, where);
   if (::fsync(fd.get()) != 0) throwErrno(errno, where);
 }

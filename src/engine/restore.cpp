@@ -15,6 +15,7 @@
 #include "engine/engine_errors.h"
 #include "engine/instance.h"
 #include "framework/log.h"
+#include "framework/unique_fd.h"
 
 namespace engine {
 namespace {
@@ -22,22 +23,6 @@ namespace {
 namespace fs = std::filesystem;
 
 constexpr std::size_t kCopyChunk = 4 * 1024 * 1024;
-
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-  // Closes now, so that a failure of the close is seen.
-  int close() { return ::close(std::exchange(fd_, -1)); }
-
- private:
-  int fd_;
-};
 
 // The copy in the destination folder, removed unless it was put in place.
 class StagedFile {
@@ -111,9 +96,9 @@ void checkHeader(const fs::path& backupFolder, const fs::path& file, const std::
 
 void copyFile(const fs::path& from, const fs::path& to, std::uint32_t pageSize, const StatusCallback& status,
               const std::source_location& where) {
-  Fd in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
+  UniqueFd in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
   if (in.get() < 0) throwErrno(errno, where);
-  Fd out(::open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
+  UniqueFd out(::open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
   if (out.get() < 0) throwErrno(errno, where);
   std::error_code ec;
   const auto size = fs::file_size(from, ec);

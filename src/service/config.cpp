@@ -12,6 +12,7 @@
 #include "framework/json.h"
 #include "framework/log.h"
 #include "framework/platform.h"
+#include "framework/unique_fd.h"
 #include "service/names.h"
 #include "service/network_path.h"
 
@@ -26,25 +27,11 @@ constexpr std::size_t kPrefixLength = 3;
 // on the hot path, hence an atomic pointer rather than a lock.
 std::atomic<const DBConfig*> g_override{nullptr};
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) noexcept : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const noexcept { return fd_; }
-
- private:
-  int fd_;
-};
-
 // Reads the whole configuration file. False when it is missing or cannot be
 // read (a folder of that name included): the settings then keep their
 // defaults without a message, as an absent file does.
 bool readConfigFile(const std::string& path, std::string& text) {
-  const FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  const UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
   if (fd.get() < 0) return false;
   struct stat st {};
   if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) return false;

@@ -17,6 +17,7 @@
 
 #include "engine/db_exc.h"
 #include "framework/log.h"
+#include "framework/unique_fd.h"
 #include "service/names.h"
 #include "store/db_local.h"
 #include "store/file_ops.h"
@@ -76,27 +77,8 @@ void checkFileName(const std::string& file) {
   throw std::system_error(error, std::generic_category(), what);
 }
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd = -1) noexcept : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-
-  int get() const noexcept { return fd_; }
-  bool valid() const noexcept { return fd_ >= 0; }
-  // Closes now and reports the result (close can report a late write
-  // error on some file systems).
-  int close() noexcept { return ::close(std::exchange(fd_, -1)); }
-
- private:
-  int fd_;
-};
-
 void syncFolder(const std::string& folder) {
-  FileDescriptor dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!dir.valid() || FileOps::current().fsync(dir.get()) != 0) failWith(errno, "flush folder \"" + folder + '"');
 }
 
@@ -171,12 +153,12 @@ class DurableWrite {
  private:
   std::string folder_;
   std::string temp_;
-  FileDescriptor file_;
+  UniqueFd file_;
   bool renamed_ = false;
 };
 
 void copyFile(const fs::path& from, const std::string& toFolder, const std::string& name) {
-  FileDescriptor in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
+  UniqueFd in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
   if (!in.valid()) failWith(errno, "open \"" + from.string() + '"');
   DurableWrite out(toFolder);
   const auto buffer = std::make_unique<char[]>(kCopyChunkBytes);
@@ -214,7 +196,7 @@ MemBuffer DBLocal::loadDataBlob(const std::string& id, const std::string& file) 
   checkComponent("Data id", id);
   checkFileName(file);
   const std::string path = dataDir(id) + file;
-  FileDescriptor in(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  UniqueFd in(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
   struct stat info {};
   if (!in.valid() || ::fstat(in.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
     if (g_LogVerbose) {
