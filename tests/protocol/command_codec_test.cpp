@@ -181,63 +181,40 @@ TEST(CommandCodec, DataFilesTravelWithoutCopies) {
   EXPECT_EQ(ps->answerFrame().tail.data(), content.data());
 }
 
+// A command of class C, set up by the function.
+template <class C, class F>
+std::shared_ptr<Ipc::CmdI> made(F setUp) {
+  auto c = std::make_shared<C>();
+  setUp(*c);
+  return c;
+}
+
+const char* const kCfgText = R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})";
+
 // Requests of every command as a client would send them.
 std::vector<std::shared_ptr<Ipc::CmdI>> sampleRequests() {
-  std::vector<std::shared_ptr<Ipc::CmdI>> out;
-  out.push_back(std::make_shared<Ipc::PingPong>());
-  auto connect = std::make_shared<Connect>();
-  connect->setRequest("Main\\Sub", 0xFFFFFFFFu);
-  out.push_back(connect);
-  auto getCfg = std::make_shared<GetCfgPart>();
-  getCfg->setRequest("k");
-  out.push_back(getCfg);
-  auto setCfg = std::make_shared<SetCfgPart>();
-  setCfg->setRequest("k", json::strToObject(R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})"));
-  out.push_back(setCfg);
-  auto delCfg = std::make_shared<SetCfgPart>();
-  delCfg->setDeleteRequest("k");
-  out.push_back(delCfg);
-  auto ids = std::make_shared<CfgIds>();
-  ids->setRequest("p");
-  out.push_back(ids);
-  auto getData = std::make_shared<GetData>();
-  getData->setRequest("i", "f");
-  out.push_back(getData);
-  auto setData = std::make_shared<SetData>();
-  setData->setRequest("i", "f", SharedMemBuffer(MemBuffer::copyOf("abc")));
-  out.push_back(setData);
-  auto infos = std::make_shared<GetPackInfos>();
-  infos->setRequest("f");
-  out.push_back(infos);
-  auto info = std::make_shared<GetPackInfo>();
-  info->setRequest("p");
-  out.push_back(info);
-  auto update = std::make_shared<UpdatePackInfo>();
-  update->setRequest(fullRecord("p"));
-  out.push_back(update);
-  auto save = std::make_shared<SavePack>();
-  save->setRequest(fullRecord("p"), SharedMemBuffer(MemBuffer::copyOf("xy")));
-  out.push_back(save);
-  auto change = std::make_shared<ChangeDocId>();
-  change->setRequest("a", "b");
-  out.push_back(change);
-  auto getPack = std::make_shared<GetPack>();
-  getPack->setRequest(fullRecord("p"));
-  out.push_back(getPack);
-  auto erase = std::make_shared<ErasePack>();
-  erase->setRequest("p");
-  out.push_back(erase);
-  auto backup = std::make_shared<Backup>();
-  backup->setRequest("t", true);
-  out.push_back(backup);
-  auto restore = std::make_shared<Restore>();
-  restore->setRequest("t", false);
-  out.push_back(restore);
-  auto cleanup = std::make_shared<Cleanup>();
-  cleanup->setRequest({"x", "", "y"});
-  out.push_back(cleanup);
-  out.push_back(std::make_shared<DBNames>());
-  return out;
+  const auto none = [](auto&) {};
+  return {
+      made<Ipc::PingPong>(none),
+      made<Connect>([](Connect& c) { c.setRequest("Main\\Sub", 0xFFFFFFFFu); }),
+      made<GetCfgPart>([](GetCfgPart& c) { c.setRequest("k"); }),
+      made<SetCfgPart>([](SetCfgPart& c) { c.setRequest("k", json::strToObject(kCfgText)); }),
+      made<SetCfgPart>([](SetCfgPart& c) { c.setDeleteRequest("k"); }),
+      made<CfgIds>([](CfgIds& c) { c.setRequest("p"); }),
+      made<GetData>([](GetData& c) { c.setRequest("i", "f"); }),
+      made<SetData>([](SetData& c) { c.setRequest("i", "f", SharedMemBuffer(MemBuffer::copyOf("abc"))); }),
+      made<GetPackInfos>([](GetPackInfos& c) { c.setRequest("f"); }),
+      made<GetPackInfo>([](GetPackInfo& c) { c.setRequest("p"); }),
+      made<UpdatePackInfo>([](UpdatePackInfo& c) { c.setRequest(fullRecord("p")); }),
+      made<SavePack>([](SavePack& c) { c.setRequest(fullRecord("p"), SharedMemBuffer(MemBuffer::copyOf("xy"))); }),
+      made<ChangeDocId>([](ChangeDocId& c) { c.setRequest("a", "b"); }),
+      made<GetPack>([](GetPack& c) { c.setRequest(fullRecord("p")); }),
+      made<ErasePack>([](ErasePack& c) { c.setRequest("p"); }),
+      made<Backup>([](Backup& c) { c.setRequest("t", true); }),
+      made<Restore>([](Restore& c) { c.setRequest("t", false); }),
+      made<Cleanup>([](Cleanup& c) { c.setRequest({"x", "", "y"}); }),
+      made<DBNames>(none),
+  };
 }
 
 bool refused(Ipc::CmdI& cmd, const std::string& payload, bool request) {
@@ -280,24 +257,18 @@ TEST(CommandCodec, EveryRequestRoundTripsAndEveryTruncatedOrExtendedOneIsRefused
 
 TEST(CommandCodec, EveryAnswerRoundTripsAndEveryTruncatedOrExtendedOneIsRefused) {
   // Answers with content in every field.
-  auto connect = std::make_shared<Connect>();
-  connect->setResp("no");
-  auto getCfg = std::make_shared<GetCfgPart>();
-  getCfg->setResp(json::strToObject(R"({"a": [1, "x\u0000y", {"b": null}], "c": 1.5})"));
-  auto ids = std::make_shared<CfgIds>();
-  ids->setResp({"ab", "", "abc"});
-  auto getData = std::make_shared<GetData>();
-  getData->setResp(MemBuffer::copyOf("data"));
-  auto infos = std::make_shared<GetPackInfos>();
-  infos->setResp(std::make_shared<Ipc::PackInfos>(Ipc::PackInfos{fullRecord("a"), PackInfo("b")}));
-  auto info = std::make_shared<GetPackInfo>();
-  info->setResp(std::make_shared<PackInfo>(fullRecord("a")));
-  auto getPack = std::make_shared<GetPack>();
-  getPack->setResp(std::make_shared<PackInfo>(fullRecord("a")), SharedMemBuffer(MemBuffer::copyOf("c")));
-  auto names = std::make_shared<DBNames>();
-  names->setResp({"root.db", "a\\b"});
-  for (const std::shared_ptr<Ipc::CmdI>& answer :
-       std::vector<std::shared_ptr<Ipc::CmdI>>{connect, getCfg, ids, getData, infos, info, getPack, names}) {
+  const auto info = [] { return std::make_shared<PackInfo>(fullRecord("a")); };
+  for (const std::shared_ptr<Ipc::CmdI>& answer : std::vector<std::shared_ptr<Ipc::CmdI>>{
+           made<Connect>([](Connect& c) { c.setResp("no"); }),
+           made<GetCfgPart>([](GetCfgPart& c) { c.setResp(json::strToObject(kCfgText)); }),
+           made<CfgIds>([](CfgIds& c) { c.setResp({"ab", "", "abc"}); }),
+           made<GetData>([](GetData& c) { c.setResp(MemBuffer::copyOf("data")); }),
+           made<GetPackInfos>([](GetPackInfos& c) {
+             c.setResp(std::make_shared<Ipc::PackInfos>(Ipc::PackInfos{fullRecord("a"), PackInfo("b")}));
+           }),
+           made<GetPackInfo>([&](GetPackInfo& c) { c.setResp(info()); }),
+           made<GetPack>([&](GetPack& c) { c.setResp(info(), SharedMemBuffer(MemBuffer::copyOf("c"))); }),
+           made<DBNames>([](DBNames& c) { c.setResp({"root.db", "a\\b"}); })}) {
     const std::string payload = payloadOf(answer->answerFrame());
     auto fresh = makeCommand(answer->tag(), nullptr);
     for (std::size_t cut = 0; cut < payload.size(); ++cut) {
