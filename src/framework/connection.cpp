@@ -400,9 +400,7 @@ void Connection::startWrite() {
       return;
     }
     if (ec) {
-      // The peer is gone; what was queued for it goes with it.
-      peerDone_ = true;
-      finish();
+      peerGone();
       return;
     }
     consumeWritten(n);
@@ -411,6 +409,12 @@ void Connection::startWrite() {
       return;
     }
   }
+}
+
+// A write failed: the peer is gone, and what was queued for it goes with it.
+void Connection::peerGone() {
+  peerDone_ = true;
+  finish();
 }
 
 // Fills gather_ with the unwritten part of the queue; returns the count.
@@ -469,9 +473,7 @@ void Connection::onWrite(const boost::system::error_code& ec, std::size_t n) {
     return;
   }
   if (ec) {
-    // The peer is gone; what was queued for it goes with it.
-    peerDone_ = true;
-    finish();
+    peerGone();
     return;
   }
   consumeWritten(n);

@@ -101,6 +101,7 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void goOn();
   void startRead();
   void onRead(const boost::system::error_code& ec, std::size_t n);
+  void peerGone();
   void parse();
   void handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size);
   void runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);

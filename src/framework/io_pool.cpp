@@ -105,6 +105,18 @@ struct IoPool::State {
       // A report that fails has nowhere else to go.
     }
   }
+
+  // Reports the exception being handled, one that escaped a handler (the
+  // thread goes on).
+  void tellEscaped() const noexcept {
+    try {
+      throw;
+    } catch (const std::exception& e) {
+      tell(std::string("Unexpected failure in an I/O thread: ") + e.what());
+    } catch (...) {
+      tell("Unexpected failure in an I/O thread");
+    }
+  }
 };
 
 namespace {
@@ -229,11 +241,8 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
       }
       if (io->run_one_for(s->options.spareIdle) > 0) continue;
       if (io->stopped()) return;
-    } catch (const std::exception& e) {
-      s->tell(std::string("Unexpected failure in an I/O thread: ") + e.what());
-      continue;
     } catch (...) {
-      s->tell("Unexpected failure in an I/O thread");
+      s->tellEscaped();
       continue;
     }
     // A spare that ran nothing for spareIdle ends, unless that would leave
@@ -253,10 +262,8 @@ bool IoPool::drain(State& s, boost::asio::io_context& io) {
     try {
       io.poll();
       return !io.stopped();
-    } catch (const std::exception& e) {
-      s.tell(std::string("Unexpected failure in an I/O thread: ") + e.what());
     } catch (...) {
-      s.tell("Unexpected failure in an I/O thread");
+      s.tellEscaped();
     }
   }
 }
