@@ -131,6 +131,19 @@ std::unique_ptr<engine::Session> DBInstances::beginSession(InstanceRec& record) 
   return session;
 }
 
+// Returns a session on the database's open instance, waiting while another
+// caller opens it; null when the database has no record. Under the lock.
+std::unique_ptr<engine::Session> DBInstances::sessionOnOpen(std::unique_lock<std::mutex>& lock,
+                                                            const std::string& dbKey) {
+  for (;;) {
+    if (stopped_) throwEngineError(err::kTermInProgress);
+    const auto found = records_.find(dbKey);
+    if (found == records_.end()) return nullptr;
+    if (!found->second.opening) return beginSession(found->second);
+    opened_.wait(lock);
+  }
+}
+
 std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKey,
                                                          const OnNewInstance& onNewInstance) {
   if (g_LogVerbose) {
@@ -138,16 +151,14 @@ std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKe
   }
   std::size_t records = 0;
   {
-    std::lock_guard lock(poolMutex());
-    if (stopped_) throwEngineError(err::kTermInProgress);
-    if (const auto found = records_.find(dbKey); found != records_.end()) return beginSession(found->second);
+    std::unique_lock lock(poolMutex());
+    if (auto session = sessionOnOpen(lock, dbKey)) return session;
     records = records_.size();
   }
   if ((DBConfig::inst().MaxActiveDBs * 2) / 3 <= records) closeDormantInstances();
 
-  std::lock_guard lock(poolMutex());
-  if (stopped_) throwEngineError(err::kTermInProgress);
-  if (const auto found = records_.find(dbKey); found != records_.end()) return beginSession(found->second);
+  std::unique_lock lock(poolMutex());
+  if (auto session = sessionOnOpen(lock, dbKey)) return session;
 
   auto instance = createInstance(dbKey);
   try {
@@ -158,28 +169,50 @@ std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKe
   }
   auto& record = records_[dbKey];
   record.instance = instance;
+  record.opening = true;
   std::unique_ptr<engine::Session> session;
   try {
     session = beginSession(record);
-    onNewInstance(*session);
   } catch (...) {
-    // No session stays counted and no half-opened instance stays behind;
-    // a creation failure has dropped the record already (discardInstance).
-    session.reset();
-    const auto found = records_.find(dbKey);
-    if (found != records_.end() && found->second.instance == instance) {
-      closeInstance(found->second);
-      records_.erase(found);
-    }
-    instance->term();
+    closeInstance(record);
+    records_.erase(dbKey);
+    opened_.notify_all();
     throw;
   }
-  const auto found = records_.find(dbKey);
-  if (found == records_.end() || found->second.instance != instance) {
-    // onNewInstance discarded the instance without reporting a failure.
-    throwEngineError(err::kDatabaseNotFound);
+  // The file work (attaching, which may replay a large write-ahead log, or
+  // creating with its syncs) runs without the lock, so that sessions of
+  // other databases, their ends and the maintenance holds are not held up
+  // by it. Callers for the same database wait for it on opened_.
+  lock.unlock();
+  std::exception_ptr failure;
+  try {
+    onNewInstance(*session);
+  } catch (...) {
+    failure = std::current_exception();
   }
-  return session;
+  lock.lock();
+  const auto found = records_.find(dbKey);
+  const bool ours = found != records_.end() && found->second.instance == instance;
+  if (ours && !failure) {
+    found->second.opening = false;
+    opened_.notify_all();
+    return session;
+  }
+  // No session stays counted and no half-opened instance stays behind: the
+  // record goes before the waiters look again. A creation failure has
+  // dropped it already (discardInstance), and so has a stop of the pool.
+  if (ours) {
+    closeInstance(found->second);
+    records_.erase(found);
+  }
+  opened_.notify_all();
+  const bool stopped = stopped_;
+  lock.unlock();
+  session.reset();
+  instance->term();
+  if (failure) std::rethrow_exception(failure);
+  // onNewInstance discarded the instance without reporting a failure.
+  throwEngineError(stopped ? err::kTermInProgress : err::kDatabaseNotFound);
 }
 
 void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept {
@@ -235,6 +268,7 @@ void DBInstances::closeDormantInstances() noexcept {
 
 void DBInstances::discardInstance(const std::string& dbKey, engine::Session& session) noexcept {
   session.detachAll();
+  std::lock_guard lock(poolMutex());
   const auto found = records_.find(dbKey);
   if (found == records_.end() || found->second.instance != session.instance()) return;
   closeInstance(found->second);
@@ -249,7 +283,8 @@ std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& 
   }
   const auto found = records_.find(dbKey);
   if (found == records_.end()) throw DBExc("No instance exist for " + dbKey);
-  if (set && found->second.maintenance) return nullptr;
+  // A database being opened is held up like one under another hold.
+  if (set && (found->second.maintenance || found->second.opening)) return nullptr;
   found->second.maintenance = set;
   return found->second.instance;
 }
@@ -303,6 +338,7 @@ void DBInstances::stopEngine(bool log) noexcept {
   records_.clear();
   stopped_ = true;
   stopSignal_.notify_all();
+  opened_.notify_all();
 }
 
 std::optional<DBInstances::RecordView> DBInstances::record(const std::string& dbKey) const {

@@ -28,8 +28,11 @@
 // owned by their callers and handed back through endSession.
 // Thread safety: one mutex, the pool mutex, guards the singleton pointer and
 // every record; it is held while instances are created, initialised and
-// terminated, while sessions begin and end, and while onNewInstance runs
-// (which therefore must not call the pool, discardInstance excepted).
+// terminated and while sessions begin and end. onNewInstance runs without
+// it (attaching a database may replay a large write-ahead log): the record
+// is marked as opening meanwhile, and other callers for the same database
+// wait until it is open (or gone), while other databases are served.
+// onNewInstance must not call the pool, discardInstance excepted.
 // Failures: DB::DBExc (engine codes, or the texts documented per member).
 
 #include <condition_variable>
@@ -37,6 +40,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -52,8 +56,8 @@ class DBInstances {
   struct Token {};
 
  public:
-  // Runs with the first session of a newly created instance, under the pool
-  // mutex.
+  // Runs with the first session of a newly created instance, without the
+  // pool mutex; nobody else gets a session on that database meanwhile.
   using OnNewInstance = std::function<void(engine::Session&)>;
 
   // A view of one record, for diagnostics and tests.
@@ -99,8 +103,7 @@ class DBInstances {
 
   // For a database creation that failed inside onNewInstance: detaches and
   // closes the session's database, uncounts the session and terminates and
-  // forgets the instance. Takes no mutex: it runs while newSession holds it
-  // on the same thread. The session object itself is destroyed by
+  // forgets the instance. The session object itself is destroyed by
   // newSession's caller path as the failure passes on.
   void discardInstance(const std::string& dbKey, engine::Session& session) noexcept;
 
@@ -114,12 +117,14 @@ class DBInstances {
     std::shared_ptr<engine::Instance> instance;  // null once terminated
     std::uint64_t sessions = 0;
     bool maintenance = false;
+    bool opening = false;  // onNewInstance runs for it
   };
 
   std::shared_ptr<engine::Instance> createInstance(const std::string& dbKey);
   void closeInstance(InstanceRec& record) noexcept;
   void closeDormantInstances() noexcept;
   std::unique_ptr<engine::Session> beginSession(InstanceRec& record);
+  std::unique_ptr<engine::Session> sessionOnOpen(std::unique_lock<std::mutex>& lock, const std::string& dbKey);
   // Both return null when the hold cannot be taken now (busy).
   std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set);
   std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set);
@@ -131,6 +136,7 @@ class DBInstances {
   std::unordered_map<std::string, InstanceRec> records_;  // guarded by the pool mutex
   bool stopped_ = false;                                   // guarded by the pool mutex
   std::condition_variable stopSignal_;                     // with the pool mutex
+  std::condition_variable opened_;                         // with the pool mutex: an opening ended
 };
 
 }  // namespace DB

@@ -55,7 +55,7 @@ Connection::Connection(std::shared_ptr<ServerCore> core, StrandSocket socket)
       stallTimer_(socket_.get_executor()),
       closeTimer_(socket_.get_executor()),
       peer_(describePeer(socket_)),
-      stage_(std::make_unique<unsigned char[]>(kStageSize)) {
+      stage_(std::make_shared<unsigned char[]>(kStageSize)) {
   // Writes are tried at once, which must never block the thread.
   boost::system::error_code ec;
   socket_.non_blocking(true, ec);
@@ -63,6 +63,15 @@ Connection::Connection(std::shared_ptr<ServerCore> core, StrandSocket socket)
 }
 
 Connection::~Connection() {
+  // The slot may hold a database session, whose release can wait for a lock
+  // of the engine (its pool's, held while another database opens, which
+  // may replay a large log). On an I/O thread that wait counts as busy, as
+  // a command's would, so that the other connections get a thread of their
+  // own meanwhile.
+  if (connInf() && core_->threads.runningInThisThread()) {
+    const IoPool::Busy busy(core_->threads);
+    connInf().reset();
+  }
   // Normally finish() has done this; a connection that never got that far
   // must not keep the server waiting for it.
   core_->remove(this);
@@ -165,38 +174,39 @@ void Connection::startRead() {
   if (reading_ || peerDone_ || !mayTakeRequest()) return;
   reading_ = true;
   readSince_ = Clock::now();
-  auto self = shared_from_this();
   if (inBody_) {
-    if (bodyGot_ == body_.size()) {
+    if (bodyGot_ == body_->size()) {
       // The frame's bytes go into a buffer that grows with what has arrived,
       // so that a length field alone never reserves the announced size.
-      const std::uint64_t capacity = std::min<std::uint64_t>(bodyLen_, body_.size() * 2);
-      MemBuffer bigger(capacity);
-      std::memcpy(bigger.data(), body_.data(), static_cast<std::size_t>(bodyGot_));
+      const std::uint64_t capacity = std::min<std::uint64_t>(bodyLen_, body_->size() * 2);
+      auto bigger = std::make_shared<MemBuffer>(capacity);
+      std::memcpy(bigger->data(), body_->data(), static_cast<std::size_t>(bodyGot_));
       body_ = std::move(bigger);
     }
-    socket_.async_read_some(
-        asio::buffer(body_.data() + bodyGot_, static_cast<std::size_t>(body_.size() - bodyGot_)),
-        [self](const boost::system::error_code& ec, std::size_t n) { self->onRead(ec, n); });
+    readInto(body_, body_->data() + bodyGot_, static_cast<std::size_t>(body_->size() - bodyGot_));
   } else {
     if (stageBegin_ > 0) {
       std::memmove(stage_.get(), stage_.get() + stageBegin_, stageEnd_ - stageBegin_);
       stageEnd_ -= stageBegin_;
       stageBegin_ = 0;
     }
-    socket_.async_read_some(asio::buffer(stage_.get() + stageEnd_, kStageSize - stageEnd_),
-                            [self](const boost::system::error_code& ec, std::size_t n) { self->onRead(ec, n); });
+    readInto(stage_, stage_.get() + stageEnd_, kStageSize - stageEnd_);
   }
   if (partialFrame()) armStallTimer();
 }
 
+void Connection::readInto(std::shared_ptr<const void> owner, unsigned char* data, std::size_t size) {
+  socket_.async_read_some(asio::buffer(data, size), [self = shared_from_this(), owner = std::move(owner)](
+                                                        const boost::system::error_code& ec, std::size_t n) {
+    // owner kept the bytes alive until here, whatever has become of the
+    // connection's own share meanwhile.
+    self->onRead(ec, n);
+  });
+}
+
 void Connection::onRead(const boost::system::error_code& ec, std::size_t n) {
   reading_ = false;
-  if (finished_) {
-    body_ = MemBuffer();
-    stage_.reset();
-    return;
-  }
+  if (finished_) return;
   if (closing_) {
     // Draining after a Bye: what the peer still sends is dropped.
     if (ec) {
@@ -234,8 +244,8 @@ void Connection::parse() {
       if (bodyGot_ < bodyLen_) return;
       inBody_ = false;
       const std::uint32_t size = bodyLen_;
-      auto owner = SharedMemBuffer(std::move(body_)).owner();
-      body_ = MemBuffer();
+      auto owner = SharedMemBuffer(std::move(*body_)).owner();
+      body_.reset();
       handleFrame(std::move(owner), size);
       continue;
     }
@@ -261,8 +271,8 @@ void Connection::parse() {
     if (wire::kLengthSize + length <= kStageSize) return;  // the rest fits in the stage
     // A large frame: what has arrived moves into a buffer of its own, and the
     // rest is read straight into it.
-    body_ = MemBuffer(std::min<std::uint64_t>(length, std::max<std::uint64_t>(kFirstBodyChunk, got)));
-    std::memcpy(body_.data(), start, got);
+    body_ = std::make_shared<MemBuffer>(std::min<std::uint64_t>(length, std::max<std::uint64_t>(kFirstBodyChunk, got)));
+    std::memcpy(body_->data(), start, got);
     bodyLen_ = length;
     bodyGot_ = got;
     inBody_ = true;
@@ -496,7 +506,8 @@ void Connection::beginClose(const std::string& reason) {
   closing_ = true;
   open_ = false;
   inBody_ = false;
-  body_ = MemBuffer();
+  // A read into it may be in flight; that read keeps its own share.
+  body_.reset();
   closeTimer_.expires_after(core_->options.closeGrace);
   closeTimer_.async_wait([self = shared_from_this()](const boost::system::error_code& ec) {
     if (!ec) self->finish();
@@ -512,10 +523,7 @@ void Connection::startDrain() {
   if (!stage_) return;
   reading_ = true;
   stageBegin_ = stageEnd_ = 0;
-  socket_.async_read_some(asio::buffer(stage_.get(), kStageSize),
-                          [self = shared_from_this()](const boost::system::error_code& ec, std::size_t n) {
-                            self->onRead(ec, n);
-                          });
+  readInto(stage_, stage_.get(), kStageSize);
 }
 
 void Connection::finish() {
@@ -530,13 +538,12 @@ void Connection::finish() {
   closeTimer_.cancel();
   boost::system::error_code ignored;
   socket_.close(ignored);
-  // Buffers that an operation in flight still uses go when it completes.
+  // Frames that a write in flight gathers from go when it completes; a
+  // read in flight holds its own share of its buffer.
   if (!writing_) out_.clear();
   outBytes_ = 0;
-  if (!reading_) {
-    body_ = MemBuffer();
-    stage_.reset();
-  }
+  body_.reset();
+  stage_.reset();
   auto self = shared_from_this();
   core_->remove(this);
   if (auto processor = processor_.lock()) {

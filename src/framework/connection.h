@@ -17,6 +17,20 @@
 // After the connection has finished, they do nothing.
 // Failures: problems are reported through the server's error handler and
 // end this connection only; nothing here throws to its caller.
+//
+// Buffer lifetimes (the rule every asynchronous operation here follows): a
+// buffer handed to an asynchronous read or write lives until that operation
+// has completed or been cancelled and its handler has run, whichever path
+// ends the connection (a Bye, a stall, the peer's end, the server's stop).
+//   - Reads go into a buffer that the read's handler owns a share of (the
+//     stage, or the growing buffer of a large frame): the connection may
+//     drop its own share at any time, and the bytes that still arrive land
+//     in memory that the handler releases.
+//   - Writes gather from the frames queued in out_; a frame stays in out_
+//     (and gather_ is not rewritten) until the write that covers it has
+//     completed: frames leave the queue only in consumeWritten, after a
+//     completed write, and finish() keeps the queue while a write is in
+//     flight, whose handler clears it.
 
 #include <array>
 #include <atomic>
@@ -119,6 +133,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void beginClose(const std::string& reason);
   void startDrain();
   void finish();
+  // Reads into [data, data + size), which owner keeps alive until the
+  // read's handler has run.
+  void readInto(std::shared_ptr<const void> owner, unsigned char* data, std::size_t size);
 
   void armStallTimer();
   void onStallTimer(const boost::system::error_code& ec);
@@ -136,10 +153,11 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   std::atomic<bool> answered_{false};
 
   // Reading.
-  std::unique_ptr<unsigned char[]> stage_;
+  // Both shared with the read in flight (see the buffer rule above).
+  std::shared_ptr<unsigned char[]> stage_;
   std::size_t stageBegin_ = 0;
   std::size_t stageEnd_ = 0;
-  MemBuffer body_;  // a frame larger than the stage, as far as received
+  std::shared_ptr<MemBuffer> body_;  // a frame larger than the stage, as far as received
   std::uint32_t bodyLen_ = 0;
   std::uint64_t bodyGot_ = 0;
   bool inBody_ = false;

@@ -231,8 +231,11 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
       // Run it, and whatever it defers, before stepping aside; otherwise it
       // would wait for some unrelated event to wake a thread.
       if (!drain(*s, *io)) return;
-      if (!park(s)) return;
-      continue;
+      const Park parked = park(s);
+      if (parked == Park::End) return;
+      if (parked == Park::Resume) continue;
+      // Park::Stay: every other thread is in a command; this one serves
+      // the connections until it may step aside.
     }
     try {
       if (!spare) {
@@ -249,10 +252,30 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
     // no thread free for the connections.
     std::lock_guard lock(s->mutex);
     if (s->stopping) return;  // join() owns the handles now
-    if (s->active() - 1 <= s->busy.load()) continue;
+    if (!mayStepAside(*s)) continue;
     retire(*s);
     return;
   }
+}
+
+// Whether the calling thread, one that runs the I/O context and is in no
+// command, may stop running it: only if another thread stays free for the
+// connections. Under mutex.
+//
+// Busy scopes count themselves in without the mutex: they add to busy and
+// then read total. So the other order is taken here: total is lowered
+// first, as if this thread had gone, and busy is read after. With both
+// sides sequentially consistent, either the command starting now sees the
+// lowered total (and wakes the watcher) or busy read here includes it (and
+// the thread stays). Lowering total after reading busy would let both miss
+// each other and leave no thread to run the I/O context.
+bool IoPool::mayStepAside(State& s) {
+  s.total = s.active() - 1;
+  if (s.busy.load() >= s.total.load()) {
+    s.countActive();
+    return false;
+  }
+  return true;
 }
 
 // Runs the handlers that are ready, without waiting for more. False when
@@ -279,23 +302,26 @@ void IoPool::retire(State& s) {
 
 // A spare that is not needed waits outside the I/O context, where it takes
 // no part in the scheduling of handlers, until the watcher wakes it or
-// spareIdle passes (then it ends). Returns false when the thread must end.
-bool IoPool::park(const std::shared_ptr<State>& s) {
+// spareIdle passes (then it ends). It stays in the I/O context while every
+// other thread is in a command: parking then would leave nobody to serve
+// the connections.
+IoPool::Park IoPool::park(const std::shared_ptr<State>& s) {
   std::unique_lock lock(s->mutex);
-  if (s->stopping) return false;
-  if (!s->parkSpares.load()) return true;
+  if (s->stopping) return Park::End;
+  if (!s->parkSpares.load()) return Park::Resume;
+  if (!mayStepAside(*s)) return Park::Stay;
   ++s->parked;
   s->countActive();
   const bool woken =
       s->unpark.wait_for(lock, s->options.spareIdle, [&] { return s->stopping || s->wakeups > 0; });
-  if (s->stopping) return false;
+  if (s->stopping) return Park::End;
   if (woken) {
     --s->wakeups;  // the watcher counted this thread active again
-    return true;
+    return Park::Resume;
   }
   --s->parked;
   retire(*s);
-  return false;
+  return Park::End;
 }
 
 // Sleeps while some thread is free; while none is, looks every
@@ -341,10 +367,19 @@ void IoPool::watcherMain(const std::shared_ptr<State>& s) {
     } else if (allBusy) {
       quiet = 0;
     } else if (++quiet >= kQuietPolls) {
-      // No command has needed a spare for a while: they step aside.
+      // No command has needed a spare for a while: they step aside, and
+      // the watcher sleeps until a command takes the last free thread.
+      // That command adds to busy and then reads watching; so watching is
+      // cleared first and busy read after, or a command starting now could
+      // see the watcher still awake while the watcher misses the command,
+      // and nobody would look again while every thread blocks.
       quiet = 0;
       s->watching = false;
-      s->parkSpares = true;
+      if (s->busy.load() >= s->active()) {
+        s->watching = true;
+      } else {
+        s->parkSpares = true;
+      }
     }
   }
 }

@@ -23,9 +23,11 @@
 // outside the I/O context after their current handler and what it deferred
 // (a crowd of idle
 // threads in the I/O context's scheduling slows every request down), and
-// the watcher wakes parked spares before it starts new ones. Spares that
-// have run nothing, or stayed parked, for `spareIdle` end, as long as one
-// thread stays free; the `base` threads stay until the I/O context stops.
+// the watcher wakes parked spares before it starts new ones. A spare never
+// parks or ends while every other thread is in a command: some thread must
+// always be free to run the I/O context. Spares that have run nothing, or
+// stayed parked, for `spareIdle` end; the `base` threads stay until the I/O
+// context stops.
 //
 // At most `maxThreads` threads exist. At that limit, or when the system
 // refuses a thread, the connections wait for a command to end; the problem
@@ -104,7 +106,9 @@ class IoPool {
                          bool spare);
   static void watcherMain(const std::shared_ptr<State>& s);
   static bool drain(State& s, boost::asio::io_context& io);
-  static bool park(const std::shared_ptr<State>& s);
+  enum class Park { Resume, Stay, End };
+  static Park park(const std::shared_ptr<State>& s);
+  static bool mayStepAside(State& s);
   static void retire(State& s);
   // Called with the state's mutex held. Returns a problem to report, if
   // any; a base thread that cannot be started throws std::system_error.

@@ -128,8 +128,8 @@ bool DBLocal::exists(bool mustExist) {
 
 void DBLocal::attachOrCreate(DBInstances& pool, engine::Session& fresh, bool found, bool& creationFailed) {
   // Another connection may have created the database since the first
-  // look, its instance closed again meanwhile; under the pool mutex nobody
-  // else creates it now, so a second look decides.
+  // look, its instance closed again meanwhile; while the pool opens the
+  // database nobody else gets a session on it, so a second look decides.
   if (!found && !fileAccessible()) {
     createDB(pool, fresh, creationFailed);
     return;

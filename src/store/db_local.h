@@ -212,7 +212,7 @@ class DBLocal {
 
   // ---- Lifecycle internals ---------------------------------------------
   void openDB();
-  // Both run in the pool's onNewInstance, under the pool mutex. createDB
+  // Both run in the pool's onNewInstance, alone on the database. createDB
   // sets creationFailed before it passes a failure on.
   void attachOrCreate(DBInstances& pool, engine::Session& session, bool found, bool& creationFailed);
   void createDB(DBInstances& pool, engine::Session& session, bool& creationFailed);

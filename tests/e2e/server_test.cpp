@@ -6,11 +6,15 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 
+#include <algorithm>
 #include <chrono>
+#include <future>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "e2e_support.h"
+#include "support/raw_db.h"
 
 namespace {
 
@@ -89,6 +93,71 @@ TEST(ServerRequests, ARefusalKeepsTheConnectionAndAMalformedRequestEndsOnlyItsOw
   EXPECT_TRUE(endedBy([&] { malformed->awaitEnd(); }).starts_with("Malformed request GetData"));
   EXPECT_TRUE(server.waitForLogLine("Ipc Malformed request GetData from 127.0.0.1:"));
   bystander->ping();
+}
+
+// Uploads in progress when the server stops: the bytes that still arrive
+// after the Bye must land nowhere (the sanitizer build would abort the
+// server, and its exit status would not be 0). The rest of each frame is
+// sent short of its last byte, so no request ever completes.
+TEST(ServerLifecycle, AStopDuringLargeUploadsEndsThemCleanly) {
+  ServerProcess server(kServer);
+  const std::string body(200000, 'u');
+  const std::string frame = lengthPrefix(2 + 4 + 8 + body.size()) + std::string("\x08\x00", 2) + body;
+  std::vector<std::unique_ptr<cvdb::Client>> uploading;
+  const std::vector<std::size_t> parts{4, 3000, 120000};
+  for (const std::size_t part : parts) {
+    uploading.push_back(clientOf(server));
+    uploading.back()->ping();
+    uploading.back()->sendRaw(frame.substr(0, part));
+  }
+  auto stopped = std::async(std::launch::async, [&] { return server.stop(); });
+  ASSERT_TRUE(server.waitForLogLine("Stop requested by SIGTERM"));
+  for (std::size_t i = 0; i < parts.size(); ++i) {
+    auto& c = uploading[i];
+    EXPECT_EQ(endedBy([&] {
+                try {
+                  c->sendRaw(frame.substr(parts[i], frame.size() - parts[i] - 1));
+                } catch (const cvdb::ConnectionEnded&) {
+                  // Closed before all of it went out.
+                }
+                c->awaitEnd();
+              }),
+              "Server is stopping");
+  }
+  EXPECT_EQ(stopped.get(), 0);
+}
+
+// Writers blocked on a database's write lock, held from outside the
+// server, occupy at least every base I/O thread; other connections must
+// still be answered within 50 ms, the whole time and round after round.
+TEST(ServerRequests, WritersBlockedOnALockedDatabaseStallNoOtherConnection) {
+  ServerProcess server(kServer);
+  clientOf(server, "locked")->setCfg("k", json::Object());
+  const unsigned writers = std::max(4u, std::thread::hardware_concurrency());
+  auto pinger = clientOf(server);
+  testing_support::RawDb raw(server.home() / "db" / "locked" / "cvdb.edb");
+  for (int round = 0; round < 3; ++round) {
+    SCOPED_TRACE(round);
+    ASSERT_EQ(raw.exec("BEGIN IMMEDIATE"), 0);
+    std::vector<std::future<void>> writes;
+    for (unsigned i = 0; i < writers; ++i) {
+      writes.push_back(std::async(std::launch::async, [&server, i] {
+        clientOf(server, "locked")->setCfg("w" + std::to_string(i), json::Object());
+      }));
+    }
+    // Past the watcher's quiet period, after which spares used to park.
+    const auto until = std::chrono::steady_clock::now() + 1500ms;
+    std::chrono::steady_clock::duration worst{};
+    while (std::chrono::steady_clock::now() < until) {
+      const auto t0 = std::chrono::steady_clock::now();
+      pinger->ping();
+      worst = std::max(worst, std::chrono::steady_clock::now() - t0);
+      std::this_thread::sleep_for(10ms);
+    }
+    EXPECT_LT(worst, 50ms) << std::chrono::duration_cast<std::chrono::milliseconds>(worst).count() << " ms";
+    ASSERT_EQ(raw.exec("COMMIT"), 0);
+    for (auto& w : writes) w.get();
+  }
 }
 
 }  // namespace

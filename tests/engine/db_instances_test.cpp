@@ -101,6 +101,53 @@ TEST_F(Pool, TheEngineStartIsLoggedAndTwoClientsOfANewDatabaseShareOneInstance) 
   EXPECT_EQ(log.count(Log::Debug, started), 1u);
 }
 
+// Opening a database (a long log replay) holds up nobody but the callers
+// for that database, who get a session once it is open; a failed opening
+// lets them start afresh.
+TEST_F(Pool, ASlowOpeningHoldsUpOnlyItsOwnDatabase) {
+  std::promise<void> entered;
+  std::promise<void> release;
+  auto released = release.get_future().share();
+  auto slow = std::async(std::launch::async, [&] {
+    return DBInstances::inst()->newSession("slow", [&](engine::Session& s) {
+      entered.set_value();
+      released.wait();
+      opener()(s);
+    });
+  });
+  entered.get_future().wait();
+  // Another database, its end and a hold on it, meanwhile.
+  auto other = open("other");
+  { InstanceForMaintenance hold("other", nullptr, false); }
+  close("other", std::move(other));
+  EXPECT_EQ(record("slow")->sessions, 1u);
+  auto second = std::async(std::launch::async, [&] { return open("slow"); });
+  EXPECT_EQ(second.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
+  release.set_value();
+  auto first = slow.get();
+  auto next = second.get();
+  EXPECT_EQ(first->instance(), next->instance());
+  EXPECT_EQ(record("slow")->sessions, 2u);
+  close("slow", std::move(first));
+  close("slow", std::move(next));
+
+  std::promise<void> failing;
+  auto failed = std::async(std::launch::async, [&] {
+    return DBInstances::inst()->newSession("broken", [&](engine::Session&) {
+      failing.get_future().wait();
+      throw DB::DBExc("cannot open");
+    });
+  });
+  auto waiter = std::async(std::launch::async, [&] { return open("broken"); });
+  while (!record("broken")) std::this_thread::yield();
+  failing.set_value();
+  EXPECT_THROW(failed.get(), DB::DBExc);
+  auto fresh = waiter.get();
+  EXPECT_TRUE(fresh->isOpen());
+  EXPECT_EQ(record("broken")->sessions, 1u);
+  close("broken", std::move(fresh));
+}
+
 TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimitOrWhenAsked) {
   configure(3);
   VerboseLog verbose;

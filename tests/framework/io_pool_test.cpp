@@ -140,6 +140,32 @@ TEST(IoPool, SparesNoLongerNeededParkAndAreWokenBeforeNewOnesStart) {
   }
 }
 
+// Every base thread blocked for longer than the watcher takes to go
+// quiet: the spare that serves meanwhile must neither park nor end, since
+// nothing would serve the other work (nor wake the watcher) until a
+// blocked command ended. Each round posts work for well past the quiet
+// period and wants every piece run within 50 ms.
+TEST(IoPool, ASpareStaysWhileEveryOtherThreadBlocksAndGoesWhenTheyAreFree) {
+  Rig rig({2, 64, 200ms, 1000us});
+  for (int round = 0; round < 5; ++round) {
+    Gate gate;
+    // Opened however the round ends, so that a failure cannot hang the rig.
+    const std::shared_ptr<void> opener(nullptr, [&](void*) { gate.open(); });
+    for (int i = 0; i < 2; ++i) rig.command([&] { gate.pass(); });
+    ASSERT_TRUE(gate.waitForWaiting(2));
+    const auto until = std::chrono::steady_clock::now() + 600ms;
+    while (std::chrono::steady_clock::now() < until) {
+      auto ran = std::make_shared<std::promise<void>>();
+      asio::post(*rig.io, [ran] { ran->set_value(); });
+      ASSERT_EQ(ran->get_future().wait_for(50ms), std::future_status::ready) << "round " << round;
+      std::this_thread::sleep_for(5ms);
+    }
+    gate.open();
+    // Free again: the spare goes once it has been idle for spareIdle.
+    EXPECT_TRUE(eventually([&] { return rig.pool.threadCount() == 2; })) << rig.pool.threadCount();
+  }
+}
+
 TEST(IoPool, ShortCommandsDoNotMakeThePoolGrow) {
   Rig rig({2, 64, 30s, 1000us});
   std::atomic<int> left{20000};

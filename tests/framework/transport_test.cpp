@@ -183,6 +183,59 @@ TEST_F(TransportTest, AStalledFrameIsDroppedWhileAnIdleConnectionIsKept) {
   EXPECT_TRUE(idle.ping());
 }
 
+// A connection ended while a frame is still arriving, at every stage of a
+// large frame: what the client sends after the Bye must land nowhere (the
+// sanitizer build sees any write into a released buffer) and the server
+// must go on serving others. Ended by the stall rule, by a malformed frame
+// read together with the start of a large one, and by the server's stop.
+TEST_F(TransportTest, BytesArrivingAfterAConnectionEndedWithinAFrameLandNowhere) {
+  const std::string large = requestBytes(kEcho, strField(std::string(300000, 'l')));
+  const std::string more(64 * 1024, 'm');
+  // Keeps sending for a while after the Bye; the server may close first.
+  const auto keepSending = [&](RawClient& c) {
+    try {
+      for (int i = 0; i < 8; ++i) c.send(more);
+    } catch (const std::runtime_error&) {
+      // The close grace ended meanwhile.
+    }
+  };
+  const auto byeThenMore = [&](RawClient& c, const std::string& reason) {
+    const auto bye = c.read();
+    ASSERT_TRUE(bye && bye->kind == FrameKind::Bye);
+    EXPECT_TRUE(bye->text().starts_with(reason)) << bye->text();
+    keepSending(c);
+  };
+  RawClient bystander(port());
+  const std::vector<std::pair<std::string, std::string>> stalls{
+      {large.substr(0, 2), "header"},       // inside the length field
+      {large.substr(0, 3000), "stage"},     // a frame larger than the stage, started
+      {large.substr(0, 150000), "body"},    // deep into its own buffer
+  };
+  for (const auto& [bytes, where] : stalls) {
+    SCOPED_TRACE(where);
+    RawClient c(port());
+    c.send(bytes);
+    byeThenMore(c, "Frame incomplete for too long");
+    EXPECT_TRUE(bystander.ping());
+  }
+  {
+    RawClient c(port());
+    c.send(frameBytes(1, FrameKind::Answer) + large.substr(0, 100000));
+    byeThenMore(c, "Malformed frame: not a request");
+    EXPECT_TRUE(bystander.ping());
+  }
+  // The stop ends uploads in progress at every stage.
+  std::vector<RawClient> uploading;
+  for (const std::size_t part : {std::size_t{2}, std::size_t{3000}, std::size_t{150000}}) {
+    uploading.emplace_back(port());
+    uploading.back().send(large.substr(0, part));
+  }
+  ASSERT_TRUE(eventually([&] { return server->connectionCount() == 4; }));
+  auto stopped = std::async(std::launch::async, [&] { stop(); });
+  for (auto& c : uploading) byeThenMore(c, "Server is stopping");
+  stopped.get();
+}
+
 TEST_F(TransportTest, AClientVanishingMidRequestMidAnswerOrMidCommandLeavesNothingBehind) {
   // Mid-frame, within the first bytes and deep into a long body.
   RawClient(port()).send(lengthOnly(100) + std::string("\x0a\x00", 2) + "partial");
