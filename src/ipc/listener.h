@@ -35,7 +35,7 @@ class Listener final : public CmdProcessorDBI {
   // the binding gives the store's session back.
   class ConnDB : public Ipc::ConnInf {
    public:
-    explicit ConnDB(std::string_view dbName);
+    ConnDB(std::shared_ptr<::DB::DBInstances> pool, std::string_view dbName);
     ~ConnDB() override;
 
     ::DB::DBLocal db;
@@ -47,7 +47,7 @@ class Listener final : public CmdProcessorDBI {
 
   // For tests: a Listener without a command server whose processed commands
   // go to respond instead.
-  static std::shared_ptr<Listener> createDetached(Responder respond);
+  static std::shared_ptr<Listener> createDetached(Responder respond, std::shared_ptr<::DB::DBInstances> pool);
 
   ~Listener() override;
   Listener(const Listener&) = delete;
@@ -101,23 +101,29 @@ class Listener final : public CmdProcessorDBI {
   class Passkey {
     explicit Passkey() = default;
     friend class Listener;
-    friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+    friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
+                                                    std::shared_ptr<::DB::DBInstances> pool);
   };
 
  public:
-  Listener(Passkey, Responder respond);
+  Listener(Passkey, Responder respond, std::shared_ptr<::DB::DBInstances> pool);
 
  private:
-  friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+  friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
+                                                  std::shared_ptr<::DB::DBInstances> pool);
   friend Ipc::SvcStub& serverOf(Listener& listener);
 
   Responder respond_;
+  // The databases' pool, with their paths and the Env: what every
+  // connection's store works with.
+  const std::shared_ptr<::DB::DBInstances> pool_;
   std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
 };
 
 // Builds the Listener and its command server on the port (0: any free
-// port); throws std::runtime_error when the port cannot be bound.
-std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+// port), serving the databases of the pool; throws std::runtime_error when
+// the port cannot be bound.
+std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool);
 // The Listener's command server; throws std::logic_error for a detached
 // Listener.
 Ipc::SvcStub& serverOf(Listener& listener);

@@ -32,11 +32,11 @@ namespace Ipc {
 // Overwrites every field of out's partial part (name, owner, created,
 // modified, docCount, uses) with those of the stored text. On a throw, out
 // holds some mix of old and new values.
-void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out);
+void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out);
 
-inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t useLimit) {
+inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now) {
   PackInfoPartial out;
-  readStoredPackInfo(text, useLimit, out);
+  readStoredPackInfo(text, useLimit, now, out);
   return out;
 }
 
@@ -47,6 +47,6 @@ inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t u
 // writer stores one; jansson skips one right after a number or a literal).
 // The caller then asks jansson.
 // Exposed for the differential tests and the fuzz target.
-bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out);
+bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out);
 
 }  // namespace Ipc
