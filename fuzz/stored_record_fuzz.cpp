@@ -9,7 +9,7 @@
 #include <cstdlib>
 #include <string>
 
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const std::string text(reinterpret_cast<const char*>(data), size);

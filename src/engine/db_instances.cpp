@@ -4,7 +4,7 @@
 
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
-#include "engine/open_files.h"
+#include "framework/open_files.h"
 #include "framework/log.h"
 #include "settings/config.h"
 
@@ -13,7 +13,7 @@ namespace {
 
 constexpr const char* kNotAccessible = "Database not accessible! Possible restore operation in progress.";
 
-void logEngineStart(const PoolSettings& settings, const Paths& paths, const engine::OpenFileLimit& files) {
+void logEngineStart(const PoolSettings& settings, const Paths& paths, const sys::OpenFileLimit& files) {
   if (g_LogVerbose) {
     Log::Lock entry(Log::Debug);
     entry.logStreamLine() << "DBInstances: Engine initialized\n"
@@ -51,7 +51,7 @@ PoolSettings PoolSettings::from(const DBConfig& config) {
 
 std::shared_ptr<DBInstances> DBInstances::create(PoolSettings settings, Paths paths, sys::Env& env) {
   auto pool = std::make_shared<DBInstances>(Token{}, settings, std::move(paths), env);
-  logEngineStart(pool->settings_, pool->paths_, engine::raiseOpenFileLimit());
+  logEngineStart(pool->settings_, pool->paths_, sys::raiseOpenFileLimit());
   return pool;
 }
 

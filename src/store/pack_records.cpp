@@ -7,7 +7,7 @@
 #include "engine/db_exc.h"
 #include "engine/transaction.h"
 #include "framework/log.h"
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 #include "store/db_local.h"
 #include "store/pack_sql.h"
 

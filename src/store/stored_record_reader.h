@@ -7,8 +7,11 @@
 // most of a listing's time. The reader here streams the text through a SAX
 // parser and keeps only what PackInfoPartial holds.
 //
+// It belongs to the store, not to the wire protocol: it is how rows are
+// stored, and clients never read it.
+//
 // The result is exactly that of PackInfoPartial(json::strToObject(text),
-// useLimit) for every text, refusals included: values of the wrong type
+// useLimit, now) for every text, refusals included: values of the wrong type
 // read as absent, malformed use entries and entries older than the limit
 // are dropped, unknown keys are skipped, the last of duplicate keys wins,
 // and whatever jansson refuses (not one JSON object, trailing bytes,
@@ -19,7 +22,7 @@
 // Writes keep going through jansson (json::Object): they must keep the keys
 // this version does not know.
 //
-// Thread safety: no shared state besides the use clock (pack_info.h).
+// Thread safety: no shared state.
 // Failures: json::Exc for a text jansson refuses, std::bad_alloc.
 
 #include <cstdint>

@@ -1,7 +1,7 @@
 // The streaming reader of stored pack records against the jansson path it
 // replaces: the same record, or the same refusal, for every text.
 
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 
 #include <locale.h>
 
