@@ -315,8 +315,11 @@ std::shared_ptr<engine::Instance> DBInstances::acquireExclusive(const std::strin
   return found->second.instance;
 }
 
-bool DBInstances::waitTick() {
-  return env_.sleepFor(settings_.maintenanceTick, stopping_.get_token()) && !stopped();
+bool DBInstances::waitTick(const std::stop_token& stop) {
+  // An operation's own stop wakes the sleep; the pool's is seen at the
+  // tick's end then (the service stops the operations before the pool).
+  const std::stop_token token = stop.stop_possible() ? stop : stopping_.get_token();
+  return env_.sleepFor(settings_.maintenanceTick, token) && !stop.stop_requested() && !stopped();
 }
 
 void DBInstances::stopEngine(bool log) noexcept {
@@ -332,6 +335,26 @@ void DBInstances::stopEngine(bool log) noexcept {
   stopped_ = true;
   stopping_.request_stop();
   opened_.notify_all();
+}
+
+std::shared_ptr<std::shared_mutex> DBInstances::dataLock(const std::string& dbKey, std::string_view id) {
+  std::shared_ptr<DataLocks> locks;
+  {
+    std::lock_guard lock(mutex_);
+    auto& weak = dataLocks_[dbKey];
+    locks = weak.lock();
+    if (!locks) {
+      // Entries of databases nobody writes to any more go now and then.
+      if (dataLocks_.size() > 4 * settings_.maxActiveDBs) {
+        std::erase_if(dataLocks_, [](const auto& e) { return e.second.expired(); });
+      }
+      locks = std::make_shared<DataLocks>();
+      dataLocks_[dbKey] = locks;
+    }
+  }
+  std::shared_mutex& stripe = locks->stripes[std::hash<std::string_view>{}(id) % kDataLockStripes];
+  // Shares the stripes' lifetime.
+  return std::shared_ptr<std::shared_mutex>(std::move(locks), &stripe);
 }
 
 std::optional<DBInstances::RecordView> DBInstances::record(const std::string& dbKey) const {

@@ -45,6 +45,8 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <shared_mutex>
+#include <string_view>
 #include <string>
 #include <unordered_map>
 
@@ -138,6 +140,16 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   // Instances of this pool not yet terminated.
   std::uint64_t liveInstances() const noexcept { return slots_->live(); }
 
+  // The lock between the data-file writes of one database and the removal
+  // of its unused data ids: a write into an id holds dataLock(key, id)
+  // shared from its first file operation to its last, and the removal of
+  // an id holds it exclusive from its age check to its last removal, so no
+  // acknowledged write is ever removed by a cleanup running at that moment.
+  // Ids share one of kDataLockStripes locks per database by hash; a lock
+  // lives as long as somebody holds it or the database's entry is kept.
+  static constexpr std::size_t kDataLockStripes = 64;
+  std::shared_ptr<std::shared_mutex> dataLock(const std::string& dbKey, std::string_view id);
+
  private:
   friend class InstanceForMaintenance;
 
@@ -157,8 +169,8 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set);
   std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set);
   // Sleeps one tick of a maintenance wait; false when the pool stopped
-  // meanwhile.
-  bool waitTick();
+  // meanwhile, or stop (the operation's, when it has one) was requested.
+  bool waitTick(const std::stop_token& stop);
   void stopEngine(bool log) noexcept;
 
   const PoolSettings settings_;
@@ -167,6 +179,10 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   const std::shared_ptr<engine::InstanceSlots> slots_;
   std::stop_source stopping_;
 
+  struct DataLocks {
+    std::shared_mutex stripes[kDataLockStripes];
+  };
+  std::unordered_map<std::string, std::weak_ptr<DataLocks>> dataLocks_;  // guarded by mutex_
   mutable std::mutex mutex_;                               // the pool mutex
   std::unordered_map<std::string, InstanceRec> records_;  // guarded by mutex_
   bool stopped_ = false;                                   // guarded by mutex_

@@ -7,7 +7,7 @@
 
 namespace DB {
 InstanceForMaintenance::InstanceForMaintenance(std::shared_ptr<DBInstances> pool, std::string dbKey,
-                                               DBProgressCallback* progress, bool exclusive)
+                                               DBProgressCallback* progress, bool exclusive, std::stop_token stop)
     : pool_(std::move(pool)), exclusive_(exclusive), dbKey_(std::move(dbKey)) {
   handle_ = acquire(true);
   if (handle_) return;
@@ -17,7 +17,7 @@ InstanceForMaintenance::InstanceForMaintenance(std::shared_ptr<DBInstances> pool
   }
   const std::int32_t maxWait = pool_->settings().maxWaitMaintenanceSecs;
   for (std::int64_t n = 1; n <= maxWait; ++n) {
-    if (!pool_->waitTick()) throwEngineError(err::kTermInProgress);
+    if (!pool_->waitTick(stop)) throwEngineError(err::kTermInProgress);
     if (n < 10 || n % 5 == 0) {
       const std::string text = std::string(exclusive_ ? "Waiting for all clients connected to the database to exit ("
                                                       : "Waiting for another database maintenance operation to finish (") +

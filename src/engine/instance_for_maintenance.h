@@ -27,6 +27,7 @@
 
 #include <chrono>
 #include <memory>
+#include <stop_token>
 #include <string>
 
 #include "engine/instance.h"
@@ -38,8 +39,10 @@ class DBInstances;
 
 class InstanceForMaintenance {
  public:
+  // A stop request through stop (the operation's) ends the wait like the
+  // pool's stop does.
   InstanceForMaintenance(std::shared_ptr<DBInstances> pool, std::string dbKey, DBProgressCallback* progress,
-                         bool exclusive);
+                         bool exclusive, std::stop_token stop = {});
   ~InstanceForMaintenance();
   InstanceForMaintenance(const InstanceForMaintenance&) = delete;
   InstanceForMaintenance& operator=(const InstanceForMaintenance&) = delete;

@@ -20,6 +20,7 @@
 #include <string_view>
 
 #include "framework/svc_stub.h"
+#include "ipc/maintenance_runner.h"
 #include "protocol/commands.h"
 #include "protocol/processor.h"
 #include "store/db_local.h"
@@ -69,6 +70,11 @@ class Listener final : public CmdProcessorDBI {
   // Logs "Ipc " + text (priority 4).
   void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
 
+  // The service's stop: asks every running maintenance operation to stop
+  // at its next safe point and waits for them (bounded); later maintenance
+  // commands fail with "Server is stopping". Call before the pool stops.
+  void stopMaintenance();
+
   // The store of the command's connection (its binding's db), looked up
   // anew by each command; throws std::runtime_error "No database
   // associated with current connection. Connect command failed?" when the
@@ -113,10 +119,24 @@ class Listener final : public CmdProcessorDBI {
                                                   std::shared_ptr<::DB::DBInstances> pool);
   friend Ipc::SvcStub& serverOf(Listener& listener);
 
+  // What a maintenance command runs on its thread, on the connection's
+  // store: ownership of the callback passes to it.
+  using MaintenanceWork =
+      std::function<void(::DB::DBLocal&, std::unique_ptr<::DB::DBProgressCallback>, std::stop_token)>;
+  // Sends the start text, then runs work on a maintenance thread; the
+  // client receives, in this order, the start text, everything the work
+  // reports, on failure one message at 100 with "DB operation failed with
+  // error: " and the failure's text, and the end of the stream. A failure
+  // (also "No database associated with current connection. Connect command
+  // failed?" for a connection without a database) is logged as "Async
+  // command X failed with ..." and ends the connection after the stream.
+  void runAsync(ProgressCmdsBase& cmd, const std::string& startText, MaintenanceWork work);
+
   Responder respond_;
   // The databases' pool, with their paths and the Env: what every
   // connection's store works with.
   const std::shared_ptr<::DB::DBInstances> pool_;
+  MaintenanceRunner maintenance_;
   std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
 };
 

@@ -48,6 +48,9 @@ void DBSvc::runSvc() {
       if (stopRequested_) server.signalStop();
     }
     server.waitToFinish();
+    // Running maintenance operations stop at their next safe point (their
+    // clients are gone already) before the pool they use is stopped.
+    created->stopMaintenance();
     {
       std::lock_guard lock(mutex_);
       listener.reset();

@@ -16,6 +16,10 @@
 #include "settings/names.h"
 #include "store/db_local.h"
 
+#include <shared_mutex>
+
+#include "engine/db_instances.h"
+
 namespace DB {
 namespace {
 
@@ -194,6 +198,9 @@ void DBLocal::saveDataBlob(const void* data, std::uint64_t length, const std::st
   const std::string folder = dataDir(id);
   const std::string path = folder + file;
   sys::Env& env = env_;
+  // A cleanup never removes the id while this write is under way.
+  const auto idLock = pool_->dataLock(name_, id);
+  const std::shared_lock writing(*idLock);
   try {
     makeFolders(env, folder);
     DurableWrite write(env, folder);
@@ -214,6 +221,13 @@ void DBLocal::copyDataFolder(const std::string& source, const std::string& targe
   checkComponent("Data id", target);
   const std::string from = dataDir(source);
   sys::Env& env = env_;
+  // Neither id is removed by a cleanup while the copy runs (one lock when
+  // both ids share it: a shared lock is not taken twice).
+  const auto sourceLock = pool_->dataLock(name_, source);
+  const auto targetLock = pool_->dataLock(name_, target);
+  const std::shared_lock readingSource(*sourceLock);
+  std::shared_lock<std::shared_mutex> writingTarget;
+  if (targetLock != sourceLock) writingTarget = std::shared_lock(*targetLock);
   try {
     if (env.stat(from).type != sys::FileType::Folder) {
       throw std::system_error(ENOENT, std::generic_category(), "find \"" + from + '"');

@@ -12,6 +12,7 @@
 #include "engine/db_instances.h"
 #include "engine/engine_errors.h"
 #include "engine/transaction.h"
+#include "maintenance/cleanup.h"
 #include "framework/log.h"
 #include "settings/names.h"
 #include "store/schema.h"
@@ -197,6 +198,15 @@ bool DBLocal::disconnect() noexcept {
   // its session then simply ends.
   pool_->endSession(name_, std::move(session_));
   return true;
+}
+
+}  // namespace DB
+
+namespace DB {
+
+void DBLocal::cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
+                      std::stop_token stop) {
+  maint::cleanUp(pool_, name_, usedIds, *callback, std::move(stop));
 }
 
 }  // namespace DB

@@ -29,11 +29,14 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <set>
+#include <stop_token>
 #include <source_location>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "engine/progress.h"
 #include "engine/session.h"
 #include "engine/statement.h"
 #include "framework/buffers.h"
@@ -162,6 +165,16 @@ class DBLocal {
   // Deletes the record and the content of a pack; nothing happens when it
   // has no record. Its data files stay (cleanup removes unused ones).
   void removePack(const std::string& id);
+
+  // ---- Maintenance (src/maintenance) --------------------------------------
+  // Run on a maintenance thread of the connection's command, which holds
+  // back the connection's other commands meanwhile. Each owns its callback
+  // until it returns and ends early, with a failure, when stop is requested.
+
+  // Removes every entry of the data folder that usedIds does not name and
+  // that was last written more than six hours ago (maint::cleanUp).
+  void cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
+               std::stop_token stop = {});
 
  private:
   // The record of a row of the pack statements (columns id, folder,

@@ -6,8 +6,18 @@
 
 namespace store_testing {
 
+namespace {
+
+DB::PoolSettings testSettings() {
+  DB::PoolSettings s;
+  s.maintenanceTick = std::chrono::milliseconds(5);
+  return s;
+}
+
+}  // namespace
+
 StoreTest::StoreTest()
-    : pool_(DB::DBInstances::create(DB::PoolSettings{}, DB::Paths(root(), logRoot(), root() + "db.backup/", "cvdb.edb"),
+    : pool_(DB::DBInstances::create(testSettings(), DB::Paths(root(), logRoot(), root() + "db.backup/", "cvdb.edb"),
                                     env_)) {}
 
 StoreTest::~StoreTest() { pool_->stop(); }

@@ -102,7 +102,18 @@ std::uint64_t FaultEnv::injected() const {
   return injected_;
 }
 
+void FaultEnv::setCallHook(std::function<void(Op, const Path&)> hook) {
+  std::lock_guard lock(mutex_);
+  callHook_ = std::move(hook);
+}
+
 void FaultEnv::check(Op kind, const Path& path) {
+  std::function<void(Op, const Path&)> hook;
+  {
+    std::lock_guard lock(mutex_);
+    hook = callHook_;
+  }
+  if (hook) hook(kind, path);
   std::lock_guard lock(mutex_);
   const auto k = static_cast<int>(kind);
   const auto any = static_cast<int>(kAny);

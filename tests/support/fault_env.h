@@ -70,6 +70,10 @@ class FaultEnv final : public sys::Env {
   // From now on every sleepFor calls hook with its duration instead of
   // sleeping (the manual clock, when used, still advances).
   void setSleepHook(std::function<void(std::chrono::milliseconds)> hook);
+  // From now on hook runs at the start of every call, on the caller's
+  // thread and before any failure is injected (to interleave another
+  // thread's work with a chosen call).
+  void setCallHook(std::function<void(Op, const sys::Path&)> hook);
 
   // sys::Env
   std::unique_ptr<sys::File> open(const sys::Path& path, sys::OpenMode mode) override;
@@ -123,6 +127,7 @@ class FaultEnv final : public sys::Env {
   std::uint64_t keptFiles_ = 0;                        // guarded by mutex_
   std::optional<sys::WallClock::time_point> clock_;    // guarded by mutex_
   std::function<void(std::chrono::milliseconds)> sleepHook_;  // guarded by mutex_
+  std::function<void(Op, const sys::Path&)> callHook_;        // guarded by mutex_
 };
 
 }  // namespace testing_support
