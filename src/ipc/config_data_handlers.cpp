@@ -28,15 +28,20 @@ void Listener::process(Connect& cmd) {
   const auto& socket = cmd.socket();
   if (!socket) throw std::runtime_error("Connect without a connection");
   std::unique_ptr<Ipc::ConnInf>& slot = socket->connInf();
-  if (const auto* bound = dynamic_cast<const ConnDB*>(slot.get());
-      bound && bound->db.name() == ::DB::folderName(dbName)) {
-    cmd.setResp();  // already bound to this database, open or not
-    return;
+  auto* bound = dynamic_cast<ConnDB*>(slot.get());
+  if (bound && bound->db.name() == ::DB::folderName(dbName)) {
+    // Already bound to this database: an open binding stays as it is, one
+    // that was only selected (mode 2) is opened now as the mode asks.
+    if (bound->db.isOpen() || cmd.openMode() > 1) {
+      cmd.setResp();
+      return;
+    }
+  } else {
+    // The previous binding goes first, giving its session back; the new one
+    // stays installed, closed, if opening fails below.
+    slot.reset();
+    slot = std::make_unique<ConnDB>(pool_, dbName);
   }
-  // The previous binding goes first, giving its session back; the new one
-  // stays installed, closed, if opening fails below.
-  slot.reset();
-  slot = std::make_unique<ConnDB>(pool_, dbName);
   ::DB::DBLocal& db = static_cast<ConnDB&>(*slot).db;
   switch (cmd.openMode()) {
     case 0: db.exists(false); break;

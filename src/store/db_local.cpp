@@ -120,7 +120,11 @@ bool DBLocal::exists(bool mustExist) {
     session_ = pool_->newSession(
         name_, [&](engine::Session& fresh) { attachOrCreate(*pool_, fresh, found, creationFailed); });
   } catch (...) {
-    if (creationFailed) removeEmptyFolders(env, newFolders);
+    // Whatever failed (the creation, or the instance's folders already: a
+    // name too long for the file system), the folders this attempt made
+    // go again; only empty ones are removed, so a database that another
+    // connection created there meanwhile keeps its folder.
+    if (!found) removeEmptyFolders(env, newFolders);
     throw;
   }
   openDB();

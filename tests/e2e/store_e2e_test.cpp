@@ -32,6 +32,11 @@ TEST(StoreEndToEnd, ConnectOpensCreatesOrOnlySelectsAndKeepsOneBindingPerConnect
   auto plant = clientOf(server);
   EXPECT_TRUE(plant->connect("Ghost", 2));
   EXPECT_FALSE(fs::exists(dbRoot(server) / "ghost"));
+  // Selected, not opened: a later Connect with mode 1 or 0 opens it as asked.
+  EXPECT_EQ(plant->connect("Ghost", 1).error, "Database Ghost does not exist");
+  EXPECT_TRUE(plant->connect("Ghost", 0));
+  plant->setCfg("seen", obj("{}"));
+  EXPECT_TRUE(fs::exists(dbRoot(server) / "ghost" / "cvdb.edb"));
   EXPECT_TRUE(plant->connect("Plant\\Line 2"));
   plant->setCfg("where", obj(R"({"db":"line 2"})"));
   // The same key keeps the open store, whatever the mode says.
@@ -42,7 +47,7 @@ TEST(StoreEndToEnd, ConnectOpensCreatesOrOnlySelectsAndKeepsOneBindingPerConnect
   testing_support::writeFile(dbRoot(server) / "db.backup" / "old" / "cvdb.edb", "not walked");
   auto names = plant->dbNames();
   std::sort(names.begin(), names.end());
-  EXPECT_EQ(names, (Keys{"other\\deep", "plant\\line 2"}));
+  EXPECT_EQ(names, (Keys{"ghost", "other\\deep", "plant\\line 2"}));
 }
 
 TEST(StoreEndToEnd, DatabaseNamesThatWouldLeaveTheRootAreRefusedAndMakeNothing) {
@@ -54,6 +59,9 @@ TEST(StoreEndToEnd, DatabaseNamesThatWouldLeaveTheRootAreRefusedAndMakeNothing) 
     EXPECT_EQ(r.error, "Database name " + name + " is not valid");
   }
   c->ping();  // a refusal is an answer, not the end of the connection
+  // A name the file system refuses (a component too long) fails the
+  // creation, which takes back every folder it made.
+  EXPECT_EQ(endedBy([&] { c->connect("abc\\" + std::string(300, 'x')); }), kTerminating);
   EXPECT_EQ(std::distance(fs::directory_iterator(server.home()), fs::directory_iterator()), 1);  // db/
   EXPECT_EQ(std::distance(fs::directory_iterator(dbRoot(server)), fs::directory_iterator()), 1);  // config.json
 }
