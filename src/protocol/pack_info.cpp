@@ -2,6 +2,9 @@
 
 #include <jansson.h>
 
+#include <cstring>
+#include <initializer_list>
+
 
 namespace Ipc {
 namespace {
@@ -88,15 +91,24 @@ UseInfos::UseInfos(const json::Value& stored, std::uint64_t limit, std::int64_t 
   if (!stored.isObject()) return;
   json_t* list = json_object_get(stored.get(), kEntriesKey);
   if (!json_is_array(list)) return;
+  storedList_ = stored;
   const std::int64_t oldest = oldestUseKept(limit, now);
   const std::size_t n = json_array_size(list);
   entries_.reserve(n);
   for (std::size_t i = 0; i < n; ++i) {
     UseInfo u;
-    if (!readEntry(json_array_get(list, i), u)) continue;
+    json_t* entry = json_array_get(list, i);
+    if (!readEntry(entry, u)) continue;
     if (u.time < oldest) continue;
     entries_.push_back(std::move(u));
+    stored_.push_back(json::Value::borrow(entry));
   }
+}
+
+bool UseInfos::hasOtherKeys() const noexcept {
+  if (!storedList_.isObject()) return false;
+  const std::size_t n = json_object_size(storedList_.get());
+  return n > (json_object_get(storedList_.get(), kEntriesKey) != nullptr ? 1u : 0u);
 }
 
 const UseInfo* UseInfos::find(const std::string& host, std::uint32_t process, UseInfo::State state) const {
@@ -114,20 +126,39 @@ const UseInfo* UseInfos::findUploadInf() const {
 }
 
 bool UseInfos::remove(const UseInfo* e) {
-  for (auto it = entries_.begin(); it != entries_.end(); ++it) {
-    if (&*it == e) {
-      entries_.erase(it);
+  for (std::size_t i = 0; i < entries_.size(); ++i) {
+    if (&entries_[i] == e) {
+      entries_.erase(entries_.begin() + static_cast<std::ptrdiff_t>(i));
+      if (i < stored_.size()) stored_.erase(stored_.begin() + static_cast<std::ptrdiff_t>(i));
       return true;
     }
   }
   return false;
 }
 
+// Copies the members of from that this version does not set into to.
+static void keepOtherKeys(json_t* from, json_t* to, std::initializer_list<const char*> known) {
+  const char* key = nullptr;
+  json_t* value = nullptr;
+  json_object_foreach(from, key, value) {
+    bool isKnown = false;
+    for (const char* k : known) isKnown = isKnown || std::strcmp(k, key) == 0;
+    if (isKnown) continue;
+    json_t* copy = json_deep_copy(value);
+    if (copy == nullptr || json_object_set_new(to, key, copy) != 0) throw std::bad_alloc();
+  }
+}
+
 void UseInfos::serialize(json::Object& out) const {
+  if (storedList_.isObject()) keepOtherKeys(storedList_.get(), static_cast<const json::Value&>(out).get(), {kEntriesKey});
+  if (entries_.empty()) return;
   json::Value list = json::Value::steal(json_array());
   if (list.empty()) throw std::bad_alloc();
-  for (const UseInfo& u : entries_) {
-    const json::Value e = entryToJson(u);
+  for (std::size_t i = 0; i < entries_.size(); ++i) {
+    const json::Value e = entryToJson(entries_[i]);
+    if (i < stored_.size() && stored_[i].isObject()) {
+      keepOtherKeys(stored_[i].get(), e.get(), {"state", "host", "user", "process", "time"});
+    }
     if (json_array_append(list.get(), e.get()) != 0) throw std::bad_alloc();
   }
   out.set(kEntriesKey, list);

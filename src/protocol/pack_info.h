@@ -77,7 +77,9 @@ class UseInfos {
   // Reads a stored list (the value under PackInfoPartial::USE_FIELD_NAME;
   // an empty value reads as an empty list). Entries older than limit
   // seconds are dropped; limit 0 keeps every entry. Entries that are not
-  // well-formed are dropped too.
+  // well-formed are dropped too. Keys this version does not know, of the
+  // list's object and of each entry, are kept and written back by
+  // serialize() (for the entries that are still in the list).
   UseInfos(const json::Value& stored, std::uint64_t limit, std::int64_t now);
 
   // The entry with this host, process and state, or null. The pointer is
@@ -88,7 +90,10 @@ class UseInfos {
   // Removes the entry that e points to (from find or findUploadInf);
   // returns false if e is not an entry of this list.
   bool remove(const UseInfo* e);
-  void append(UseInfo entry) { entries_.push_back(std::move(entry)); }
+  void append(UseInfo entry) {
+    entries_.push_back(std::move(entry));
+    stored_.emplace_back();
+  }
 
   bool empty() const noexcept { return entries_.empty(); }
   std::size_t size() const noexcept { return entries_.size(); }
@@ -98,13 +103,19 @@ class UseInfos {
   std::vector<UseInfo>::const_iterator end() const noexcept { return entries_.end(); }
 
   // Writes the list into out (a fresh object, set afterwards under
-  // USE_FIELD_NAME): the key "entries" with an array of entries.
+  // USE_FIELD_NAME): the key "entries" with an array of entries (none when
+  // the list is empty), and the other keys the stored list had.
   void serialize(json::Object& out) const;
+  // Whether the stored list had keys beside "entries".
+  bool hasOtherKeys() const noexcept;
 
-  bool operator==(const UseInfos&) const = default;
+  // The entries; what else the stored list held does not count.
+  bool operator==(const UseInfos& other) const { return entries_ == other.entries_; }
 
  private:
   std::vector<UseInfo> entries_;
+  std::vector<json::Value> stored_;  // each entry as stored (empty for new ones)
+  json::Value storedList_;           // the stored list's object, for its other keys
 };
 
 // The fields of a pack record that the store keeps in its JSON object.

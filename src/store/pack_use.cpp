@@ -87,7 +87,7 @@ std::optional<Ipc::UseInfos> DBLocal::updateUseInfo(json::Object& stored, const 
     }
   }
 
-  if (uses.empty()) {
+  if (uses.empty() && !uses.hasOtherKeys()) {
     stored.erase(Ipc::PackInfoPartial::USE_FIELD_NAME);
   } else {
     json::Object list;

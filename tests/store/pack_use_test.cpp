@@ -85,6 +85,27 @@ TEST_F(PackUse, EditorsArePerHostAndProcessAndTheKeyGoesWithTheLastOne) {
   EXPECT_EQ(db->infoFor("P")->name, "name");
 }
 
+// Keys this version does not know, in the list's object and in its
+// entries, are kept as long as their entry is (a newer client's fields).
+TEST_F(PackUse, UnknownKeysOfTheListAndOfItsEntriesAreKept) {
+  RawDb raw(db->dbFile());
+  const std::string t = std::to_string(kT0);
+  ASSERT_EQ(raw.exec("UPDATE info SET blob = CAST('{\"name\":\"name\",\"owner\":\"o\",\"created\":1,\"modified\":2,"
+                     "\"docCount\":3,\"uses\":{\"v\":2,\"entries\":[{\"state\":0,\"host\":\"a\",\"user\":\"u\","
+                     "\"process\":1,\"time\":" + t + ",\"seat\":\"x1\"},{\"state\":0,\"host\":\"b\",\"user\":\"u\","
+                     "\"process\":2,\"time\":" + t + ",\"seat\":\"x2\"}]}}' AS BLOB) WHERE id = CAST('P' AS BLOB)"),
+            0);
+  fetch(UseInfo::OpenForEdit, "c", 3);
+  fetch(UseInfo::CloseEdit, "a", 1);
+  const auto uses = storedRecord(raw, "P").get("uses");
+  EXPECT_EQ(uses.dump(),
+            "{\"v\":2,\"entries\":[{\"state\":0,\"host\":\"b\",\"user\":\"u\",\"process\":2,\"time\":" + t +
+                ",\"seat\":\"x2\"},{\"state\":0,\"host\":\"c\",\"user\":\"u\",\"process\":3,\"time\":" + t + "}]}");
+  fetch(UseInfo::CloseEdit, "b", 2);
+  fetch(UseInfo::CloseEdit, "c", 3);
+  EXPECT_EQ(storedRecord(raw, "P").get("uses").dump(), "{\"v\":2}");
+}
+
 TEST_F(PackUse, TheUploadLockBelongsToOneHostAndARefusalLeavesNoTrace) {
   using E = std::vector<Entry>;
   fetch(UseInfo::OpenForEdit, "ws-9", 1);
