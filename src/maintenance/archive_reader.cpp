@@ -10,6 +10,7 @@
 #include <atomic>
 #include <condition_variable>
 #include <exception>
+#include <functional>
 #include <mutex>
 #include <set>
 #include <system_error>
@@ -298,7 +299,6 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
     }
     if (written != e.size || crc != e.crc) decompressionError(zip::kCrcError, "checksum mismatch in \"" + e.name + '"');
     envStep([&] {
-      outFile->sync();
       outFile->close();
       env_.setModified(target, zip::fromDosDateTime(e.dosTime));
       return 0;
@@ -366,8 +366,48 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
   if (callbackFailure) std::rethrow_exception(callbackFailure);
   if (failure) std::rethrow_exception(failure);
 
-  // 4. The names of the new files and folders, on disk.
-  for (const sys::Path& f : toSync) envStep([&] { env_.syncFolder(f); return 0; });
+  // 4. Every file, then the names of the new files and folders, on disk.
+  // The syncs run last and from many threads at once: by then most data has
+  // been written back, and the file system commits its journal once for
+  // many waiting syncs instead of once per file.
+  std::vector<std::function<void()>> syncs;
+  for (const sys::Path& t : targets) {
+    if (!t.empty()) syncs.emplace_back([this, &t] { env_.open(t, sys::OpenMode::Read)->sync(); });
+  }
+  std::vector<std::function<void()>> folderSyncs;
+  for (const sys::Path& f : toSync) folderSyncs.emplace_back([this, &f] { env_.syncFolder(f); });
+  runAll(syncs, stop);
+  runAll(folderSyncs, stop);
+}
+
+void ArchiveReader::runAll(const std::vector<std::function<void()>>& jobs, std::stop_token stop) {
+  std::atomic<std::size_t> next{0};
+  std::mutex mutex;
+  std::exception_ptr failure;  // guarded by mutex
+  auto work = [&] {
+    for (;;) {
+      const std::size_t i = next.fetch_add(1);
+      if (i >= jobs.size()) return;
+      try {
+        if (stop.stop_requested()) throw OperationStopped("Unpacking \"" + path_.string() + "\" was stopped");
+        jobs[i]();
+      } catch (const std::system_error& e) {
+        std::lock_guard lock(mutex);
+        if (!failure) failure = std::make_exception_ptr(ArchiveError("Decompression error: " + std::to_string(zip::kErrno) + " (" + e.what() + ")"));
+        next = jobs.size();
+      } catch (...) {
+        std::lock_guard lock(mutex);
+        if (!failure) failure = std::current_exception();
+        next = jobs.size();
+      }
+    }
+  };
+  const std::size_t threads = std::min<std::size_t>(options_.syncThreads == 0 ? 1 : options_.syncThreads, jobs.size());
+  std::vector<std::thread> pool;
+  for (std::size_t i = 1; i < threads; ++i) pool.emplace_back(work);
+  work();
+  for (auto& t : pool) t.join();
+  if (failure) std::rethrow_exception(failure);
 }
 
 }  // namespace maint

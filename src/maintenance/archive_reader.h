@@ -14,11 +14,12 @@
 // and '/' to the separator; leading separators are dropped; directory
 // entries (an empty name or one ending in a separator) are skipped. Entries
 // are always written as regular files, never as links. Then the entries are
-// inflated on worker threads, each file written through the Env, synced,
-// given its entry's time stamp (MS-DOS local time) as last write time, and
-// finally every folder that received a file or a new subfolder is synced, so
-// an unpacked tree survives a power loss once unpackTo() returns. Memory:
-// two 1 MiB buffers per worker, whatever the archive's size.
+// inflated on worker threads, each file written through the Env and given
+// its entry's time stamp (MS-DOS local time) as last write time; finally
+// every file, then every folder that received a file or a new subfolder, is
+// synced, so an unpacked tree survives a power loss once unpackTo()
+// returns. Memory: two 1 MiB buffers per worker, whatever the archive's
+// size.
 //
 // Ownership: the Env outlives the reader; the reader holds the archive file
 // open until it is destroyed.
@@ -48,7 +49,8 @@
 namespace maint {
 
 struct ArchiveReaderOptions {
-  unsigned threads = 0;  // inflating threads; 0: one per core
+  unsigned threads = 0;      // inflating threads; 0: one per core
+  unsigned syncThreads = 8;  // threads that sync the written files at the end
 };
 
 class ArchiveReader {
@@ -85,6 +87,9 @@ class ArchiveReader {
 
  private:
   void readDirectory();
+  // Runs the jobs on syncThreads threads; the first failure stops the rest
+  // and is thrown.
+  void runAll(const std::vector<std::function<void()>>& jobs, std::stop_token stop);
 
   sys::Env& env_;
   const sys::Path path_;

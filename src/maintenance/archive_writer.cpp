@@ -172,14 +172,22 @@ class ArchiveWriter::Pipeline {
       queue(std::move(head), false);
       return;
     }
-    std::vector<unsigned char> data = readChunk(*in);
+    // A buffer of the file's size (up to a chunk) when it fits: most files
+    // are far smaller than a chunk.
+    std::size_t capacity = w_.options_.chunkSize;
+    try {
+      capacity = static_cast<std::size_t>(std::min<std::uint64_t>(capacity, in->size() + 1));
+    } catch (const std::system_error&) {
+    }
+    std::vector<unsigned char> data = readChunk(*in, capacity);
     std::unique_ptr<Chunk> current = std::move(head);
     for (;;) {
       current->input = std::move(data);
-      if (current->input.size() < w_.options_.chunkSize) {
+      if (current->input.size() < capacity) {
         current->last = true;
       } else {
-        data = readChunk(*in);
+        capacity = w_.options_.chunkSize;
+        data = readChunk(*in, capacity);
         current->last = data.empty();
       }
       std::vector<unsigned char> window;
@@ -197,8 +205,8 @@ class ArchiveWriter::Pipeline {
     }
   }
 
-  std::vector<unsigned char> readChunk(sys::File& in) {
-    std::vector<unsigned char> data(w_.options_.chunkSize);
+  std::vector<unsigned char> readChunk(sys::File& in, std::size_t capacity) {
+    std::vector<unsigned char> data(capacity);
     std::size_t used = 0;
     try {
       while (used < data.size()) {
