@@ -343,6 +343,10 @@ ArchiveWriter::~ArchiveWriter() { discard(); }
 
 void ArchiveWriter::add(sys::Path file, std::string entryName) {
   if (spent_) throw std::logic_error("ArchiveWriter::add after commit");
+  if (entryName.empty() || entryName.size() > 0xffff) {
+    throw ArchiveError("Compression error: " + std::to_string(zip::kInternalError) + " (an entry name must have 1 to 65535 bytes: \"" +
+                       entryName.substr(0, 64) + "\")");
+  }
   entries_.push_back(Entry{std::move(file), std::move(entryName)});
 }
 

@@ -86,6 +86,7 @@ class ArchiveWriter {
   ArchiveWriter& operator=(const ArchiveWriter&) = delete;
 
   // Records a file for the archive under entryName; nothing is read yet.
+  // Throws ArchiveError for an empty name or one longer than 65535 bytes.
   void add(sys::Path file, std::string entryName);
   // Called once per added file, done or skipped, during commit().
   void onEntry(EntryCallback callback) { callback_ = std::move(callback); }

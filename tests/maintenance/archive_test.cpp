@@ -338,6 +338,20 @@ TEST(ArchiveReader, DirectoryEntriesAreSkippedAndLeadingSeparatorsDropped) {
   EXPECT_FALSE(fs::exists(dir / "into/d"));
 }
 
+TEST(ArchiveReader, AStopEndsTheUnpacking) {
+  TempDir dir;
+  const auto files = sampleTree();
+  makeTree(dir / "src", files);
+  writeArchive(sys::Env::posix(), dir / "src", dir / "a.cvbak", files);
+  std::stop_source stop;
+  maint::ArchiveReaderOptions one;
+  one.threads = 1;
+  ArchiveReader reader(sys::Env::posix(), dir / "a.cvbak", one);
+  // The stop is seen between entries or, at the latest, before the syncs.
+  EXPECT_THROW(reader.unpackTo(dir / "into", [&](std::size_t, std::size_t) { stop.request_stop(); }, stop.get_token()),
+               maint::OperationStopped);
+}
+
 // A damaged archive: a clear error, whichever byte was hit.
 TEST(ArchiveReader, DamageIsReportedClearly) {
   TempDir dir;
