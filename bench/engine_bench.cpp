@@ -37,8 +37,8 @@
 #include "engine/db_instances.h"
 #include "engine/session.h"
 #include "engine/transaction.h"
-#include "service/config.h"
-#include "service/names.h"
+#include "settings/config.h"
+#include "settings/names.h"
 
 namespace {
 
@@ -181,11 +181,14 @@ class DirectDb {
   std::uint64_t n_ = 0;
 };
 
+// The pool the layer's measures use (made in main).
+std::shared_ptr<DB::DBInstances> g_pool;
+
 // A session of the pool on the database `key`, created with the kv table
 // on first use.
 std::unique_ptr<engine::Session> layerSession(const std::string& key) {
-  auto session = DB::DBInstances::inst()->newSession(key, [&](engine::Session& s) {
-    const fs::path file = DB::mainFile(key);
+  auto session = g_pool->newSession(key, [&](engine::Session& s) {
+    const fs::path file = g_pool->paths().mainFile(key);
     if (fs::exists(file)) {
       s.attachDatabase(file);
       return;
@@ -220,7 +223,7 @@ double layerRate(const Options& o, int sessions, int dbs) {
       });
     };
   });
-  for (std::size_t i = 0; i < open.size(); ++i) DB::DBInstances::inst()->endSession(keys[i], std::move(open[i]));
+  for (std::size_t i = 0; i < open.size(); ++i) g_pool->endSession(keys[i], std::move(open[i]));
   return r;
 }
 
@@ -250,7 +253,7 @@ double pairedOverhead(const Options& o) {
   std::vector<double> ratios;
   const auto end = Clock::now() + std::chrono::duration<double>(o.seconds * o.runs);
   while (Clock::now() < end || ratios.size() < 5) ratios.push_back(layerSlice() / directSlice());
-  DB::DBInstances::inst()->endSession("paired", std::move(session));
+  g_pool->endSession("paired", std::move(session));
   return (median(ratios) - 1.0) * 100.0;
 }
 
@@ -292,7 +295,7 @@ void longValue() {
   const auto extra = [&](std::uint64_t peak) { return peak > base ? static_cast<double>(peak - base) / 1048576.0 : 0.0; };
   std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "write a 256 MiB value", writeSeconds, extra(writePeak));
   std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "read it back", readSeconds, extra(readPeak));
-  DB::DBInstances::inst()->endSession("long", std::move(session));
+  g_pool->endSession("long", std::move(session));
 }
 
 void openManySessions(const Options& o) {
@@ -307,7 +310,7 @@ void openManySessions(const Options& o) {
           "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n WHERE i < 2048) "
           "INSERT INTO bulk SELECT i, randomblob(4096) FROM n");
     });
-    DB::DBInstances::inst()->endSession("many", std::move(filler));
+    g_pool->endSession("many", std::move(filler));
   }
   const auto before = residentBytes();
   const auto start = Clock::now();
@@ -324,7 +327,7 @@ void openManySessions(const Options& o) {
   std::printf("%-40s %10.1f MiB\n", "  memory of the open sessions", static_cast<double>(opened - before) / 1048576.0);
   std::printf("%-40s %10.1f MiB\n", "  after a full 8 MiB scan on each",
               static_cast<double>(scanned - before) / 1048576.0);
-  for (auto& s : sessions) DB::DBInstances::inst()->endSession("many", std::move(s));
+  for (auto& s : sessions) g_pool->endSession("many", std::move(s));
   (void)o;
 }
 
@@ -352,12 +355,10 @@ int main(int argc, char** argv) try {
   o.dir = o.dir / ("engine-bench-" + std::to_string(::getpid()));
   fs::create_directories(o.dir);
 
-  DBConfig config;
-  config.DBRoot = o.dir.string() + "/db/";
-  config.DBLogRoot = config.DBRoot;
-  config.MaxActiveDBs = 100;
-  config.MaxActiveClientsPerDB = 2000;
-  const DBConfig::TestOverride settings(config);
+  DB::PoolSettings settings;
+  settings.maxClientsPerDB = 2000;
+  const std::string root = o.dir.string() + "/db/";
+  g_pool = DB::DBInstances::create(settings, DB::Paths(root, root, root + "db.backup/", "cvdb.edb"), sys::Env::posix());
 
   struct Measure {
     std::string name;
@@ -398,7 +399,7 @@ int main(int argc, char** argv) try {
 
   longValue();
   openManySessions(o);
-  DB::DBInstances::teardown();
+  g_pool->stop();
   fs::remove_all(o.dir);
   return 0;
 } catch (const std::exception& e) {

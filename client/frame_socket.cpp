@@ -1,5 +1,7 @@
 #include "client/frame_socket.h"
 
+#include "framework/unique_fd.h"
+
 #include <fcntl.h>
 #include <netdb.h>
 #include <netinet/in.h>
@@ -25,37 +27,34 @@ std::string errnoText(int err) { return std::strerror(err); }
 
 // Connects one address within the timeout; returns the socket or -1 with
 // err set.
-int connectOne(const addrinfo& ai, std::chrono::milliseconds timeout, int& err) {
-  const int fd = ::socket(ai.ai_family, ai.ai_socktype | SOCK_CLOEXEC | SOCK_NONBLOCK, ai.ai_protocol);
-  if (fd < 0) {
+UniqueFd connectOne(const addrinfo& ai, std::chrono::milliseconds timeout, int& err) {
+  UniqueFd fd(::socket(ai.ai_family, ai.ai_socktype | SOCK_CLOEXEC | SOCK_NONBLOCK, ai.ai_protocol));
+  if (!fd.valid()) {
     err = errno;
-    return -1;
+    return fd;
   }
-  if (::connect(fd, ai.ai_addr, ai.ai_addrlen) != 0) {
+  if (::connect(fd.get(), ai.ai_addr, ai.ai_addrlen) != 0) {
     if (errno != EINPROGRESS) {
       err = errno;
-      ::close(fd);
-      return -1;
+      return UniqueFd();
     }
-    pollfd p{fd, POLLOUT, 0};
+    pollfd p{fd.get(), POLLOUT, 0};
     int r;
     do {
       r = ::poll(&p, 1, pollTimeout(timeout));
     } while (r < 0 && errno == EINTR);
     if (r == 0) {
       err = ETIMEDOUT;
-      ::close(fd);
-      return -1;
+      return UniqueFd();
     }
     socklen_t len = sizeof(err);
-    if (r < 0 || ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &err, &len) != 0 || err != 0) {
+    if (r < 0 || ::getsockopt(fd.get(), SOL_SOCKET, SO_ERROR, &err, &len) != 0 || err != 0) {
       if (r < 0) err = errno;
-      ::close(fd);
-      return -1;
+      return UniqueFd();
     }
   }
   const int one = 1;
-  ::setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof(one));
+  ::setsockopt(fd.get(), IPPROTO_TCP, TCP_NODELAY, &one, sizeof(one));
   return fd;
 }
 
@@ -71,20 +70,15 @@ FrameSocket::FrameSocket(const std::string& host, std::uint16_t port, std::chron
   if (rc != 0) throw ConnectFailed("cannot resolve \"" + host + "\": " + ::gai_strerror(rc));
   std::unique_ptr<addrinfo, decltype(&::freeaddrinfo)> guard(list, &::freeaddrinfo);
   int err = 0;
-  for (const addrinfo* ai = list; ai && fd_ < 0; ai = ai->ai_next) fd_ = connectOne(*ai, connectTimeout, err);
-  if (fd_ < 0) {
+  for (const addrinfo* ai = list; ai && !fd_.valid(); ai = ai->ai_next) fd_ = connectOne(*ai, connectTimeout, err);
+  if (!fd_.valid()) {
     throw ConnectFailed("cannot connect to " + host + ":" + service + ": " + errnoText(err));
   }
 }
 
 FrameSocket::~FrameSocket() { close(); }
 
-void FrameSocket::close() noexcept {
-  if (fd_ >= 0) {
-    ::close(fd_);
-    fd_ = -1;
-  }
-}
+void FrameSocket::close() noexcept { fd_.close(); }
 
 void FrameSocket::fail(const std::string& reason) {
   close();
@@ -92,7 +86,7 @@ void FrameSocket::fail(const std::string& reason) {
 }
 
 void FrameSocket::waitFor(short events, std::chrono::milliseconds timeout) {
-  pollfd p{fd_, events, 0};
+  pollfd p{fd_.get(), events, 0};
   int r;
   do {
     r = ::poll(&p, 1, pollTimeout(timeout));
@@ -102,15 +96,15 @@ void FrameSocket::waitFor(short events, std::chrono::milliseconds timeout) {
 }
 
 void FrameSocket::sendRaw(const void* data, std::size_t size, std::chrono::milliseconds timeout) {
-  if (fd_ < 0) throw ConnectionEnded("the connection is closed", false);
+  if (!fd_.valid()) throw ConnectionEnded("the connection is closed", false);
   const auto* p = static_cast<const unsigned char*>(data);
   while (size > 0) {
-    const ssize_t n = ::send(fd_, p, size, MSG_NOSIGNAL);
+    const ssize_t n = ::send(fd_.get(), p, size, MSG_NOSIGNAL);
     if (n > 0) {
       p += n;
       size -= static_cast<std::size_t>(n);
     } else if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-      pollfd pfd{fd_, POLLOUT, 0};
+      pollfd pfd{fd_.get(), POLLOUT, 0};
       int r;
       do {
         r = ::poll(&pfd, 1, pollTimeout(timeout));
@@ -133,7 +127,7 @@ void FrameSocket::send(const wire::OutFrame& frame, std::chrono::milliseconds ti
 
 void FrameSocket::readExactly(unsigned char* out, std::size_t size, std::chrono::milliseconds timeout) {
   while (size > 0) {
-    const ssize_t n = ::recv(fd_, out, size, 0);
+    const ssize_t n = ::recv(fd_.get(), out, size, 0);
     if (n > 0) {
       out += n;
       size -= static_cast<std::size_t>(n);
@@ -148,7 +142,7 @@ void FrameSocket::readExactly(unsigned char* out, std::size_t size, std::chrono:
 }
 
 FrameSocket::Frame FrameSocket::receive(std::chrono::milliseconds timeout) {
-  if (fd_ < 0) throw ConnectionEnded("the connection is closed", false);
+  if (!fd_.valid()) throw ConnectionEnded("the connection is closed", false);
   unsigned char header[wire::kLengthSize];
   readExactly(header, sizeof(header), timeout);
   const std::uint32_t length = wire::frameLength(header);

@@ -15,6 +15,7 @@
 #include <memory>
 #include <string>
 
+#include "framework/unique_fd.h"
 #include "framework/frame.h"
 #include "framework/wire.h"
 
@@ -45,7 +46,7 @@ class FrameSocket {
   // Receives one frame; timeout bounds each wait for more bytes (0: none).
   Frame receive(std::chrono::milliseconds timeout);
 
-  bool isOpen() const noexcept { return fd_ >= 0; }
+  bool isOpen() const noexcept { return fd_.valid(); }
   void close() noexcept;
 
  private:
@@ -53,7 +54,7 @@ class FrameSocket {
   void readExactly(unsigned char* out, std::size_t size, std::chrono::milliseconds timeout);
   [[noreturn]] void fail(const std::string& reason);
 
-  int fd_ = -1;
+  UniqueFd fd_;
 };
 
 }  // namespace cvdb

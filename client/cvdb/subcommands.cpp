@@ -64,8 +64,12 @@ void printRecord(const Globals& g, const Ipc::PackInfoPtr& p, const std::string&
   }
 }
 
+std::int64_t nowSeconds() {
+  return std::chrono::duration_cast<std::chrono::seconds>(std::chrono::system_clock::now().time_since_epoch()).count();
+}
+
 std::int64_t parseTime(const std::string& text) {
-  if (text == "now") return Ipc::useClockNow();
+  if (text == "now") return nowSeconds();
   try {
     std::size_t used = 0;
     const long long v = std::stoll(text, &used);
@@ -325,7 +329,7 @@ void addPackWrites(CLI::App* pack, const Globals& g, Action& chosen, Args& a) {
                 applyRecordOptions(a, p);
                 // The server creates a pack only from a complete record: a
                 // new pack gets defaults for what the command line left out.
-                const std::int64_t now = Ipc::useClockNow();
+                const std::int64_t now = nowSeconds();
                 if (!c.packInfo(a.id)) {
                   if (!a.name) p.name = a.id;
                   if (!a.owner) p.owner = currentUser();

@@ -25,17 +25,23 @@ using BackupPtr = std::unique_ptr<sqlite3_backup, BackupFinisher>;
 // Removes the copy unless the backup reached its end.
 class PartialCopy {
  public:
-  explicit PartialCopy(fs::path file) : file_(std::move(file)) {}
+  PartialCopy(sys::Env& env, fs::path file) : env_(env), file_(std::move(file)) {}
   ~PartialCopy() {
     if (file_.empty()) return;
-    std::error_code ignored;
-    for (const auto& f : {file_, walFile(file_), shmFile(file_), journalFile(file_)}) fs::remove(f, ignored);
+    for (const auto& f : {file_, walFile(file_), shmFile(file_), journalFile(file_)}) {
+      try {
+        env_.remove(f);
+      } catch (const std::system_error&) {
+        // The backup's own failure is the one reported.
+      }
+    }
   }
   PartialCopy(const PartialCopy&) = delete;
   PartialCopy& operator=(const PartialCopy&) = delete;
   void keep() { file_.clear(); }
 
  private:
+  sys::Env& env_;
   fs::path file_;
 };
 
@@ -67,19 +73,17 @@ void backupInstance(Instance& instance, const fs::path& targetFolder, const Stat
   if (!source) DB::throwEngineError(DB::err::kDatabaseNotFound, where);
   if (pagesPerStep <= 0) pagesPerStep = kBackupPagesPerStep;
 
-  std::error_code ec;
-  fs::create_directories(targetFolder, ec);
-  if (ec) DB::throwEngineError(engineCodeOfErrno(ec.value()), where);
+  sys::Env& env = *instance.settings().env;
+  onFiles(where, [&] { env.createFolders(targetFolder); });
   const fs::path copy = targetFolder / instance.settings().databaseFileName;
-  PartialCopy partial(copy);
+  PartialCopy partial(env, copy);
   {
     // Whatever was there before belongs to an earlier run.
-    for (const auto& f : {copy, walFile(copy), shmFile(copy), journalFile(copy)}) {
-      fs::remove(f, ec);
-      if (ec) DB::throwEngineError(engineCodeOfErrno(ec.value()), where);
-    }
+    onFiles(where, [&] {
+      for (const auto& f : {copy, walFile(copy), shmFile(copy), journalFile(copy)}) env.remove(f);
+    });
 
-    auto from = openConnection(*source, OpenMode::Existing, instance.settings().busyTimeout, where);
+    auto from = openConnection(env, *source, OpenMode::Existing, instance.settings().busyTimeout, where);
     // One read transaction for the whole copy: without it every write of
     // another session would make the copy start over.
     execute(from.get(), "BEGIN", where);
@@ -120,8 +124,8 @@ void backupInstance(Instance& instance, const fs::path& targetFolder, const Stat
     if (finished != SQLITE_OK) throwSqlite(to.get(), finished, where);
     execute(from.get(), "COMMIT", where);
   }
-  syncFile(copy, where);
-  syncFolder(targetFolder, where);
+  syncFile(env, copy, where);
+  syncFolder(env, targetFolder, where);
   partial.keep();
   if (status) status({SnapshotOperation::Backup, StatusKind::Complete, std::nullopt, std::nullopt});
 }

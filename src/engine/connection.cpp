@@ -59,12 +59,18 @@ void ConnectionCloser::operator()(sqlite3* db) const noexcept {
   }
 }
 
-ConnectionPtr openConnection(const std::filesystem::path& file, OpenMode mode, std::chrono::milliseconds busyTimeout,
-                             const std::source_location& where) {
-  std::error_code ec;
-  if (mode == OpenMode::Existing && !std::filesystem::is_regular_file(file, ec)) {
-    DB::throwEngineError(std::filesystem::exists(file, ec) ? DB::err::kFileAccessDenied : DB::err::kFileNotFound,
-                         where);
+ConnectionPtr openConnection(sys::Env& env, const std::filesystem::path& file, OpenMode mode,
+                             std::chrono::milliseconds busyTimeout, const std::source_location& where) {
+  if (mode == OpenMode::Existing) {
+    sys::FileType type = sys::FileType::Missing;
+    try {
+      type = env.stat(file, true).type;
+    } catch (const std::system_error& e) {
+      DB::throwEngineError(engineCodeOfErrno(e.code().value()), where);
+    }
+    if (type != sys::FileType::Regular) {
+      DB::throwEngineError(type == sys::FileType::Missing ? DB::err::kFileNotFound : DB::err::kFileAccessDenied, where);
+    }
   }
   configureLibrary();
   int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE;

@@ -17,6 +17,8 @@
 #include <memory>
 #include <source_location>
 
+#include "framework/env.h"
+
 namespace engine {
 
 struct ConnectionCloser {
@@ -44,7 +46,7 @@ void configureLibrary() noexcept;
 // (checkIdentity, before anything is written to it). CreateNew: the file is
 // created; the caller makes sure that nobody else uses the name and stamps
 // its identity.
-ConnectionPtr openConnection(const std::filesystem::path& file, OpenMode mode,
+ConnectionPtr openConnection(sys::Env& env, const std::filesystem::path& file, OpenMode mode,
                              std::chrono::milliseconds busyTimeout, const std::source_location& where);
 
 // Runs SQL without results (one or more statements); throws on failure.

@@ -1,27 +1,18 @@
 #include "engine/database_file.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <array>
 #include <cerrno>
-#include <fstream>
 #include <string>
 
 #include "engine/connection.h"
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
 #include "framework/log.h"
-#include "framework/unique_fd.h"
 
 namespace engine {
 namespace {
 
 namespace fs = std::filesystem;
-
-[[noreturn]] void throwErrno(int error, const std::source_location& where) {
-  DB::throwEngineError(engineCodeOfErrno(error), where);
-}
 
 std::uint32_t bigEndian32(const unsigned char* p) {
   return (static_cast<std::uint32_t>(p[0]) << 24) | (static_cast<std::uint32_t>(p[1]) << 16) |
@@ -34,8 +25,16 @@ fs::path withSuffix(const fs::path& file, const char* suffix) {
   return result;
 }
 
-void removeIfPresent(const fs::path& file, const std::source_location& where) {
-  if (::unlink(file.c_str()) != 0 && errno != ENOENT) throwErrno(errno, where);
+// Removes the file and its companions, quietly: a clean-up on a failure
+// path, where the first failure is the one to report.
+void removeQuietly(sys::Env& env, const fs::path& file) noexcept {
+  for (const auto& f : {file, walFile(file), shmFile(file), journalFile(file)}) {
+    try {
+      env.remove(f);
+    } catch (const std::system_error&) {
+      // Left for the next attempt, which removes leftovers first.
+    }
+  }
 }
 
 }  // namespace
@@ -70,20 +69,23 @@ void checkIdentity(sqlite3* db, const fs::path& file, const std::source_location
   }
 }
 
-void createDatabaseFile(const fs::path& file, std::chrono::milliseconds busyTimeout,
+void createDatabaseFile(sys::Env& env, const fs::path& file, std::chrono::milliseconds busyTimeout,
                         const std::source_location& where) {
-  std::error_code ec;
-  fs::create_directories(file.parent_path(), ec);
-  if (ec) throwErrno(ec.value(), where);
-  if (fs::exists(file, ec)) DB::throwEngineError(DB::err::kDatabaseDuplicate, where);
+  onFiles(where, [&] {
+    // A folder made here is synced into its parent, as the file is below.
+    for (const auto& made : env.createFolders(file.parent_path())) env.syncFolder(made.parent_path());
+  });
+  if (onFiles(where, [&] { return env.stat(file).type; }) != sys::FileType::Missing) {
+    DB::throwEngineError(DB::err::kDatabaseDuplicate, where);
+  }
 
   // Leftovers of an earlier creation that did not finish belong to nobody.
   const auto building = withSuffix(file, ".creating");
-  removeIfPresent(building, where);
-  removeCompanions(building, where);
+  onFiles(where, [&] { env.remove(building); });
+  removeCompanions(env, building, where);
   try {
     {
-      auto db = openConnection(building, OpenMode::CreateNew, busyTimeout, where);
+      auto db = openConnection(env, building, OpenMode::CreateNew, busyTimeout, where);
       const std::string stamp = "PRAGMA application_id=" + std::to_string(kApplicationId) +
                                 "; PRAGMA user_version=" + std::to_string(kFormatVersion) + ";";
       execute(db.get(), stamp.c_str(), where);
@@ -91,24 +93,26 @@ void createDatabaseFile(const fs::path& file, std::chrono::milliseconds busyTime
       // then removes the write-ahead log.
       execute(db.get(), "PRAGMA wal_checkpoint(TRUNCATE)", where);
     }
-    syncFile(building, where);
+    syncFile(env, building, where);
     // link() fails when the name exists, so a file that appeared meanwhile
     // is never replaced.
-    if (::link(building.c_str(), file.c_str()) != 0) {
-      const int error = errno;
+    try {
+      env.link(building, file);
+    } catch (const std::system_error& e) {
+      const int error = e.code().value();
       if (error == EEXIST) DB::throwEngineError(DB::err::kDatabaseDuplicate, where);
-      if (error != EPERM && error != EOPNOTSUPP) throwErrno(error, where);
+      if (error != EPERM && error != EOPNOTSUPP) throw;
       // A file system without hard links: rename, after a last look.
-      if (fs::exists(file, ec)) DB::throwEngineError(DB::err::kDatabaseDuplicate, where);
-      if (::rename(building.c_str(), file.c_str()) != 0) throwErrno(errno, where);
+      if (env.stat(file).type != sys::FileType::Missing) DB::throwEngineError(DB::err::kDatabaseDuplicate, where);
+      env.rename(building, file);
     }
-    ::unlink(building.c_str());
-    syncFolder(file.parent_path(), where);
+    env.remove(building);
+    env.syncFolder(file.parent_path());
+  } catch (const std::system_error& e) {
+    removeQuietly(env, building);
+    DB::throwEngineError(engineCodeOfErrno(e.code().value()), where);
   } catch (...) {
-    std::error_code ignored;
-    for (const auto& f : {building, walFile(building), shmFile(building), journalFile(building)}) {
-      fs::remove(f, ignored);
-    }
+    removeQuietly(env, building);
     throw;
   }
 }
@@ -117,16 +121,20 @@ fs::path walFile(const fs::path& file) { return withSuffix(file, "-wal"); }
 fs::path shmFile(const fs::path& file) { return withSuffix(file, "-shm"); }
 fs::path journalFile(const fs::path& file) { return withSuffix(file, "-journal"); }
 
-void removeCompanions(const fs::path& file, const std::source_location& where) {
-  removeIfPresent(walFile(file), where);
-  removeIfPresent(shmFile(file), where);
-  removeIfPresent(journalFile(file), where);
+void removeCompanions(sys::Env& env, const fs::path& file, const std::source_location& where) {
+  onFiles(where, [&] {
+    for (const auto& f : {walFile(file), shmFile(file), journalFile(file)}) env.remove(f);
+  });
 }
 
-std::optional<FileHeader> readHeader(const fs::path& file) {
-  std::ifstream in(file, std::ios::binary);
+std::optional<FileHeader> readHeader(sys::Env& env, const fs::path& file) {
   std::array<unsigned char, 100> bytes{};
-  if (!in.read(reinterpret_cast<char*>(bytes.data()), bytes.size())) return std::nullopt;
+  try {
+    const auto in = env.open(file, sys::OpenMode::Read);
+    if (in->readAt(0, bytes.data(), bytes.size()) != bytes.size()) return std::nullopt;
+  } catch (const std::system_error&) {
+    return std::nullopt;
+  }
   static constexpr char kMagic[] = "SQLite format 3";  // with its terminating zero: 16 bytes
   for (std::size_t i = 0; i < sizeof kMagic; ++i) {
     if (bytes[i] != static_cast<unsigned char>(kMagic[i])) return std::nullopt;
@@ -143,16 +151,12 @@ std::optional<FileHeader> readHeader(const fs::path& file) {
   return header;
 }
 
-void syncFile(const fs::path& file, const std::source_location& where) {
-  const UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
-  if (fd.get() < 0) throwErrno(errno, where);
-  if (::fsync(fd.get()) != 0) throwErrno(errno, where);
+void syncFile(sys::Env& env, const fs::path& file, const std::source_location& where) {
+  onFiles(where, [&] { env.open(file, sys::OpenMode::Read)->sync(); });
 }
 
-void syncFolder(const fs::path& folder, const std::source_location& where) {
-  const UniqueFd fd(::open(folder.empty() ? "." : folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (fd.get() < 0) throwErrno(errno, where);
-  if (::fsync(fd.get()) != 0) throwErrno(errno, where);
+void syncFolder(sys::Env& env, const fs::path& folder, const std::source_location& where) {
+  onFiles(where, [&] { env.syncFolder(folder); });
 }
 
 }  // namespace engine

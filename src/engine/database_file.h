@@ -8,8 +8,10 @@
 // database, an empty or half-created file, a newer format) is refused before
 // anything is written to it, so it is never overwritten.
 //
+// Every file operation goes through the given sys::Env.
 // Thread safety: no shared state.
-// Failures: DB::DBExc with an engine code.
+// Failures: DB::DBExc with an engine code; a file-system failure becomes the
+// code of its error number (engineCodeOfErrno).
 
 #include <sqlite3.h>
 
@@ -17,7 +19,11 @@
 #include <cstdint>
 #include <filesystem>
 #include <optional>
+#include <system_error>
 #include <source_location>
+
+#include "engine/db_exc.h"
+#include "framework/env.h"
 
 namespace engine {
 
@@ -35,7 +41,7 @@ void checkIdentity(sqlite3* db, const std::filesystem::path& file, const std::so
 // leaves a file that would be refused later. Missing parent folders are
 // created. Throws kDatabaseDuplicate when the file exists (it is not
 // touched), kFileAccessDenied / kDiskIO / kDiskFull on file-system failures.
-void createDatabaseFile(const std::filesystem::path& file, std::chrono::milliseconds busyTimeout,
+void createDatabaseFile(sys::Env& env, const std::filesystem::path& file, std::chrono::milliseconds busyTimeout,
                         const std::source_location& where);
 
 // The companions SQLite keeps beside a database file.
@@ -44,7 +50,7 @@ std::filesystem::path shmFile(const std::filesystem::path& file);
 std::filesystem::path journalFile(const std::filesystem::path& file);
 // Removes the companions; throws kFileAccessDenied / kDiskIO when one exists
 // and cannot be removed.
-void removeCompanions(const std::filesystem::path& file, const std::source_location& where);
+void removeCompanions(sys::Env& env, const std::filesystem::path& file, const std::source_location& where);
 
 // What the first 100 bytes of a SQLite file say; nullopt when the file
 // cannot be read or is no SQLite file.
@@ -54,15 +60,25 @@ struct FileHeader {
   std::int32_t userVersion = 0;
   std::int32_t applicationId = 0;
 };
-std::optional<FileHeader> readHeader(const std::filesystem::path& file);
+std::optional<FileHeader> readHeader(sys::Env& env, const std::filesystem::path& file);
 
 // The engine code of an operating-system error number (ENOSPC: kDiskFull,
 // EACCES / EPERM / EROFS: kFileAccessDenied, ENOENT: kFileNotFound, others
 // kDiskIO).
 std::int32_t engineCodeOfErrno(int error) noexcept;
 
-// Forces a file's content, or a folder's entries, to disk. Throw kDiskIO.
-void syncFile(const std::filesystem::path& file, const std::source_location& where);
-void syncFolder(const std::filesystem::path& folder, const std::source_location& where);
+// Forces a file's content, or a folder's entries, to disk.
+void syncFile(sys::Env& env, const std::filesystem::path& file, const std::source_location& where);
+void syncFolder(sys::Env& env, const std::filesystem::path& folder, const std::source_location& where);
+
+// Runs f, turning a file-system failure into DB::DBExc with its code.
+template <typename F>
+auto onFiles(const std::source_location& where, F&& f) -> decltype(f()) {
+  try {
+    return f();
+  } catch (const std::system_error& e) {
+    DB::throwEngineError(engineCodeOfErrno(e.code().value()), where);
+  }
+}
 
 }  // namespace engine

@@ -1,42 +1,27 @@
 #include "engine/db_instances.h"
 
-#include <atomic>
 #include <mutex>
 
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
-#include "engine/open_files.h"
+#include "framework/open_files.h"
 #include "framework/log.h"
-#include "service/config.h"
-#include "service/names.h"
+#include "settings/config.h"
 
 namespace DB {
 namespace {
 
-// How long a writer waits for a database's write lock.
-constexpr std::chrono::milliseconds kBusyTimeout{10000};
-
 constexpr const char* kNotAccessible = "Database not accessible! Possible restore operation in progress.";
 
-std::mutex& poolMutex() {
-  static std::mutex mutex;
-  return mutex;
-}
-
-std::atomic<std::shared_ptr<DBInstances>>& singleton() {
-  static std::atomic<std::shared_ptr<DBInstances>> pool;
-  return pool;
-}
-
-void logEngineStart(const DBConfig& config, const engine::OpenFileLimit& files) {
+void logEngineStart(const PoolSettings& settings, const Paths& paths, const sys::OpenFileLimit& files) {
   if (g_LogVerbose) {
     Log::Lock entry(Log::Debug);
     entry.logStreamLine() << "DBInstances: Engine initialized\n"
-                          << "\t\"" << config.DBRoot << "\" is the databases root\n"
-                          << "\t" << config.MaxActiveDBs << " maximum active databases\n"
-                          << "\t" << config.MaxActiveClientsPerDB << " maximum active clients per database\n"
-                          << "\t\"" << config.DBFilesPrefix << "\" database file names prefix\n"
-                          << "\t\"" << config.DBFileName << "\" database file name\n";
+                          << "\t\"" << paths.root() << "\" is the databases root\n"
+                          << "\t" << settings.maxActiveDBs << " maximum active databases\n"
+                          << "\t" << settings.maxClientsPerDB << " maximum active clients per database\n"
+                          << "\t\"" << settings.filesPrefix << "\" database file names prefix\n"
+                          << "\t\"" << paths.dbFileName() << "\" database file name\n";
   }
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine()
@@ -44,62 +29,69 @@ void logEngineStart(const DBConfig& config, const engine::OpenFileLimit& files) 
            "of transaction logs have no effect on this engine: each database's write-ahead log lives beside its "
            "database file";
   }
-  const std::uint64_t needed = 2 * config.MaxActiveDBs * config.MaxActiveClientsPerDB;
+  const std::uint64_t needed = 2 * settings.maxActiveDBs * settings.maxClientsPerDB;
   if (files.after < needed) {
     Log::Lock(Log::Warning).logStreamLine()
         << "DBInstances: the open-file limit is " << files.after << " (hard limit " << files.hard << "), but "
-        << config.MaxActiveDBs << " databases with " << config.MaxActiveClientsPerDB
+        << settings.maxActiveDBs << " databases with " << settings.maxClientsPerDB
         << " clients each may need " << needed << " file descriptors";
   }
 }
 
 }  // namespace
 
-std::shared_ptr<DBInstances> DBInstances::inst() {
-  if (auto pool = singleton().load()) return pool;
-  std::lock_guard lock(poolMutex());
-  if (auto pool = singleton().load()) return pool;
-  auto pool = std::make_shared<DBInstances>(Token{});
-  singleton().store(pool);
-  const auto& config = DBConfig::inst();
-  engine::setMaxInstances(config.MaxActiveDBs);
-  logEngineStart(config, engine::raiseOpenFileLimit());
+PoolSettings PoolSettings::from(const DBConfig& config) {
+  PoolSettings s;
+  s.maxActiveDBs = config.MaxActiveDBs;
+  s.maxClientsPerDB = config.MaxActiveClientsPerDB;
+  s.maxWaitMaintenanceSecs = config.MaxWaitMaintenanceOpSecs;
+  s.filesPrefix = config.DBFilesPrefix;
+  return s;
+}
+
+std::shared_ptr<DBInstances> DBInstances::create(PoolSettings settings, Paths paths, sys::Env& env) {
+  auto pool = std::make_shared<DBInstances>(Token{}, settings, std::move(paths), env);
+  logEngineStart(pool->settings_, pool->paths_, sys::raiseOpenFileLimit());
   return pool;
 }
 
-std::shared_ptr<DBInstances> DBInstances::existing() noexcept { return singleton().load(); }
-
-void DBInstances::teardown() noexcept {
-  std::shared_ptr<DBInstances> old;
-  {
-    std::lock_guard lock(poolMutex());
-    old = singleton().exchange(nullptr);
-    if (old) old->stopEngine(true);
-  }
-  // old goes here, or with the last maintenance hold that still holds it.
-}
-
-DBInstances::DBInstances(Token) {}
+DBInstances::DBInstances(Token, PoolSettings settings, Paths paths, sys::Env& env)
+    : settings_(settings),
+      paths_(std::move(paths)),
+      env_(env),
+      slots_(std::make_shared<engine::InstanceSlots>(settings.maxActiveDBs)) {}
 
 DBInstances::~DBInstances() {
-  // Reached at process exit when the service did not tear the pool down;
+  // Reached when the service did not stop the pool (a test, an early exit);
   // the logging may already be gone then, so this stops quietly.
+  std::lock_guard lock(mutex_);
   if (!stopped_) stopEngine(false);
 }
 
+void DBInstances::stop() noexcept {
+  std::lock_guard lock(mutex_);
+  if (!stopped_) stopEngine(true);
+}
+
+bool DBInstances::stopped() const {
+  std::lock_guard lock(mutex_);
+  return stopped_;
+}
+
 std::shared_ptr<engine::Instance> DBInstances::createInstance(const std::string& dbKey) {
-  const auto& config = DBConfig::inst();
   engine::InstanceSettings settings;
   settings.key = dbKey;
-  settings.instanceFolder = databaseFolder(dbKey);
-  settings.logFolder = logFolder(dbKey);
-  settings.databaseFileName = config.DBFileName;
-  settings.maxSessions = config.MaxActiveClientsPerDB;
-  settings.busyTimeout = kBusyTimeout;
+  settings.instanceFolder = paths_.databaseFolder(dbKey);
+  settings.logFolder = paths_.logFolder(dbKey);
+  settings.databaseFileName = paths_.dbFileName();
+  settings.maxSessions = settings_.maxClientsPerDB;
+  settings.busyTimeout = settings_.busyTimeout;
+  settings.env = &env_;
+  settings.slots = slots_;
   auto instance = engine::Instance::create(std::move(settings));
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Instance I:" << instance->id() << " created for "
-                                          << databaseFolder(dbKey);
+                                          << paths_.databaseFolder(dbKey);
   }
   return instance;
 }
@@ -151,13 +143,13 @@ std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKe
   }
   std::size_t records = 0;
   {
-    std::unique_lock lock(poolMutex());
+    std::unique_lock lock(mutex_);
     if (auto session = sessionOnOpen(lock, dbKey)) return session;
     records = records_.size();
   }
-  if ((DBConfig::inst().MaxActiveDBs * 2) / 3 <= records) closeDormantInstances();
+  if ((settings_.maxActiveDBs * 2) / 3 <= records) closeDormantInstances();
 
-  std::unique_lock lock(poolMutex());
+  std::unique_lock lock(mutex_);
   if (auto session = sessionOnOpen(lock, dbKey)) return session;
 
   auto instance = createInstance(dbKey);
@@ -224,9 +216,11 @@ void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::S
   // file under a connection that is still closing.
   session.reset();
 
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
+  // After the stop, a store that closes late simply ends its session.
+  if (stopped_) return;
   const auto found = records_.find(dbKey);
-  if (stopped_ || found == records_.end() || found->second.instance != instance || found->second.sessions == 0) {
+  if (found == records_.end() || found->second.instance != instance || found->second.sessions == 0) {
     Log::Lock(Log::Error).logStreamLine() << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId
                                           << " released for unknown instance!!!";
     return;
@@ -241,7 +235,7 @@ void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::S
 }
 
 bool DBInstances::closeIfDormant(const std::string& dbKey) noexcept {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end()) return true;
   if (found->second.sessions > 0 || found->second.maintenance) return false;
@@ -251,7 +245,7 @@ bool DBInstances::closeIfDormant(const std::string& dbKey) noexcept {
 }
 
 void DBInstances::closeDormantInstances() noexcept {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   for (auto it = records_.begin(); it != records_.end();) {
     if (it->second.sessions == 0 && !it->second.maintenance) {
       if (g_LogVerbose && it->second.instance) {
@@ -268,7 +262,7 @@ void DBInstances::closeDormantInstances() noexcept {
 
 void DBInstances::discardInstance(const std::string& dbKey, engine::Session& session) noexcept {
   session.detachAll();
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end() || found->second.instance != session.instance()) return;
   closeInstance(found->second);
@@ -276,7 +270,7 @@ void DBInstances::discardInstance(const std::string& dbKey, engine::Session& ses
 }
 
 std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& dbKey, bool set) {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   if (stopped_) {
     if (set) throwEngineError(err::kTermInProgress);
     return nullptr;
@@ -290,7 +284,7 @@ std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& 
 }
 
 std::shared_ptr<engine::Instance> DBInstances::acquireExclusive(const std::string& dbKey, bool set) {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   if (stopped_) {
     if (set) throwEngineError(err::kTermInProgress);
     return nullptr;
@@ -321,9 +315,11 @@ std::shared_ptr<engine::Instance> DBInstances::acquireExclusive(const std::strin
   return found->second.instance;
 }
 
-bool DBInstances::waitTick(std::chrono::milliseconds tick) {
-  std::unique_lock lock(poolMutex());
-  return !stopSignal_.wait_for(lock, tick, [this] { return stopped_; });
+bool DBInstances::waitTick(const std::stop_token& stop) {
+  // An operation's own stop wakes the sleep; the pool's is seen at the
+  // tick's end then (the service stops the operations before the pool).
+  const std::stop_token token = stop.stop_possible() ? stop : stopping_.get_token();
+  return env_.sleepFor(settings_.maintenanceTick, token) && !stop.stop_requested() && !stopped();
 }
 
 void DBInstances::stopEngine(bool log) noexcept {
@@ -337,12 +333,32 @@ void DBInstances::stopEngine(bool log) noexcept {
   }
   records_.clear();
   stopped_ = true;
-  stopSignal_.notify_all();
+  stopping_.request_stop();
   opened_.notify_all();
 }
 
+std::shared_ptr<std::shared_mutex> DBInstances::dataLock(const std::string& dbKey, std::string_view id) {
+  std::shared_ptr<DataLocks> locks;
+  {
+    std::lock_guard lock(mutex_);
+    auto& weak = dataLocks_[dbKey];
+    locks = weak.lock();
+    if (!locks) {
+      // Entries of databases nobody writes to any more go now and then.
+      if (dataLocks_.size() > 4 * settings_.maxActiveDBs) {
+        std::erase_if(dataLocks_, [](const auto& e) { return e.second.expired(); });
+      }
+      locks = std::make_shared<DataLocks>();
+      dataLocks_[dbKey] = locks;
+    }
+  }
+  std::shared_mutex& stripe = locks->stripes[std::hash<std::string_view>{}(id) % kDataLockStripes];
+  // Shares the stripes' lifetime.
+  return std::shared_ptr<std::shared_mutex>(std::move(locks), &stripe);
+}
+
 std::optional<DBInstances::RecordView> DBInstances::record(const std::string& dbKey) const {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end()) return std::nullopt;
   RecordView view;
@@ -356,7 +372,7 @@ std::optional<DBInstances::RecordView> DBInstances::record(const std::string& db
 }
 
 std::size_t DBInstances::recordCount() const {
-  std::lock_guard lock(poolMutex());
+  std::lock_guard lock(mutex_);
   return records_.size();
 }
 

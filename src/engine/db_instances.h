@@ -1,6 +1,8 @@
 #pragma once
-// DB::DBInstances: the process-wide pool of engine instances, one per open
-// database, with their sessions and maintenance holds.
+// DB::DBInstances: the pool of engine instances, one per open database,
+// with their sessions and maintenance holds. The service builds one from
+// its settings, paths and Env and hands it to the layers above; it is also
+// how they reach those paths and that Env.
 //
 // The first session asked for a database creates and initialises its
 // instance and runs the caller's onNewInstance with that session (the store
@@ -22,12 +24,12 @@
 // Record states: absent; open (initialised instance, no hold); shared hold
 // (initialised, held); exclusive hold (uninitialised, held).
 //
-// Ownership: the pool is held by shared pointers: the process-wide one
-// (inst(), released by teardown()) and those of running maintenance holds,
-// so a hold that ends after the teardown finds valid memory. Sessions are
-// owned by their callers and handed back through endSession.
-// Thread safety: one mutex, the pool mutex, guards the singleton pointer and
-// every record; it is held while instances are created, initialised and
+// Ownership: the pool is held by shared pointers: the service's and those of
+// the stores and running maintenance holds, so a store or a hold that ends
+// after the stop finds valid memory. Sessions are owned by their callers
+// and handed back through endSession.
+// Thread safety: one mutex, the pool mutex, guards every record; it is held
+// while instances are created, initialised and
 // terminated and while sessions begin and end. onNewInstance runs without
 // it (attaching a database may replay a large write-ahead log): the record
 // is marked as opening meanwhile, and other callers for the same database
@@ -36,23 +38,44 @@
 // Failures: DB::DBExc (engine codes, or the texts documented per member).
 
 #include <condition_variable>
+#include <stop_token>
 #include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <shared_mutex>
+#include <string_view>
 #include <string>
 #include <unordered_map>
 
 #include "engine/instance.h"
 #include "engine/session.h"
+#include "framework/env.h"
+#include "settings/paths.h"
+
+class DBConfig;
 
 namespace DB {
 
 class InstanceForMaintenance;
 
-class DBInstances {
+// The pool's limits and waits.
+struct PoolSettings {
+  std::uint64_t maxActiveDBs = 100;           // live instances; more fail with kTooManyInstances
+  std::uint64_t maxClientsPerDB = 100;        // sessions per instance; more fail with kOutOfSessions
+  std::int32_t maxWaitMaintenanceSecs = 10;   // ticks a maintenance hold waits
+  std::chrono::milliseconds maintenanceTick{1000};
+  // How long a writer waits for a database's write lock.
+  std::chrono::milliseconds busyTimeout{10000};
+  // Printed at the start; the engine has no use for it.
+  std::string filesPrefix = "cvd";
+
+  static PoolSettings from(const DBConfig& config);
+};
+
+class DBInstances : public std::enable_shared_from_this<DBInstances> {
   struct Token {};
 
  public:
@@ -68,19 +91,23 @@ class DBInstances {
     bool maintenance = false;
   };
 
-  // The pool, created on first use with the process-wide engine settings
-  // (instance limit from MaxActiveDBs, the open-file limit raised).
-  static std::shared_ptr<DBInstances> inst();
-  // The pool if one exists, else null; never creates one (for late callers
-  // such as a connection that closes after the service stopped).
-  static std::shared_ptr<DBInstances> existing() noexcept;
-  // The service's stop: under the pool mutex the singleton is taken away
-  // and its engine stopped (every instance terminated, waiting holds
-  // interrupted). A later inst() creates a new pool. Never throws.
-  static void teardown() noexcept;
+  // A pool for databases below paths, their files and clock through env
+  // (which must outlive the pool). Raises the open-file limit and logs the
+  // engine's start.
+  static std::shared_ptr<DBInstances> create(PoolSettings settings, Paths paths, sys::Env& env);
 
-  DBInstances(Token);
+  DBInstances(Token, PoolSettings settings, Paths paths, sys::Env& env);
   ~DBInstances();
+
+  // The service's stop: every instance terminated, waiting holds
+  // interrupted; later sessions and holds fail with kTermInProgress, and
+  // sessions ended later are simply closed. Never throws.
+  void stop() noexcept;
+  bool stopped() const;
+
+  const PoolSettings& settings() const noexcept { return settings_; }
+  const Paths& paths() const noexcept { return paths_; }
+  sys::Env& env() const noexcept { return env_; }
   DBInstances(const DBInstances&) = delete;
   DBInstances& operator=(const DBInstances&) = delete;
 
@@ -94,7 +121,8 @@ class DBInstances {
 
   // Ends a session that newSession handed out. A session whose database or
   // instance the pool no longer knows is logged as released for an unknown
-  // instance, and ended all the same. Never throws.
+  // instance, and ended all the same; after stop() sessions simply end.
+  // Never throws.
   void endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept;
 
   // True when the database has no instance afterwards: it had none, or it
@@ -109,6 +137,18 @@ class DBInstances {
 
   std::optional<RecordView> record(const std::string& dbKey) const;
   std::size_t recordCount() const;
+  // Instances of this pool not yet terminated.
+  std::uint64_t liveInstances() const noexcept { return slots_->live(); }
+
+  // The lock between the data-file writes of one database and the removal
+  // of its unused data ids: a write into an id holds dataLock(key, id)
+  // shared from its first file operation to its last, and the removal of
+  // an id holds it exclusive from its age check to its last removal, so no
+  // acknowledged write is ever removed by a cleanup running at that moment.
+  // Ids share one of kDataLockStripes locks per database by hash; a lock
+  // lives as long as somebody holds it or the database's entry is kept.
+  static constexpr std::size_t kDataLockStripes = 64;
+  std::shared_ptr<std::shared_mutex> dataLock(const std::string& dbKey, std::string_view id);
 
  private:
   friend class InstanceForMaintenance;
@@ -129,14 +169,24 @@ class DBInstances {
   std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set);
   std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set);
   // Sleeps one tick of a maintenance wait; false when the pool stopped
-  // meanwhile.
-  bool waitTick(std::chrono::milliseconds tick);
+  // meanwhile, or stop (the operation's, when it has one) was requested.
+  bool waitTick(const std::stop_token& stop);
   void stopEngine(bool log) noexcept;
 
-  std::unordered_map<std::string, InstanceRec> records_;  // guarded by the pool mutex
-  bool stopped_ = false;                                   // guarded by the pool mutex
-  std::condition_variable stopSignal_;                     // with the pool mutex
-  std::condition_variable opened_;                         // with the pool mutex: an opening ended
+  const PoolSettings settings_;
+  const Paths paths_;
+  sys::Env& env_;
+  const std::shared_ptr<engine::InstanceSlots> slots_;
+  std::stop_source stopping_;
+
+  struct DataLocks {
+    std::shared_mutex stripes[kDataLockStripes];
+  };
+  std::unordered_map<std::string, std::weak_ptr<DataLocks>> dataLocks_;  // guarded by mutex_
+  mutable std::mutex mutex_;                               // the pool mutex
+  std::unordered_map<std::string, InstanceRec> records_;  // guarded by mutex_
+  bool stopped_ = false;                                   // guarded by mutex_
+  std::condition_variable opened_;                         // with mutex_: an opening ended
 };
 
 }  // namespace DB

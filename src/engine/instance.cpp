@@ -11,30 +11,24 @@ namespace engine {
 namespace {
 
 std::atomic<std::uint64_t> g_nextInstanceId{1};
-std::atomic<std::uint64_t> g_maxInstances{100};
-std::atomic<std::uint64_t> g_liveInstances{0};
-
-// Takes one process-wide instance slot, or returns false at the limit.
-bool takeInstanceSlot() noexcept {
-  auto live = g_liveInstances.load();
-  do {
-    if (live >= g_maxInstances.load()) return false;
-  } while (!g_liveInstances.compare_exchange_weak(live, live + 1));
-  return true;
-}
 
 }  // namespace
 
-void setMaxInstances(std::uint64_t limit) noexcept { g_maxInstances = limit; }
-
-std::uint64_t liveInstances() noexcept { return g_liveInstances.load(); }
+bool InstanceSlots::take() noexcept {
+  auto live = live_.load();
+  do {
+    if (live >= limit_) return false;
+  } while (!live_.compare_exchange_weak(live, live + 1));
+  return true;
+}
 
 std::shared_ptr<Instance> Instance::create(InstanceSettings settings, const std::source_location& where) {
-  if (!takeInstanceSlot()) DB::throwEngineError(DB::err::kTooManyInstances, where);
+  const auto slots = settings.slots;
+  if (slots && !slots->take()) DB::throwEngineError(DB::err::kTooManyInstances, where);
   try {
     return std::make_shared<Instance>(Token{}, std::move(settings));
   } catch (...) {
-    --g_liveInstances;
+    if (slots) slots->give();
     throw;
   }
 }
@@ -52,10 +46,14 @@ void Instance::init(const std::source_location& where) {
   std::lock_guard lock(mutex_);
   if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
   if (state_ == State::Initialised) return;
-  for (const auto& folder : {settings_.instanceFolder, settings_.logFolder}) {
-    std::error_code ec;
-    std::filesystem::create_directories(folder, ec);
-    if (ec) DB::throwEngineError(engineCodeOfErrno(ec.value()), where);
+  try {
+    for (const auto& folder : {settings_.instanceFolder, settings_.logFolder}) {
+      // A folder made here is synced into its parent, so that a database
+      // file created in it later does not vanish with it in a crash.
+      for (const auto& made : settings_.env->createFolders(folder)) settings_.env->syncFolder(made.parent_path());
+    }
+  } catch (const std::system_error& e) {
+    DB::throwEngineError(engineCodeOfErrno(e.code().value()), where);
   }
   state_ = State::Initialised;
 }
@@ -65,7 +63,7 @@ void Instance::term() noexcept {
   if (state_ == State::Terminated) return;
   state_ = State::Terminated;
   attached_.reset();
-  --g_liveInstances;
+  if (settings_.slots) settings_.slots->give();
 }
 
 std::unique_ptr<Session> Instance::beginSession(const std::source_location& where) {

@@ -8,8 +8,9 @@
 // folders and lets sessions begin. A restore works on an uninitialised
 // instance, so no session can open the database meanwhile.
 //
-// Process-wide, the number of live (not terminated) instances is limited by
-// setMaxInstances(); creating one more fails with kTooManyInstances.
+// The number of live (not terminated) instances that share one
+// InstanceSlots is limited (the pool's MaxActiveDBs); creating one more
+// fails with kTooManyInstances.
 //
 // Ownership: shared. The pool holds an instance in its record, and every
 // session holds it too, so a session that ends after its instance was
@@ -19,6 +20,7 @@
 // The write gate serialises the database's writers inside the process
 // (write_gate.h); sessions take it around their write transactions.
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
@@ -29,10 +31,25 @@
 #include <string>
 
 #include "engine/write_gate.h"
+#include "framework/env.h"
 
 namespace engine {
 
 class Session;
+
+// The live instances of one pool, against its limit.
+class InstanceSlots {
+ public:
+  explicit InstanceSlots(std::uint64_t limit) noexcept : limit_(limit) {}
+  // Takes a slot; false at the limit.
+  bool take() noexcept;
+  void give() noexcept { --live_; }
+  std::uint64_t live() const noexcept { return live_.load(); }
+
+ private:
+  const std::uint64_t limit_;
+  std::atomic<std::uint64_t> live_{0};
+};
 
 struct InstanceSettings {
   std::string key;                       // the database key, for log texts
@@ -43,11 +60,12 @@ struct InstanceSettings {
   // How long a writer waits for the database's write lock (in-process and
   // SQLite's) before the attempt counts as a write conflict.
   std::chrono::milliseconds busyTimeout{10000};
+  // The files and the clock of the instance's database and of its
+  // sessions' transactions; outlives the instance.
+  sys::Env* env = &sys::Env::posix();
+  // The limit on live instances this one counts against; none when null.
+  std::shared_ptr<InstanceSlots> slots;
 };
-
-// The process-wide instance limit (default 100).
-void setMaxInstances(std::uint64_t limit) noexcept;
-std::uint64_t liveInstances() noexcept;
 
 class Instance : public std::enable_shared_from_this<Instance> {
   struct Token {};
@@ -55,8 +73,8 @@ class Instance : public std::enable_shared_from_this<Instance> {
  public:
   enum class State { Created, Initialised, Terminated };
 
-  // A new, uninitialised instance. Throws kTooManyInstances when the
-  // process already has the maximum of live instances.
+  // A new, uninitialised instance. Throws kTooManyInstances when its slots
+  // are all taken.
   static std::shared_ptr<Instance> create(InstanceSettings settings,
                                           const std::source_location& where = std::source_location::current());
 
@@ -70,8 +88,8 @@ class Instance : public std::enable_shared_from_this<Instance> {
   const InstanceSettings& settings() const noexcept { return settings_; }
   State state() const;
 
-  // Creates the instance and log folders with missing parents and lets
-  // sessions begin. Throws kFileAccessDenied or kDiskIO when a folder cannot
+  // Creates the instance and log folders with missing parents (each new
+  // level synced into its parent) and lets sessions begin. Throws kFileAccessDenied or kDiskIO when a folder cannot
   // be made (the instance stays uninitialised), kTermInProgress when the
   // instance was terminated. Initialising twice does nothing.
   void init(const std::source_location& where = std::source_location::current());

@@ -1,32 +1,23 @@
 #include "engine/instance_for_maintenance.h"
 
-#include <atomic>
-
 #include "engine/db_exc.h"
 #include "engine/db_instances.h"
 #include "engine/engine_errors.h"
 #include "framework/log.h"
-#include "service/config.h"
 
 namespace DB {
-namespace {
-
-std::atomic<std::chrono::milliseconds::rep> g_tickMs{1000};
-
-}  // namespace
-
-InstanceForMaintenance::InstanceForMaintenance(std::string dbKey, DBProgressCallback* progress, bool exclusive)
-    : pool_(DBInstances::inst()), exclusive_(exclusive), dbKey_(std::move(dbKey)) {
+InstanceForMaintenance::InstanceForMaintenance(std::shared_ptr<DBInstances> pool, std::string dbKey,
+                                               DBProgressCallback* progress, bool exclusive, std::stop_token stop)
+    : pool_(std::move(pool)), exclusive_(exclusive), dbKey_(std::move(dbKey)) {
   handle_ = acquire(true);
   if (handle_) return;
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DBInstances: InstanceForMaintenance for " << dbKey_
                                           << " can not acquire instance handle. Waiting and retrying...";
   }
-  const std::int32_t maxWait = DBConfig::inst().MaxWaitMaintenanceOpSecs;
-  const std::chrono::milliseconds tick(g_tickMs.load());
+  const std::int32_t maxWait = pool_->settings().maxWaitMaintenanceSecs;
   for (std::int64_t n = 1; n <= maxWait; ++n) {
-    if (!pool_->waitTick(tick)) throwEngineError(err::kTermInProgress);
+    if (!pool_->waitTick(stop)) throwEngineError(err::kTermInProgress);
     if (n < 10 || n % 5 == 0) {
       const std::string text = std::string(exclusive_ ? "Waiting for all clients connected to the database to exit ("
                                                       : "Waiting for another database maintenance operation to finish (") +
@@ -53,8 +44,5 @@ std::shared_ptr<engine::Instance> InstanceForMaintenance::acquire(bool set) {
   return exclusive_ ? pool_->acquireExclusive(dbKey_, set) : pool_->acquireShared(dbKey_, set);
 }
 
-std::chrono::milliseconds InstanceForMaintenance::setTickForTesting(std::chrono::milliseconds tick) {
-  return std::chrono::milliseconds(g_tickMs.exchange(tick.count()));
-}
 
 }  // namespace DB

@@ -9,8 +9,9 @@
 // record, so the next session creates a new instance and attaches the
 // (restored) database anew; releasing a shared hold leaves the instance open.
 //
-// Waiting polls once a tick (one second) for at most MaxWaitMaintenanceOpSecs
-// ticks, telling the progress callback (if any) how long it has waited:
+// Waiting polls once a tick (the pool's maintenanceTick, one second) for at
+// most the pool's maxWaitMaintenanceSecs ticks, pausing through the pool's
+// Env, and telling the progress callback (if any) how long it has waited:
 // "Waiting for all clients connected to the database to exit (n/max
 // seconds passed)" or "Waiting for another database maintenance operation
 // to finish (…)", at ticks 1 to 9 and every fifth tick after. The pool mutex
@@ -26,6 +27,7 @@
 
 #include <chrono>
 #include <memory>
+#include <stop_token>
 #include <string>
 
 #include "engine/instance.h"
@@ -37,7 +39,10 @@ class DBInstances;
 
 class InstanceForMaintenance {
  public:
-  InstanceForMaintenance(std::string dbKey, DBProgressCallback* progress, bool exclusive);
+  // A stop request through stop (the operation's) ends the wait like the
+  // pool's stop does.
+  InstanceForMaintenance(std::shared_ptr<DBInstances> pool, std::string dbKey, DBProgressCallback* progress,
+                         bool exclusive, std::stop_token stop = {});
   ~InstanceForMaintenance();
   InstanceForMaintenance(const InstanceForMaintenance&) = delete;
   InstanceForMaintenance& operator=(const InstanceForMaintenance&) = delete;
@@ -46,10 +51,6 @@ class InstanceForMaintenance {
   const std::shared_ptr<engine::Instance>& instance() const noexcept { return handle_; }
   const std::string& dbKey() const noexcept { return dbKey_; }
   bool exclusive() const noexcept { return exclusive_; }
-
-  // For tests: the length of one tick of the wait (one second by default).
-  // Returns the previous length. Not for use while holds are waiting.
-  static std::chrono::milliseconds setTickForTesting(std::chrono::milliseconds tick);
 
  private:
   std::shared_ptr<engine::Instance> acquire(bool set);

@@ -1,9 +1,5 @@
 #include "engine/restore.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <optional>
 #include <string>
 #include <utility>
@@ -15,7 +11,6 @@
 #include "engine/engine_errors.h"
 #include "engine/instance.h"
 #include "framework/log.h"
-#include "framework/unique_fd.h"
 
 namespace engine {
 namespace {
@@ -27,11 +22,16 @@ constexpr std::size_t kCopyChunk = 4 * 1024 * 1024;
 // The copy in the destination folder, removed unless it was put in place.
 class StagedFile {
  public:
-  explicit StagedFile(fs::path file) : file_(std::move(file)) {}
+  StagedFile(sys::Env& env, fs::path file) : env_(env), file_(std::move(file)) {}
   ~StagedFile() {
     if (file_.empty()) return;
-    std::error_code ignored;
-    for (const auto& f : {file_, walFile(file_), shmFile(file_), journalFile(file_)}) fs::remove(f, ignored);
+    for (const auto& f : {file_, walFile(file_), shmFile(file_), journalFile(file_)}) {
+      try {
+        env_.remove(f);
+      } catch (const std::system_error&) {
+        // The restore's own failure is the one reported.
+      }
+    }
   }
   StagedFile(const StagedFile&) = delete;
   StagedFile& operator=(const StagedFile&) = delete;
@@ -39,7 +39,64 @@ class StagedFile {
   void placed() { file_.clear(); }
 
  private:
+  sys::Env& env_;
   fs::path file_;
+};
+
+// The destination's write-ahead log and index, set aside while the restored
+// file takes the database file's place and brought back if that fails: a
+// log may hold committed transactions that no checkpoint has moved into
+// the file yet. Once the new file is in place they are stale (replayed
+// onto the restored file they would corrupt it) and are removed.
+class SetAside {
+ public:
+  SetAside(sys::Env& env, const fs::path& target) : env_(env) {
+    try {
+      for (const auto& f : {walFile(target), shmFile(target), journalFile(target)}) {
+        if (env_.stat(f).type == sys::FileType::Missing) continue;
+        fs::path aside = f;
+        aside += ".replaced";
+        env_.rename(f, aside);
+        moved_.emplace_back(f, aside);
+      }
+    } catch (...) {
+      bringBack();
+      throw;
+    }
+  }
+  ~SetAside() {
+    if (placed_) {
+      removeAside();
+    } else {
+      bringBack();
+    }
+  }
+  SetAside(const SetAside&) = delete;
+  SetAside& operator=(const SetAside&) = delete;
+  void placed() { placed_ = true; }
+
+ private:
+  void bringBack() noexcept { settle(false); }
+  void removeAside() noexcept { settle(true); }
+  void settle(bool remove) noexcept {
+    for (const auto& [original, aside] : moved_) {
+      try {
+        if (remove) {
+          env_.remove(aside);
+        } else {
+          env_.rename(aside, original);
+        }
+      } catch (const std::system_error& e) {
+        Log::Lock(Log::Error).logStreamLine() << "Engine: restore could not " << (remove ? "remove" : "bring back")
+                                              << " \"" << aside.string() << "\": " << e.what();
+      }
+    }
+    moved_.clear();
+  }
+
+  sys::Env& env_;
+  std::vector<std::pair<fs::path, fs::path>> moved_;
+  bool placed_ = false;
 };
 
 [[noreturn]] void refuse(const fs::path& backupFolder, const std::string& reason, const std::source_location& where) {
@@ -48,95 +105,84 @@ class StagedFile {
   DB::throwEngineError(DB::err::kBadBackupFormat, where);
 }
 
-[[noreturn]] void throwErrno(int error, const std::source_location& where) {
-  DB::throwEngineError(engineCodeOfErrno(error), where);
-}
-
 bool isOurs(const FileHeader& header) { return header.applicationId == kApplicationId; }
 
 // The database file of the backup: the one under the configured name, or
 // else the only file that carries our identity (a backup taken while the
 // server used another file name).
-std::optional<fs::path> findDatabase(const fs::path& folder, const std::string& fileName) {
-  std::error_code ec;
-  if (fs::is_regular_file(folder / fileName, ec)) return folder / fileName;
+std::optional<fs::path> findDatabase(sys::Env& env, const fs::path& folder, const std::string& fileName) {
+  if (env.stat(folder / fileName).type == sys::FileType::Regular) return folder / fileName;
   std::optional<fs::path> found;
-  for (fs::directory_iterator it(folder, ec), end; !ec && it != end; it.increment(ec)) {
-    if (!it->is_regular_file(ec)) continue;
-    const auto header = readHeader(it->path());
+  for (const auto& entry : env.list(folder)) {
+    if (entry.type != sys::FileType::Regular) continue;
+    const auto header = readHeader(env, folder / entry.name);
     if (!header || !isOurs(*header)) continue;
     if (found) return std::nullopt;  // two candidates: none is the one
-    found = it->path();
+    found = folder / entry.name;
   }
   return found;
 }
 
-void checkHeader(const fs::path& backupFolder, const fs::path& file, const std::source_location& where) {
-  const auto header = readHeader(file);
-  if (!header) refuse(backupFolder, "\"" + file.filename().string() + "\" is not a database of this engine", where);
-  if (!isOurs(*header) || header->userVersion < 1) {
-    refuse(backupFolder, "\"" + file.filename().string() + "\" is not a database of this server", where);
-  }
+// The header's facts that the copy relies on: a SQLite page size (a power
+// of two from 512 to 65,536; another value would divide by zero or
+// misplace every page) and, when the header records one, a page count the
+// file's size can hold.
+FileHeader checkHeader(sys::Env& env, const fs::path& backupFolder, const fs::path& file,
+                       const std::source_location& where) {
+  const std::string name = "\"" + file.filename().string() + "\"";
+  const auto header = readHeader(env, file);
+  if (!header) refuse(backupFolder, name + " is not a database of this engine", where);
+  if (!isOurs(*header) || header->userVersion < 1) refuse(backupFolder, name + " is not a database of this server", where);
   if (header->userVersion > kFormatVersion) {
     refuse(backupFolder,
-           "\"" + file.filename().string() + "\" has format version " + std::to_string(header->userVersion) +
-               ", newer than this server's " + std::to_string(kFormatVersion),
+           name + " has format version " + std::to_string(header->userVersion) + ", newer than this server's " +
+               std::to_string(kFormatVersion),
            where);
   }
-  std::error_code ec;
-  const auto size = fs::file_size(file, ec);
-  if (ec) throwErrno(ec.value(), where);
-  if (header->pageCount && size < std::uint64_t{*header->pageCount} * header->pageSize) {
+  const std::uint32_t page = header->pageSize;
+  if (page < 512 || page > 65536 || (page & (page - 1)) != 0) {
+    refuse(backupFolder, name + " has an invalid page size (" + std::to_string(page) + ")", where);
+  }
+  const auto size = onFiles(where, [&] { return env.stat(file, true).size; });
+  if (header->pageCount && size < std::uint64_t{*header->pageCount} * page) {
     refuse(backupFolder,
-           "\"" + file.filename().string() + "\" is truncated (" + std::to_string(size) + " bytes of " +
-               std::to_string(std::uint64_t{*header->pageCount} * header->pageSize) + ")",
+           name + " is truncated (" + std::to_string(size) + " bytes of " +
+               std::to_string(std::uint64_t{*header->pageCount} * page) + ")",
            where);
   }
+  return *header;
 }
 
-void copyFile(const fs::path& from, const fs::path& to, std::uint32_t pageSize, const StatusCallback& status,
-              const std::source_location& where) {
-  UniqueFd in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
-  if (in.get() < 0) throwErrno(errno, where);
-  UniqueFd out(::open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
-  if (out.get() < 0) throwErrno(errno, where);
-  std::error_code ec;
-  const auto size = fs::file_size(from, ec);
-  if (ec) throwErrno(ec.value(), where);
-  const auto total = static_cast<std::uint32_t>((size + pageSize - 1) / pageSize);
-
-  std::vector<char> buffer(kCopyChunk);
-  std::uint64_t copied = 0;
-  std::uint64_t lastPercent = 0;
-  for (;;) {
-    const auto n = ::read(in.get(), buffer.data(), buffer.size());
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) throwErrno(errno, where);
-    if (n == 0) break;
-    for (ssize_t written = 0; written < n;) {
-      const auto w = ::write(out.get(), buffer.data() + written, static_cast<std::size_t>(n - written));
-      if (w < 0 && errno == EINTR) continue;
-      if (w < 0) throwErrno(errno, where);
-      written += w;
+void copyFile(sys::Env& env, const fs::path& from, const fs::path& to, std::uint32_t pageSize,
+              const StatusCallback& status, const std::source_location& where) {
+  onFiles(where, [&] {
+    const auto in = env.open(from, sys::OpenMode::Read);
+    const auto out = env.open(to, sys::OpenMode::CreateOrTruncate);
+    const auto total = static_cast<std::uint32_t>((in->size() + pageSize - 1) / pageSize);
+    std::vector<char> buffer(kCopyChunk);
+    std::uint64_t copied = 0;
+    std::uint64_t lastPercent = 0;
+    for (std::size_t n; (n = in->read(buffer.data(), buffer.size())) > 0;) {
+      out->write(buffer.data(), n);
+      copied += n;
+      const auto done = static_cast<std::uint32_t>(copied / pageSize);
+      const std::uint64_t percent = total == 0 ? 100 : std::uint64_t{done} * 100 / total;
+      if (status && percent > lastPercent) {
+        status({SnapshotOperation::Restore, StatusKind::Progress, done, total});
+        lastPercent = percent;
+      }
     }
-    copied += static_cast<std::uint64_t>(n);
-    const auto done = static_cast<std::uint32_t>(copied / pageSize);
-    const std::uint64_t percent = total == 0 ? 100 : std::uint64_t{done} * 100 / total;
-    if (status && percent > lastPercent) {
-      status({SnapshotOperation::Restore, StatusKind::Progress, done, total});
-      lastPercent = percent;
-    }
-  }
-  if (::fdatasync(out.get()) != 0) throwErrno(errno, where);
-  if (out.close() != 0) throwErrno(errno, where);
+    out->sync();
+    out->close();
+  });
 }
 
 // SQLite's quick check on the staged copy (never on the backup itself,
 // which stays as it was unpacked).
-void checkContent(const fs::path& backupFolder, const fs::path& staged, const Instance& instance,
+void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& staged, const Instance& instance,
                   const std::source_location& where) {
   try {
-    auto db = openConnection(staged, OpenMode::Existing, instance.settings().busyTimeout, where);
+    auto db = openConnection(env, staged, OpenMode::Existing, instance.settings().busyTimeout, where);
     sqlite3_stmt* raw = nullptr;
     int rc = sqlite3_prepare_v2(db.get(), "PRAGMA quick_check", -1, &raw, nullptr);
     std::string verdict;
@@ -163,7 +209,7 @@ void checkContent(const fs::path& backupFolder, const fs::path& staged, const In
       default: throw;
     }
   }
-  removeCompanions(staged, where);
+  removeCompanions(env, staged, where);
 }
 
 }  // namespace
@@ -171,29 +217,30 @@ void checkContent(const fs::path& backupFolder, const fs::path& staged, const In
 void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs::path& destinationFolder,
                      const StatusCallback& status, const std::source_location& where) {
   if (instance.state() != Instance::State::Created) DB::throwEngineError(DB::err::kAfterInitialization, where);
+  sys::Env& env = *instance.settings().env;
   const auto& fileName = instance.settings().databaseFileName;
-  const auto source = findDatabase(backupFolder, fileName);
+  const auto source = onFiles(where, [&] { return findDatabase(env, backupFolder, fileName); });
   if (!source) refuse(backupFolder, "no database file \"" + fileName + "\" of this server in it", where);
-  checkHeader(backupFolder, *source, where);
+  const FileHeader header = checkHeader(env, backupFolder, *source, where);
 
-  std::error_code ec;
-  fs::create_directories(destinationFolder, ec);
-  if (ec) throwErrno(ec.value(), where);
+  onFiles(where, [&] { env.createFolders(destinationFolder); });
   const fs::path target = destinationFolder / fileName;
   fs::path stagedName = target;
   stagedName += ".restoring";
-  StagedFile staged(stagedName);
+  StagedFile staged(env, stagedName);
 
   if (status) status({SnapshotOperation::Restore, StatusKind::Begin, std::nullopt, std::nullopt});
-  copyFile(*source, staged.path(), readHeader(*source)->pageSize, status, where);
-  checkContent(backupFolder, staged.path(), instance, where);
+  copyFile(env, *source, staged.path(), header.pageSize, status, where);
+  checkContent(env, backupFolder, staged.path(), instance, where);
 
-  // Nobody has the destination open (the instance is not initialised), so
-  // what lies beside it is stale.
-  removeCompanions(target, where);
-  if (::rename(staged.path().c_str(), target.c_str()) != 0) throwErrno(errno, where);
-  staged.placed();
-  syncFolder(destinationFolder, where);
+  // Nobody has the destination open (the instance is not initialised).
+  onFiles(where, [&] {
+    SetAside companions(env, target);
+    env.rename(staged.path(), target);
+    staged.placed();
+    companions.placed();
+  });
+  syncFolder(env, destinationFolder, where);
   if (status) status({SnapshotOperation::Restore, StatusKind::Complete, std::nullopt, std::nullopt});
 }
 

@@ -18,7 +18,12 @@
 // database file of this engine; kAfterInitialization when the instance is
 // initialised; the file-system failure otherwise. On failure the
 // destination's database file and its companions are as they were, and no
-// temporary file stays behind.
+// temporary file stays behind; the one exception is a failure of the
+// folder's sync after the new file took the old one's place, which reports
+// the failure with the new file in place. The destination's write-ahead log
+// and index are set aside (as "<file>-wal.replaced" and so on) until the
+// new file is in place, so a failed placement keeps the committed
+// transactions a log may hold.
 
 #include <filesystem>
 #include <source_location>

@@ -40,7 +40,7 @@ void Session::checkInstanceLive(const std::source_location& where) const {
 }
 
 void Session::open(const std::filesystem::path& file, const std::source_location& where) {
-  db_ = openConnection(file, OpenMode::Existing, instance_->settings().busyTimeout, where);
+  db_ = openConnection(*instance_->settings().env, file, OpenMode::Existing, instance_->settings().busyTimeout, where);
 }
 
 std::int32_t Session::attachDatabase(const std::filesystem::path& file, const std::source_location& where) {
@@ -58,7 +58,7 @@ std::int32_t Session::attachDatabase(const std::filesystem::path& file, const st
 void Session::createDatabase(const std::filesystem::path& file, const std::source_location& where) {
   checkInstanceLive(where);
   if (db_) DB::throwEngineError(DB::err::kTooManyAttachedDatabases, where);
-  createDatabaseFile(file, instance_->settings().busyTimeout, where);
+  createDatabaseFile(*instance_->settings().env, file, instance_->settings().busyTimeout, where);
   open(file, where);
   try {
     instance_->attach(file, where);

@@ -2,11 +2,10 @@
 
 #include <algorithm>
 #include <array>
-#include <mutex>
 #include <random>
-#include <thread>
 
 #include "engine/engine_errors.h"
+#include "engine/instance.h"
 #include "framework/log.h"
 
 namespace DB {
@@ -23,9 +22,6 @@ constexpr std::array<std::int32_t, 13> kRetryable = [] {
   std::sort(codes.begin(), codes.end());
   return codes;
 }();
-
-std::mutex g_pauseMutex;
-Transaction::Pause g_pause;  // guarded by g_pauseMutex; empty: sleep
 
 }  // namespace
 
@@ -58,9 +54,28 @@ bool Transaction::isRetryableCode(std::int32_t code) noexcept {
   return std::binary_search(kRetryable.begin(), kRetryable.end(), code);
 }
 
+bool Transaction::isConflictCode(std::int32_t code) noexcept {
+  switch (code) {
+    case err::kWriteConflict:
+    case err::kWriteConflictPrimaryIndex:
+    case err::kRollbackRequired:
+    case err::kTableLocked:
+    case err::kTableInUse: return true;
+    default: return false;
+  }
+}
+
 bool Transaction::isRetryable(const DBExc& error) noexcept {
   if (!isRetryableCode(error.code())) return false;
   retryRequested_ = true;
+  if (!isConflictCode(error.code())) {
+    try {
+      Log::Lock(Log::Warning).logStreamLine() << "Transaction::retry S:" << session_.id() << " retries engine error "
+                                              << error.code() << ", which does not normally go away on retry";
+    } catch (const std::exception&) {
+      // The retry goes on without its log line.
+    }
+  }
   return true;
 }
 
@@ -93,7 +108,9 @@ void Transaction::beginWithRetry() {
 
 void Transaction::countAttempt() {
   ++attempts_;
-  if (attempts_ > kMaxRetries) throw DBExc("Transaction made too many attmepts to gain access to a locked item");
+  if (attempts_ > kMaxRetries || paused_ >= kMaxPauseTotal) {
+    throw DBExc("Transaction made too many attmepts to gain access to a locked item");
+  }
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "Transaction::retry" << " S:" << session_.id() << " " << attempts_
                                           << " attempt(s) so far.";
@@ -107,21 +124,8 @@ void Transaction::pause() {
   std::mt19937 generator(source());
   std::uniform_int_distribution<int> draw(0, kMaxPauseMs);
   const std::chrono::milliseconds duration(draw(generator));
-  Pause injected;
-  {
-    std::lock_guard lock(g_pauseMutex);
-    injected = g_pause;
-  }
-  if (injected) {
-    injected(duration);
-  } else {
-    std::this_thread::sleep_for(duration);
-  }
-}
-
-Transaction::Pause Transaction::setPauseForTesting(Pause pause) {
-  std::lock_guard lock(g_pauseMutex);
-  return std::exchange(g_pause, std::move(pause));
+  paused_ += duration;
+  session_.instance()->settings().env->sleepFor(duration);
 }
 
 }  // namespace DB

@@ -7,11 +7,15 @@
 // runInTransaction begins a write transaction, runs the body and commits.
 // When the body or the commit fails with a retryable engine code (a write
 // conflict and its kin, isRetryableCode), the transaction is rolled back,
-// the thread pauses for a random 0 to 1000 ms (holding no lock), a new
+// the thread pauses for a random 0 to 1000 ms (holding no lock; through the
+// instance's Env, so tests run the pauses on a clock of their own), a new
 // transaction begins and the body runs again from its start; the body must
 // therefore recompute anything it keeps outside the engine. After 120
-// retries it gives up with "Transaction made too many attmepts to gain
-// access to a locked item". Other failures pass on at once, after rollback.
+// retries, or once the pauses add up to kMaxPauseTotal (so that a command
+// is never held for minutes), it gives up with "Transaction made too many
+// attmepts to gain access to a locked item". Other failures pass on at
+// once, after rollback. A retried code that does not normally go away on
+// retry (anything but a conflict or a lock) is logged at warning level.
 //
 // On this engine the write lock is taken when the transaction begins, so a
 // conflict can also show at the begin (a wait for the lock beyond the busy
@@ -42,6 +46,7 @@ class Transaction {
  public:
   static constexpr std::uint64_t kMaxRetries = 120;
   static constexpr int kMaxPauseMs = 1000;
+  static constexpr std::chrono::milliseconds kMaxPauseTotal{30000};
 
   struct RetryBegin {};
   static constexpr RetryBegin kRetryBegin{};
@@ -70,22 +75,20 @@ class Transaction {
 
   // The 13 codes that ask for another attempt.
   static bool isRetryableCode(std::int32_t code) noexcept;
-
-  // For tests: replaces the pause (it receives the drawn duration) and
-  // returns the previous one; an empty function restores the real sleep.
-  // Not for use while transactions run on other threads.
-  using Pause = std::function<void(std::chrono::milliseconds)>;
-  static Pause setPauseForTesting(Pause pause);
+  // The retryable codes of conflicts and locks, which go away when the
+  // other writer is done; the others are retried but logged.
+  static bool isConflictCode(std::int32_t code) noexcept;
 
  private:
   void beginWithRetry();
   void countAttempt();
-  static void pause();
+  void pause();
 
   engine::Session& session_;
   bool active_ = false;
   bool retryRequested_ = false;
   std::uint64_t attempts_ = 0;
+  std::chrono::milliseconds paused_{0};
 };
 
 // Runs body (no arguments) inside a write transaction with retry, commits,

@@ -18,7 +18,7 @@ namespace {
 namespace asio = boost::asio;
 using tcp = asio::ip::tcp;
 
-int openReserve() { return ::open("/dev/null", O_RDONLY | O_CLOEXEC); }
+UniqueFd openReserve() { return UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)); }
 
 bool outOfDescriptors(const boost::system::error_code& ec) {
   return ec == asio::error::no_descriptors || ec == boost::system::errc::too_many_files_open_in_system ||
@@ -33,9 +33,7 @@ Acceptor::Acceptor(std::shared_ptr<ServerCore> core)
       retry_(acceptor_.get_executor()),
       reserveFd_(openReserve()) {}
 
-Acceptor::~Acceptor() {
-  if (reserveFd_ >= 0) ::close(reserveFd_);
-}
+Acceptor::~Acceptor() = default;
 
 bool Acceptor::open(std::uint16_t port, bool forceIp4) {
   boost::system::error_code ec;
@@ -123,14 +121,10 @@ void Acceptor::onAccept(const boost::system::error_code& ec, StrandSocket socket
 }
 
 bool Acceptor::refuseOne() {
-  if (reserveFd_ >= 0) {
-    ::close(reserveFd_);
-    reserveFd_ = -1;
-  }
-  const int fd = ::accept4(acceptor_.native_handle(), nullptr, nullptr, SOCK_CLOEXEC);
-  if (fd >= 0) ::close(fd);
+  reserveFd_.close();
+  const UniqueFd refused(::accept4(acceptor_.native_handle(), nullptr, nullptr, SOCK_CLOEXEC));
   reserveFd_ = openReserve();
-  return fd >= 0;
+  return refused.valid();
 }
 
 void Acceptor::retryLater() {

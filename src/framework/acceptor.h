@@ -21,6 +21,7 @@
 #include <cstdint>
 #include <memory>
 
+#include "framework/unique_fd.h"
 #include "framework/connection.h"
 
 namespace Ipc::detail {
@@ -54,7 +55,7 @@ class Acceptor : public std::enable_shared_from_this<Acceptor> {
   StrandAcceptor acceptor_;
   StrandTimer retry_;
   std::uint16_t port_ = 0;
-  int reserveFd_ = -1;
+  UniqueFd reserveFd_;
   bool starved_ = false;  // in a burst of descriptor exhaustion
   bool stopped_ = false;
 };

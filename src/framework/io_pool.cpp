@@ -1,5 +1,7 @@
 #include "framework/io_pool.h"
 
+#include "framework/unique_fd.h"
+
 #include <fcntl.h>
 #include <pthread.h>
 #include <sys/types.h>
@@ -25,14 +27,11 @@ struct Slot {
   // When the thread's current command began (steady clock, ns); 0 while
   // the thread is not in a command.
   std::atomic<std::int64_t> since{0};
-  int statFd = -1;  // /proc/self/task/<tid>/stat, for the thread's state
+  UniqueFd statFd;  // /proc/self/task/<tid>/stat, for the thread's state
 
   Slot() {
     const std::string stat = "/proc/self/task/" + std::to_string(::gettid()) + "/stat";
-    statFd = ::open(stat.c_str(), O_RDONLY | O_CLOEXEC);
-  }
-  ~Slot() {
-    if (statFd >= 0) ::close(statFd);
+    statFd = UniqueFd(::open(stat.c_str(), O_RDONLY | O_CLOEXEC));
   }
   Slot(const Slot&) = delete;
   Slot& operator=(const Slot&) = delete;
@@ -40,9 +39,9 @@ struct Slot {
   // Waiting for the disk (state D: a sync, a read of the file system);
   // unknown counts as not waiting.
   bool waitingForDisk() const noexcept {
-    if (statFd < 0) return false;
+    if (!statFd.valid()) return false;
     char buf[512];
-    const ssize_t n = ::pread(statFd, buf, sizeof buf - 1, 0);
+    const ssize_t n = ::pread(statFd.get(), buf, sizeof buf - 1, 0);
     if (n <= 0) return false;
     buf[n] = 0;
     // "tid (name) S ...": the name may hold anything but ends at the last ')'.

@@ -157,7 +157,9 @@ class PosixEnv final : public Env {
 
   std::vector<Path> createFolders(const Path& folder) override {
     std::vector<Path> missing;
-    for (Path level = folder; !level.empty(); level = level.parent_path()) {
+    Path target = folder;
+    if (!target.has_filename() && target.has_parent_path()) target = target.parent_path();  // "a/b/" is "a/b"
+    for (Path level = target; !level.empty(); level = level.parent_path()) {
       struct stat info {};
       if (::stat(level.c_str(), &info) == 0) break;
       if (errno != ENOENT) fail(errno, "look at", level);

@@ -11,6 +11,7 @@
 #include <thread>
 
 #include "framework/log.h"
+#include "framework/open_files.h"
 #include "framework/platform.h"
 
 namespace Service {
@@ -36,22 +37,15 @@ void blockStopSignals() {
 // Many idle client connections each hold a descriptor; the soft limit is
 // often far below what the system allows the process.
 void raiseFileLimit() {
-  rlimit limit{};
-  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
-  if (limit.rlim_cur >= limit.rlim_max) return;
-  const rlim_t before = limit.rlim_cur;
-  limit.rlim_cur = limit.rlim_max;
-  if (::setrlimit(RLIMIT_NOFILE, &limit) != 0) {
-    limit.rlim_cur = std::min<rlim_t>(limit.rlim_max, 1048576);
-    if (::setrlimit(RLIMIT_NOFILE, &limit) != 0) {
-      Log::Lock entry(Log::Warning);
-      entry.logStreamLine() << "Cannot raise the open-file limit from " << before << ": " << std::strerror(errno);
-      return;
+  const sys::OpenFileLimit limit = sys::raiseOpenFileLimit();
+  if (limit.after == limit.before) {
+    if (limit.before < limit.hard) {
+      Log::Lock(Log::Warning).logStreamLine() << "Cannot raise the open-file limit from " << limit.before;
     }
+    return;
   }
   if (g_LogVerbose) {
-    Log::Lock entry(Log::Debug);
-    entry.logStreamLine() << "Open-file limit raised from " << before << " to " << limit.rlim_cur;
+    Log::Lock(Log::Debug).logStreamLine() << "Open-file limit raised from " << limit.before << " to " << limit.after;
   }
 }
 

@@ -9,8 +9,9 @@
 #include <vector>
 
 #include "ipc/listener.h"
-#include "service/config.h"
-#include "service/names.h"
+#include "engine/db_instances.h"
+#include "store/catalog.h"
+#include "settings/names.h"
 #include "store/db_local.h"
 
 namespace Ipc::DB {
@@ -35,7 +36,7 @@ void Listener::process(Connect& cmd) {
   // The previous binding goes first, giving its session back; the new one
   // stays installed, closed, if opening fails below.
   slot.reset();
-  slot = std::make_unique<ConnDB>(dbName);
+  slot = std::make_unique<ConnDB>(pool_, dbName);
   ::DB::DBLocal& db = static_cast<ConnDB&>(*slot).db;
   switch (cmd.openMode()) {
     case 0: db.exists(false); break;
@@ -51,26 +52,9 @@ void Listener::process(Connect& cmd) {
 }
 
 void Listener::process(DBNames& cmd) {
-  namespace fs = std::filesystem;
-  const DBConfig& config = DBConfig::inst();
-  const fs::path root(config.DBRoot);
-  std::vector<std::string> names;
   // A server that has not created any database yet has no root folder:
   // that is an empty list, not a failure.
-  std::error_code ec;
-  if (!fs::is_directory(root, ec)) {
-    cmd.setResp(std::move(names));
-    return;
-  }
-  for (const fs::directory_entry& top : fs::directory_iterator(root)) {
-    if (!top.is_directory() || !::DB::isDBFolderName(top.path().filename().string())) continue;
-    for (const fs::directory_entry& e : fs::recursive_directory_iterator(top.path())) {
-      if (e.is_regular_file() && e.path().filename().string() == config.DBFileName) {
-        names.push_back(::DB::nameFromRelativeFolder(e.path().parent_path().lexically_relative(root).generic_string()));
-      }
-    }
-  }
-  cmd.setResp(std::move(names));
+  cmd.setResp(::DB::databaseKeys(pool_->env(), pool_->paths()));
 }
 
 void Listener::process(GetCfgPart& cmd) {

@@ -6,16 +6,18 @@
 
 namespace Ipc::DB {
 
-Listener::ConnDB::ConnDB(std::string_view dbName) : db(dbName) {}
+Listener::ConnDB::ConnDB(std::shared_ptr<::DB::DBInstances> pool, std::string_view dbName)
+    : db(std::move(pool), dbName) {}
 
 Listener::ConnDB::~ConnDB() = default;
 
-Listener::Listener(Passkey, Responder respond) : respond_(std::move(respond)) {}
+Listener::Listener(Passkey, Responder respond, std::shared_ptr<::DB::DBInstances> pool)
+    : respond_(std::move(respond)), pool_(std::move(pool)) {}
 
 Listener::~Listener() = default;
 
-std::shared_ptr<Listener> Listener::createDetached(Responder respond) {
-  return std::make_shared<Listener>(Passkey(), std::move(respond));
+std::shared_ptr<Listener> Listener::createDetached(Responder respond, std::shared_ptr<::DB::DBInstances> pool) {
+  return std::make_shared<Listener>(Passkey(), std::move(respond), std::move(pool));
 }
 
 std::shared_ptr<Ipc::CmdI> Listener::makeCmd(std::uint8_t tag) {

@@ -20,6 +20,7 @@
 #include <string_view>
 
 #include "framework/svc_stub.h"
+#include "ipc/maintenance_runner.h"
 #include "protocol/commands.h"
 #include "protocol/processor.h"
 #include "store/db_local.h"
@@ -35,7 +36,7 @@ class Listener final : public CmdProcessorDBI {
   // the binding gives the store's session back.
   class ConnDB : public Ipc::ConnInf {
    public:
-    explicit ConnDB(std::string_view dbName);
+    ConnDB(std::shared_ptr<::DB::DBInstances> pool, std::string_view dbName);
     ~ConnDB() override;
 
     ::DB::DBLocal db;
@@ -47,7 +48,7 @@ class Listener final : public CmdProcessorDBI {
 
   // For tests: a Listener without a command server whose processed commands
   // go to respond instead.
-  static std::shared_ptr<Listener> createDetached(Responder respond);
+  static std::shared_ptr<Listener> createDetached(Responder respond, std::shared_ptr<::DB::DBInstances> pool);
 
   ~Listener() override;
   Listener(const Listener&) = delete;
@@ -68,6 +69,11 @@ class Listener final : public CmdProcessorDBI {
 
   // Logs "Ipc " + text (priority 4).
   void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
+
+  // The service's stop: asks every running maintenance operation to stop
+  // at its next safe point and waits for them (bounded); later maintenance
+  // commands fail with "Server is stopping". Call before the pool stops.
+  void stopMaintenance();
 
   // The store of the command's connection (its binding's db), looked up
   // anew by each command; throws std::runtime_error "No database
@@ -101,23 +107,43 @@ class Listener final : public CmdProcessorDBI {
   class Passkey {
     explicit Passkey() = default;
     friend class Listener;
-    friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+    friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
+                                                    std::shared_ptr<::DB::DBInstances> pool);
   };
 
  public:
-  Listener(Passkey, Responder respond);
+  Listener(Passkey, Responder respond, std::shared_ptr<::DB::DBInstances> pool);
 
  private:
-  friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+  friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
+                                                  std::shared_ptr<::DB::DBInstances> pool);
   friend Ipc::SvcStub& serverOf(Listener& listener);
 
+  // What a maintenance command runs on its thread, on the connection's
+  // store: ownership of the callback passes to it.
+  using MaintenanceWork =
+      std::function<void(::DB::DBLocal&, std::unique_ptr<::DB::DBProgressCallback>, std::stop_token)>;
+  // Sends the start text, then runs work on a maintenance thread; the
+  // client receives, in this order, the start text, everything the work
+  // reports, on failure one message at 100 with "DB operation failed with
+  // error: " and the failure's text, and the end of the stream. A failure
+  // (also "No database associated with current connection. Connect command
+  // failed?" for a connection without a database) is logged as "Async
+  // command X failed with ..." and ends the connection after the stream.
+  void runAsync(ProgressCmdsBase& cmd, const std::string& startText, MaintenanceWork work);
+
   Responder respond_;
+  // The databases' pool, with their paths and the Env: what every
+  // connection's store works with.
+  const std::shared_ptr<::DB::DBInstances> pool_;
+  MaintenanceRunner maintenance_;
   std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
 };
 
 // Builds the Listener and its command server on the port (0: any free
-// port); throws std::runtime_error when the port cannot be bound.
-std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4);
+// port), serving the databases of the pool; throws std::runtime_error when
+// the port cannot be bound.
+std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool);
 // The Listener's command server; throws std::logic_error for a detached
 // Listener.
 Ipc::SvcStub& serverOf(Listener& listener);

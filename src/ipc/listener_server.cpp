@@ -8,14 +8,15 @@
 
 namespace Ipc::DB {
 
-std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4) {
+std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool) {
   // The command server serves from its construction on, so a command may be
   // processed before the constructor has returned: its answer waits until
   // the server is known.
   std::promise<Ipc::SvcStub*> serverKnown;
   std::shared_future<Ipc::SvcStub*> server = serverKnown.get_future().share();
   auto listener = std::make_shared<Listener>(
-      Listener::Passkey(), [server](const std::shared_ptr<Ipc::CmdI>& cmd) { server.get()->onRespReady(cmd); });
+      Listener::Passkey(), [server](const std::shared_ptr<Ipc::CmdI>& cmd) { server.get()->onRespReady(cmd); },
+      std::move(pool));
 
   const std::weak_ptr<Listener> weak = listener;
   // The factory and the error handler reach the Listener only through its

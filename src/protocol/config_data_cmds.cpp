@@ -87,7 +87,7 @@ void CfgIds::writeRequest(wire::Writer& out) const { out.str(prefix_); }
 void CfgIds::writeAnswer(wire::Writer& out) const { out.strList(resp_); }
 
 void CfgIds::readAnswer(wire::Reader& in) {
-  resp_ = wirefmt::readStrList(in);
+  resp_ = in.strList();
   in.expectEnd();
 }
 
@@ -136,7 +136,7 @@ void SetData::writeRequest(wire::Writer& out) const {
 void DBNames::writeAnswer(wire::Writer& out) const { out.strList(resp_); }
 
 void DBNames::readAnswer(wire::Reader& in) {
-  resp_ = wirefmt::readStrList(in);
+  resp_ = in.strList();
   in.expectEnd();
 }
 

@@ -2,14 +2,10 @@
 
 #include <jansson.h>
 
-#include <atomic>
-#include <chrono>
 
 namespace Ipc {
 namespace {
 
-std::atomic<bool> g_clockFixed{false};
-std::atomic<std::int64_t> g_clockNow{0};
 
 constexpr const char* kEntriesKey = "entries";
 constexpr const char* kName = "name";
@@ -79,38 +75,20 @@ json::Value entryToJson(const UseInfo& u) {
 
 }  // namespace
 
-std::int64_t useClockNow() noexcept {
-  if (g_clockFixed.load()) return g_clockNow.load();
-  return std::chrono::duration_cast<std::chrono::seconds>(std::chrono::system_clock::now().time_since_epoch())
-      .count();
-}
-
-FixedUseClock::FixedUseClock(std::int64_t now) {
-  g_clockNow = now;
-  g_clockFixed = true;
-}
-
-FixedUseClock::~FixedUseClock() { g_clockFixed = false; }
-
-void FixedUseClock::set(std::int64_t now) noexcept { g_clockNow = now; }
-
-void FixedUseClock::advance(std::int64_t seconds) noexcept { g_clockNow += seconds; }
-
-std::int64_t oldestUseKept(std::uint64_t limit) noexcept {
+std::int64_t oldestUseKept(std::uint64_t limit, std::int64_t now) noexcept {
   if (limit == 0 || limit > static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
     return std::numeric_limits<std::int64_t>::min();
   }
   // Saturates: a clock set far into the past must not overflow.
-  const std::int64_t now = useClockNow();
   const auto span = static_cast<std::int64_t>(limit);
   return now < std::numeric_limits<std::int64_t>::min() + span ? std::numeric_limits<std::int64_t>::min() : now - span;
 }
 
-UseInfos::UseInfos(const json::Value& stored, std::uint64_t limit) {
+UseInfos::UseInfos(const json::Value& stored, std::uint64_t limit, std::int64_t now) {
   if (!stored.isObject()) return;
   json_t* list = json_object_get(stored.get(), kEntriesKey);
   if (!json_is_array(list)) return;
-  const std::int64_t oldest = oldestUseKept(limit);
+  const std::int64_t oldest = oldestUseKept(limit, now);
   const std::size_t n = json_array_size(list);
   entries_.reserve(n);
   for (std::size_t i = 0; i < n; ++i) {
@@ -155,8 +133,8 @@ void UseInfos::serialize(json::Object& out) const {
   out.set(kEntriesKey, list);
 }
 
-PackInfoPartial::PackInfoPartial(const json::Object& stored, std::uint64_t useLimit)
-    : PackInfoPartial(stored, UseInfos(stored.get(USE_FIELD_NAME), useLimit)) {}
+PackInfoPartial::PackInfoPartial(const json::Object& stored, std::uint64_t useLimit, std::int64_t now)
+    : PackInfoPartial(stored, UseInfos(stored.get(USE_FIELD_NAME), useLimit, now)) {}
 
 PackInfoPartial::PackInfoPartial(const json::Object& stored, UseInfos useList)
     : name(storedString(stored, kName)),

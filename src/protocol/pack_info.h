@@ -36,26 +36,10 @@ namespace Ipc {
 // The use-list limit every read of a stored list passes: seven hours.
 inline constexpr std::uint64_t kUseLimitSeconds = 25200;
 
-// Seconds since 1970-01-01 UTC as the record library sees them: the time
-// that stamps use entries and against which their age is measured.
-std::int64_t useClockNow() noexcept;
-
 // The oldest time stamp that a read of a stored use list with this limit
-// keeps, measured against useClockNow(); the smallest int64 when limit 0
-// keeps every entry.
-std::int64_t oldestUseKept(std::uint64_t limit) noexcept;
-
-// For tests: while an object lives, useClockNow() returns its time.
-// Not for concurrent use with another FixedUseClock.
-class FixedUseClock {
- public:
-  explicit FixedUseClock(std::int64_t now);
-  ~FixedUseClock();
-  FixedUseClock(const FixedUseClock&) = delete;
-  FixedUseClock& operator=(const FixedUseClock&) = delete;
-  void set(std::int64_t now) noexcept;
-  void advance(std::int64_t seconds) noexcept;
-};
+// keeps at time now (seconds since 1970-01-01 UTC, the clock that stamps
+// use entries); the smallest int64 when limit 0 keeps every entry.
+std::int64_t oldestUseKept(std::uint64_t limit, std::int64_t now) noexcept;
 
 // One user or lock of a pack.
 class UseInfo {
@@ -94,7 +78,7 @@ class UseInfos {
   // an empty value reads as an empty list). Entries older than limit
   // seconds are dropped; limit 0 keeps every entry. Entries that are not
   // well-formed are dropped too.
-  UseInfos(const json::Value& stored, std::uint64_t limit);
+  UseInfos(const json::Value& stored, std::uint64_t limit, std::int64_t now);
 
   // The entry with this host, process and state, or null. The pointer is
   // valid until the list changes.
@@ -135,7 +119,7 @@ class PackInfoPartial {
   PackInfoPartial() = default;
   // The fields and the use list of a stored object; the use list passes the
   // limit (see UseInfos).
-  PackInfoPartial(const json::Object& stored, std::uint64_t useLimit);
+  PackInfoPartial(const json::Object& stored, std::uint64_t useLimit, std::int64_t now);
   // The fields of a stored object with a use list of the caller's.
   PackInfoPartial(const json::Object& stored, UseInfos useList);
 

@@ -46,7 +46,7 @@ void ProgressCmdsBase::sendNoMoreProgress() {
 }
 
 void Cleanup::readRequest(wire::Reader& in) {
-  const std::vector<std::string> list = wirefmt::readStrList(in);
+  const std::vector<std::string> list = in.strList();
   in.expectEnd();
   usedIds_ = std::set<std::string>(list.begin(), list.end());
 }

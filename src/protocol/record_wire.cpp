@@ -58,17 +58,6 @@ json::Value readJson(wire::Reader& in) {
   return json::strToValue(text);
 }
 
-std::vector<std::string> readStrList(wire::Reader& in) {
-  const std::uint32_t count = in.u32();
-  if (static_cast<std::uint64_t>(count) * 4 > in.left()) {
-    throw wire::DecodeError("string list of " + std::to_string(count) + " entries runs past the end of the message");
-  }
-  std::vector<std::string> list;
-  list.reserve(std::min<std::uint32_t>(count, 256));
-  for (std::uint32_t i = 0; i < count; ++i) list.push_back(in.str());
-  return list;
-}
-
 void writeUse(wire::Writer& out, const UseInfo& u) {
   out.i32(u.state);
   out.str(u.host);

@@ -22,10 +22,6 @@ namespace Ipc::wirefmt {
 void writeJson(wire::Writer& out, const json::Value& v);
 json::Value readJson(wire::Reader& in);
 
-// String list: u32 count, then the strings. Same encoding as
-// wire::Reader::strList, but reserves memory only as the strings arrive, so
-// that a claimed count costs nothing before its strings are there.
-std::vector<std::string> readStrList(wire::Reader& in);
 
 // Use entry: i32 state, str host, str user, u32 process, i64 time.
 void writeUse(wire::Writer& out, const UseInfo& u);

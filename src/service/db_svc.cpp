@@ -3,7 +3,7 @@
 #include "engine/db_instances.h"
 #include "framework/log.h"
 #include "ipc/listener.h"
-#include "service/config.h"
+#include "settings/config.h"
 
 namespace DBServer {
 namespace {
@@ -35,7 +35,11 @@ bool DBSvc::prepareSvc() {
 void DBSvc::runSvc() {
   try {
     const DBConfig& config = DBConfig::inst();
-    std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4);
+    // Everything below the service gets its settings, paths and Env from
+    // here, through the pool; nothing below reads the process-wide record.
+    const auto pool = DB::DBInstances::create(DB::PoolSettings::from(config), DB::Paths(config), sys::Env::posix());
+    std::shared_ptr<Ipc::DB::Listener> created =
+        Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
       std::lock_guard lock(mutex_);
@@ -44,6 +48,9 @@ void DBSvc::runSvc() {
       if (stopRequested_) server.signalStop();
     }
     server.waitToFinish();
+    // Running maintenance operations stop at their next safe point (their
+    // clients are gone already) before the pool they use is stopped.
+    created->stopMaintenance();
     {
       std::lock_guard lock(mutex_);
       listener.reset();
@@ -51,7 +58,7 @@ void DBSvc::runSvc() {
     // The Listener and its server go with the last command that holds them.
     created.reset();
 
-    DB::DBInstances::teardown();
+    pool->stop();
     debugLine("Svc stopped");
   } catch (const std::exception& e) {
     Log::Lock entry(Log::Error);

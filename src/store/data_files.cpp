@@ -1,10 +1,6 @@
 // Data files: plain files below the database folder's "d/", one folder per
 // data id, read and written whole.
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
@@ -17,10 +13,12 @@
 
 #include "engine/db_exc.h"
 #include "framework/log.h"
-#include "framework/unique_fd.h"
-#include "service/names.h"
+#include "settings/names.h"
 #include "store/db_local.h"
-#include "store/file_ops.h"
+
+#include <shared_mutex>
+
+#include "engine/db_instances.h"
 
 namespace DB {
 namespace {
@@ -73,117 +71,79 @@ void checkFileName(const std::string& file) {
   }
 }
 
-[[noreturn]] void failWith(int error, const std::string& what) {
-  throw std::system_error(error, std::generic_category(), what);
-}
-
-void syncFolder(const std::string& folder) {
-  UniqueFd dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dir.valid() || FileOps::current().fsync(dir.get()) != 0) failWith(errno, "flush folder \"" + folder + '"');
-}
-
 // Creates folder (ending with "/") with its missing parents. Each level
 // made here is flushed into its parent, so that a file later renamed into
-// it does not vanish with its folder in a crash. Failures are not reported
-// here: the file that is then created in the folder fails instead.
-void makeFolders(const std::string& folder) {
-  std::vector<fs::path> made;
-  std::error_code ec;
-  for (fs::path level = fs::path(folder).parent_path(); !level.empty() && !fs::exists(level, ec);
-       level = level.parent_path()) {
-    made.push_back(level);
-    if (level == level.root_path()) break;
-  }
-  if (made.empty()) return;
-  fs::create_directories(made.front(), ec);
-  if (ec) return;
-  for (auto it = made.rbegin(); it != made.rend(); ++it) {
-    try {
-      syncFolder(it->parent_path().string());
-    } catch (const std::system_error&) {
-      return;  // the write that follows flushes the folder it needs and reports the failure
-    }
-  }
+// it does not vanish with its folder in a crash.
+void makeFolders(sys::Env& env, const std::string& folder) {
+  for (const auto& made : env.createFolders(folder)) env.syncFolder(made.parent_path());
 }
 
 // A file written whole: the bytes go to a new file with a reserved name in
 // the target's folder, reach the disk, and the file is then renamed over
-// the target, which readers therefore see either as it was or complete.
-// Without commit() the new file is removed again and the target is as it
-// was. Failures throw std::system_error naming the step.
+// the target, which readers therefore see either as it was or complete;
+// the folder is flushed after the rename, so the new name survives a
+// crash. Without commit() the new file is removed again and the target is
+// as it was. Failures throw std::system_error naming the step.
 class DurableWrite {
  public:
-  explicit DurableWrite(std::string folder)
-      : folder_(std::move(folder)),
-        temp_(folder_ + std::string(DBLocal::kTempPrefix) + "XXXXXX"),
-        file_(::mkostemp(temp_.data(), O_CLOEXEC)) {
-    if (!file_.valid()) failWith(errno, "create a file in \"" + folder_ + '"');
-    // mkostemp makes the file private to the owner; data files are
-    // ordinary files of the server.
-    ::fchmod(file_.get(), 0644);
-  }
+  DurableWrite(sys::Env& env, std::string folder)
+      : env_(env), folder_(std::move(folder)), file_(env_.createTemp(folder_, DBLocal::kTempPrefix, &temp_)) {}
   ~DurableWrite() {
-    if (!renamed_) ::unlink(temp_.c_str());
+    if (renamed_) return;
+    try {
+      file_.reset();
+      env_.remove(temp_);
+    } catch (const std::system_error&) {
+      // Stale temporary files are recognised by their prefix and skipped.
+    }
   }
   DurableWrite(const DurableWrite&) = delete;
   DurableWrite& operator=(const DurableWrite&) = delete;
 
   void append(const void* data, std::uint64_t size) {
-    auto& ops = FileOps::current();
     const char* next = static_cast<const char*>(data);
     while (size > 0) {
       const auto chunk = static_cast<std::size_t>(std::min<std::uint64_t>(size, kMaxWriteBytes));
-      const ssize_t n = ops.write(file_.get(), next, chunk);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) failWith(n < 0 ? errno : EIO, "write \"" + temp_ + '"');
-      next += n;
-      size -= static_cast<std::uint64_t>(n);
+      file_->write(next, chunk);
+      next += chunk;
+      size -= chunk;
     }
   }
 
   void commit(const std::string& target) {
-    auto& ops = FileOps::current();
-    if (ops.fsync(file_.get()) != 0) failWith(errno, "flush \"" + temp_ + '"');
-    if (file_.close() != 0) failWith(errno, "close \"" + temp_ + '"');
-    if (ops.rename(temp_.c_str(), target.c_str()) != 0) failWith(errno, "rename \"" + temp_ + "\" to \"" + target + '"');
+    file_->sync();
+    file_->close();
+    env_.rename(temp_, target);
     renamed_ = true;
-    syncFolder(folder_);
+    env_.syncFolder(folder_);
   }
 
  private:
+  sys::Env& env_;
   std::string folder_;
-  std::string temp_;
-  UniqueFd file_;
+  sys::Path temp_;
+  std::unique_ptr<sys::File> file_;
   bool renamed_ = false;
 };
 
-void copyFile(const fs::path& from, const std::string& toFolder, const std::string& name) {
-  UniqueFd in(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!in.valid()) failWith(errno, "open \"" + from.string() + '"');
-  DurableWrite out(toFolder);
+void copyFile(sys::Env& env, const sys::Path& from, const std::string& toFolder, const std::string& name) {
+  const auto in = env.open(from, sys::OpenMode::Read);
+  DurableWrite out(env, toFolder);
   const auto buffer = std::make_unique<char[]>(kCopyChunkBytes);
-  while (true) {
-    const ssize_t n = ::read(in.get(), buffer.get(), kCopyChunkBytes);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) failWith(errno, "read \"" + from.string() + '"');
-    if (n == 0) break;
-    out.append(buffer.get(), static_cast<std::uint64_t>(n));
-  }
+  for (std::size_t n; (n = in->read(buffer.get(), kCopyChunkBytes)) > 0;) out.append(buffer.get(), n);
   out.commit(toFolder + name);
 }
 
 // Copies the folders and regular files below from into toFolder (ending
 // with "/"), merging into what is there. Links and other special files are
 // not followed or copied, and neither are files still being written.
-void copyTree(const fs::path& from, const std::string& toFolder) {
-  makeFolders(toFolder);
-  for (const fs::directory_entry& entry : fs::directory_iterator(from)) {
-    const std::string name = entry.path().filename().string();
-    const auto status = entry.symlink_status();
-    if (fs::is_directory(status)) {
-      copyTree(entry.path(), toFolder + name + '/');
-    } else if (fs::is_regular_file(status) && !name.starts_with(DBLocal::kTempPrefix)) {
-      copyFile(entry.path(), toFolder, name);
+void copyTree(sys::Env& env, const sys::Path& from, const std::string& toFolder) {
+  makeFolders(env, toFolder);
+  for (const sys::DirEntry& entry : env.list(from)) {
+    if (entry.type == sys::FileType::Folder) {
+      copyTree(env, from / entry.name, toFolder + entry.name + '/');
+    } else if (entry.type == sys::FileType::Regular && !entry.name.starts_with(DBLocal::kTempPrefix)) {
+      copyFile(env, from / entry.name, toFolder, entry.name);
     }
   }
 }
@@ -196,25 +156,34 @@ MemBuffer DBLocal::loadDataBlob(const std::string& id, const std::string& file) 
   checkComponent("Data id", id);
   checkFileName(file);
   const std::string path = dataDir(id) + file;
-  UniqueFd in(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  struct stat info {};
-  if (!in.valid() || ::fstat(in.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
+  sys::Env& env = env_;
+  std::unique_ptr<sys::File> in;
+  try {
+    if (env.stat(path, true).type == sys::FileType::Regular) in = env.open(path, sys::OpenMode::Read);
+  } catch (const std::system_error&) {
+    // Unreadable counts as missing, as before: the client gets no content.
+  }
+  if (!in) {
     if (g_LogVerbose) {
       Log::Lock(Log::Debug).logStreamLine() << "DB:loadDataBlob S:" << sessionId() << " Can not find file \"" << id
                                             << '/' << file << '"';
     }
     return {};
   }
-  MemBuffer content(static_cast<std::uint64_t>(info.st_size));
-  std::uint64_t done = 0;
-  while (done < content.size()) {
-    const ssize_t n = ::read(in.get(), content.data() + done,
-                             static_cast<std::size_t>(std::min<std::uint64_t>(content.size() - done, kMaxWriteBytes)));
-    if (n < 0 && errno == EINTR) continue;
-    // Writes replace files by renaming, so a file never shrinks under a
-    // reader; a short read is a failure of the disk or of somebody else.
-    if (n <= 0) throw DBExc("Error reading database file: \"" + path + '"');
-    done += static_cast<std::uint64_t>(n);
+  MemBuffer content;
+  try {
+    content = MemBuffer(in->size());
+    std::uint64_t done = 0;
+    while (done < content.size()) {
+      const std::size_t n = in->read(content.data() + done,
+                                     static_cast<std::size_t>(std::min<std::uint64_t>(content.size() - done, kMaxWriteBytes)));
+      // Writes replace files by renaming, so a file never shrinks under a
+      // reader; a short read is a failure of the disk or of somebody else.
+      if (n == 0) throw std::system_error(EIO, std::generic_category(), "short read");
+      done += n;
+    }
+  } catch (const std::system_error&) {
+    throw DBExc("Error reading database file: \"" + path + '"');
   }
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:loadDataBlob S:" << sessionId() << " Returning data file \"" << id
@@ -228,9 +197,13 @@ void DBLocal::saveDataBlob(const void* data, std::uint64_t length, const std::st
   checkFileName(file);
   const std::string folder = dataDir(id);
   const std::string path = folder + file;
-  makeFolders(folder);
+  sys::Env& env = env_;
+  // A cleanup never removes the id while this write is under way.
+  const auto idLock = pool_->dataLock(name_, id);
+  const std::shared_lock writing(*idLock);
   try {
-    DurableWrite write(folder);
+    makeFolders(env, folder);
+    DurableWrite write(env, folder);
     write.append(data, length);
     write.commit(path);
   } catch (const std::system_error& e) {
@@ -247,11 +220,20 @@ void DBLocal::copyDataFolder(const std::string& source, const std::string& targe
   checkComponent("Data id", source);
   checkComponent("Data id", target);
   const std::string from = dataDir(source);
+  sys::Env& env = env_;
+  // Neither id is removed by a cleanup while the copy runs (one lock when
+  // both ids share it: a shared lock is not taken twice).
+  const auto sourceLock = pool_->dataLock(name_, source);
+  const auto targetLock = pool_->dataLock(name_, target);
+  const std::shared_lock readingSource(*sourceLock);
+  std::shared_lock<std::shared_mutex> writingTarget;
+  if (targetLock != sourceLock) writingTarget = std::shared_lock(*targetLock);
   try {
-    std::error_code ec;
-    if (!fs::is_directory(from, ec)) failWith(ec ? ec.value() : ENOENT, "find \"" + from + '"');
+    if (env.stat(from).type != sys::FileType::Folder) {
+      throw std::system_error(ENOENT, std::generic_category(), "find \"" + from + '"');
+    }
     if (source == target) return;  // copying a folder onto itself changes nothing
-    copyTree(from, dataDir(target));
+    copyTree(env, from, dataDir(target));
   } catch (const std::system_error& e) {
     // What used to be the shell's error code is the failing step and the
     // system's text here.

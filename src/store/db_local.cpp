@@ -12,10 +12,9 @@
 #include "engine/db_instances.h"
 #include "engine/engine_errors.h"
 #include "engine/transaction.h"
+#include "maintenance/cleanup.h"
 #include "framework/log.h"
-#include "service/config.h"
-#include "service/names.h"
-#include "store/file_ops.h"
+#include "settings/names.h"
 #include "store/schema.h"
 #include "store/store_exc.h"
 
@@ -24,14 +23,9 @@ namespace {
 
 namespace fs = std::filesystem;
 
-DBLocal::CreationHook& creationHook() {
-  static DBLocal::CreationHook hook;
-  return hook;
-}
-
 // The folders from root (exclusive) down to folder that do not exist yet,
 // the deepest last. folder lies below root by construction of the paths.
-std::vector<fs::path> missingFoldersBelow(const std::string& root, const std::string& folder) {
+std::vector<fs::path> missingFoldersBelow(sys::Env& env, const std::string& root, const std::string& folder) {
   std::vector<fs::path> missing;
   if (root.empty() || folder.size() <= root.size() || folder.compare(0, root.size(), root) != 0) return missing;
   fs::path level(root);
@@ -42,8 +36,7 @@ std::vector<fs::path> missingFoldersBelow(const std::string& root, const std::st
     start = end == std::string::npos ? folder.size() : end + 1;
     if (part.empty()) continue;
     level /= part;
-    std::error_code ec;
-    if (!fs::exists(level, ec)) missing.push_back(level);
+    if (env.stat(level).type == sys::FileType::Missing) missing.push_back(level);
   }
   return missing;
 }
@@ -51,24 +44,36 @@ std::vector<fs::path> missingFoldersBelow(const std::string& root, const std::st
 // Removes the folders, deepest first, each only when it is empty: whatever
 // another connection put into one meanwhile (a database of a longer name,
 // a data file) keeps it.
-void removeEmptyFolders(const std::vector<fs::path>& folders) {
+void removeEmptyFolders(sys::Env& env, const std::vector<fs::path>& folders) noexcept {
   std::set<fs::path> done;
   for (auto it = folders.rbegin(); it != folders.rend(); ++it) {
-    if (!done.insert(*it).second) continue;
-    std::error_code ignored;
-    if (fs::is_directory(fs::symlink_status(*it, ignored))) fs::remove(*it, ignored);
+    try {
+      if (!done.insert(*it).second) continue;
+      if (env.stat(*it).type == sys::FileType::Folder) env.remove(*it);  // fails when not empty
+    } catch (const std::exception&) {
+      // Kept: somebody put something there, or it cannot be removed.
+    }
   }
 }
 
-void removeFileAndCompanions(const std::string& file) {
-  std::error_code ignored;
-  for (const char* suffix : {"", "-wal", "-shm", "-journal"}) fs::remove(file + suffix, ignored);
+void removeFileAndCompanions(sys::Env& env, const std::string& file) noexcept {
+  for (const char* suffix : {"", "-wal", "-shm", "-journal"}) {
+    try {
+      env.remove(file + suffix);
+    } catch (const std::system_error&) {
+      // The creation's own failure is the one reported.
+    }
+  }
 }
 
 }  // namespace
 
-DBLocal::DBLocal(std::string_view dbName)
-    : name_(folderName(dbName)), folder_(databaseFolder(name_)), dbFile_(mainFile(name_)) {}
+DBLocal::DBLocal(std::shared_ptr<DBInstances> pool, std::string_view dbName)
+    : pool_(std::move(pool)),
+      env_(pool_->env()),
+      name_(folderName(dbName)),
+      folder_(pool_->paths().databaseFolder(name_)),
+      dbFile_(pool_->paths().mainFile(name_)) {}
 
 DBLocal::~DBLocal() { disconnect(); }
 
@@ -79,19 +84,15 @@ engine::Session& DBLocal::session(const std::source_location& where) {
   return *session_;
 }
 
-DBLocal::CreationHook DBLocal::setCreationHookForTesting(CreationHook hook) {
-  return std::exchange(creationHook(), std::move(hook));
-}
-
 bool DBLocal::fileAccessible() const {
-  if (FileOps::current().access(dbFile_.c_str(), R_OK | W_OK) == 0) return true;
-  const int error = errno;
-  if (error == ENOENT || error == ENOTDIR) return false;
-  // Taking such a file for missing would lead to a creation attempt on top
-  // of an existing database; it is the operator's to repair.
-  throw StoreExc(err::kFileAccessDenied, "Database file \"" + dbFile_ + "\" is not accessible (" +
-                                             std::error_code(error, std::generic_category()).message() +
-                                             "); it is left as it is");
+  try {
+    return env_.readWritable(dbFile_);
+  } catch (const std::system_error& e) {
+    // Taking such a file for missing would lead to a creation attempt on top
+    // of an existing database; it is the operator's to repair.
+    throw StoreExc(err::kFileAccessDenied, "Database file \"" + dbFile_ + "\" is not accessible (" +
+                                               e.code().message() + "); it is left as it is");
+  }
 }
 
 bool DBLocal::exists(bool mustExist) {
@@ -107,19 +108,19 @@ bool DBLocal::exists(bool mustExist) {
   // A failed creation removes the folders it made, and only those; which
   // they are is known only before the new instance makes its folders.
   std::vector<fs::path> newFolders;
+  sys::Env& env = env_;
+  const Paths& paths = pool_->paths();
   if (!found) {
-    const auto& config = DBConfig::inst();
-    newFolders = missingFoldersBelow(config.DBRoot, folder_);
-    auto logs = missingFoldersBelow(config.DBLogRoot, logFolder(name_));
+    newFolders = missingFoldersBelow(env, paths.root(), folder_);
+    auto logs = missingFoldersBelow(env, paths.logRoot(), paths.logFolder(name_));
     newFolders.insert(newFolders.end(), logs.begin(), logs.end());
   }
-  const auto pool = DBInstances::inst();
   bool creationFailed = false;
   try {
-    session_ = pool->newSession(
-        name_, [&](engine::Session& fresh) { attachOrCreate(*pool, fresh, found, creationFailed); });
+    session_ = pool_->newSession(
+        name_, [&](engine::Session& fresh) { attachOrCreate(*pool_, fresh, found, creationFailed); });
   } catch (...) {
-    if (creationFailed) removeEmptyFolders(newFolders);
+    if (creationFailed) removeEmptyFolders(env, newFolders);
     throw;
   }
   openDB();
@@ -158,7 +159,6 @@ void DBLocal::createDB(DBInstances& pool, engine::Session& fresh, bool& creation
     }
     Transaction txn(fresh);
     schema::create(fresh);
-    if (creationHook()) creationHook()(fresh);
     txn.commit();
   } catch (...) {
     Log::Lock(Log::Error).logStreamLine() << "Failed to create new database in \"" << name_ << '"';
@@ -166,7 +166,7 @@ void DBLocal::createDB(DBInstances& pool, engine::Session& fresh, bool& creation
     // Only what this creation made goes: the database file it created and
     // the folders that did not exist before (removed by exists() when they
     // are empty). A database file that was there before is never touched.
-    if (fileIsOurs) removeFileAndCompanions(dbFile_);
+    if (fileIsOurs) removeFileAndCompanions(env_, dbFile_);
     creationFailed = true;
     throw;
   }
@@ -194,14 +194,19 @@ bool DBLocal::disconnect() noexcept {
       // Out of memory for a debug line: the session is given back anyway.
     }
   }
-  // A store that closes after the service stopped finds no pool: its
-  // session then simply ends.
-  if (const auto pool = DBInstances::existing()) {
-    pool->endSession(name_, std::move(session_));
-  } else {
-    session_.reset();
-  }
+  // A store that closes after the service stopped finds the pool stopped:
+  // its session then simply ends.
+  pool_->endSession(name_, std::move(session_));
   return true;
+}
+
+}  // namespace DB
+
+namespace DB {
+
+void DBLocal::cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
+                      std::stop_token stop) {
+  maint::cleanUp(pool_, name_, usedIds, *callback, std::move(stop));
 }
 
 }  // namespace DB

@@ -29,14 +29,18 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <set>
+#include <stop_token>
 #include <source_location>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "engine/progress.h"
 #include "engine/session.h"
 #include "engine/statement.h"
 #include "framework/buffers.h"
+#include "framework/env.h"
 #include "framework/json.h"
 #include "protocol/pack_info.h"
 
@@ -51,8 +55,10 @@ class DBLocal {
   // value once, in the caller's buffer, and never a second copy.
   static constexpr std::int64_t kInlineValueBytes = 64 * 1024;
 
-  // Builds the paths from the name; opens nothing.
-  explicit DBLocal(std::string_view dbName);
+  // Builds the paths from the name; opens nothing. The pool is the store's
+  // context: its sessions, its paths and its Env (every file operation of
+  // the store goes through that Env).
+  DBLocal(std::shared_ptr<DBInstances> pool, std::string_view dbName);
   ~DBLocal();
   DBLocal(const DBLocal&) = delete;
   DBLocal& operator=(const DBLocal&) = delete;
@@ -160,10 +166,20 @@ class DBLocal {
   // has no record. Its data files stay (cleanup removes unused ones).
   void removePack(const std::string& id);
 
+  // ---- Maintenance (src/maintenance) --------------------------------------
+  // Run on a maintenance thread of the connection's command, which holds
+  // back the connection's other commands meanwhile. Each owns its callback
+  // until it returns and ends early, with a failure, when stop is requested.
+
+  // Removes every entry of the data folder that usedIds does not name and
+  // that was last written more than six hours ago (maint::cleanUp).
+  void cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
+               std::stop_token stop = {});
+
  private:
   // The record of a row of the pack statements (columns id, folder,
   // status, blob). Throws json::Exc when the stored object is not JSON.
-  static Ipc::PackInfo readInfo(const engine::Statement& row);
+  Ipc::PackInfo readInfo(const engine::Statement& row) const;
   // The write that every pack writer shares, inside the caller's
   // transaction. useUpdate: the caller is a fetch with a use entry, which
   // wants the complete record back. Returns null only for a CloseEdit on a
@@ -180,16 +196,7 @@ class DBLocal {
   // The debug line of one use-list transition; callers test g_LogVerbose.
   void logUseChange(const std::string& id, std::string_view transition, const Ipc::UseInfo& entry) const;
 
- public:
 
-  // ---- For tests -----------------------------------------------------------
-  // Runs inside the creation of a new database, after its tables were made
-  // and before they are committed; a throw fails the creation there.
-  // Returns the previous hook; an empty function removes it.
-  using CreationHook = std::function<void(engine::Session&)>;
-  static CreationHook setCreationHookForTesting(CreationHook hook);
-
- private:
   // ---- Helpers shared by the table operations, the pack code included --
   // The open session; throws kInvalidDatabaseId when the store is closed.
   engine::Session& session(const std::source_location& where = std::source_location::current());
@@ -220,6 +227,8 @@ class DBLocal {
   // but may not.
   bool fileAccessible() const;
 
+  const std::shared_ptr<DBInstances> pool_;
+  sys::Env& env_;  // the pool's
   const std::string name_;
   const std::string folder_;
   const std::string dbFile_;

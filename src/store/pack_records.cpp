@@ -7,7 +7,7 @@
 #include "engine/db_exc.h"
 #include "engine/transaction.h"
 #include "framework/log.h"
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 #include "store/db_local.h"
 #include "store/pack_sql.h"
 
@@ -31,7 +31,7 @@ bool isCloseEdit(const Ipc::PackInfo& request) {
 
 }  // namespace
 
-Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) {
+Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) const {
   Ipc::PackInfo info(std::string(row.columnBytes(0)));
   info.setFolder(std::string(row.columnBytes(1)));
   info.setStatus(static_cast<std::int32_t>(row.columnInt64(2)));
@@ -39,7 +39,7 @@ Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) {
   // Every writer stores an object with the row; an empty value (a row
   // written by hand) reads as a record without further fields. The text is
   // streamed into the record's fields, with no JSON tree in between.
-  if (!blob.empty()) Ipc::readStoredPackInfo(blob, Ipc::kUseLimitSeconds, info);
+  if (!blob.empty()) Ipc::readStoredPackInfo(blob, Ipc::kUseLimitSeconds, env_.nowSeconds(), info);
   return info;
 }
 

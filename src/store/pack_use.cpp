@@ -37,7 +37,8 @@ std::optional<Ipc::UseInfos> DBLocal::updateUseInfo(json::Object& stored, const 
 
   // Entries older than the limit are dropped here, and so vanish from the
   // stored list with this write.
-  Ipc::UseInfos uses(stored.get(Ipc::PackInfoPartial::USE_FIELD_NAME), Ipc::kUseLimitSeconds);
+  const std::int64_t now = env_.nowSeconds();
+  Ipc::UseInfos uses(stored.get(Ipc::PackInfoPartial::USE_FIELD_NAME), Ipc::kUseLimitSeconds, now);
   bool handBack = useUpdate;
   if (!request.uses.empty()) {
     const UseInfo& u = request.uses.front();
@@ -45,7 +46,7 @@ std::optional<Ipc::UseInfos> DBLocal::updateUseInfo(json::Object& stored, const 
       case UseInfo::OpenForEdit:
         // Not merged: a process that opens twice is listed twice and
         // closes twice.
-        uses.append(UseInfo(u, Ipc::useClockNow()));
+        uses.append(UseInfo(u, now));
         note("opened for edit", u);
         handBack = true;
         break;
@@ -61,7 +62,7 @@ std::optional<Ipc::UseInfos> DBLocal::updateUseInfo(json::Object& stored, const 
           note("updating old upload lock by", *held);
           uses.remove(held);
         }
-        uses.append(UseInfo(u, Ipc::useClockNow()));
+        uses.append(UseInfo(u, now));
         note("sheduled for upload by", u);
         break;
       case UseInfo::CloseEdit:

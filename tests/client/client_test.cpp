@@ -9,8 +9,10 @@
 #include <future>
 #include <thread>
 
+#include "engine/db_instances.h"
 #include "ipc/listener.h"
 #include "support/log_capture.h"
+#include "support/temp_dir.h"
 
 namespace {
 
@@ -30,7 +32,13 @@ cvdb::ClientOptions at(std::uint16_t port) {
 class WithListener : public ::testing::Test {
  protected:
   LogCapture log;
-  std::shared_ptr<Ipc::DB::Listener> listener = Ipc::DB::createListener(0, true);
+  testing_support::TempDir dir;
+  std::shared_ptr<Ipc::DB::Listener> listener = Ipc::DB::createListener(
+      0, true,
+      DB::DBInstances::create(DB::PoolSettings{},
+                              DB::Paths(dir.path().string() + "/", dir.path().string() + "/",
+                                        dir.path().string() + "/db.backup/", "cvdb.edb"),
+                              sys::Env::posix()));
   std::uint16_t port = Ipc::DB::serverOf(*listener).port();
 
   ~WithListener() override {

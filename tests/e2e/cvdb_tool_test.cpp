@@ -96,6 +96,46 @@ TEST(CvdbTool, EveryPackCommand) {
 
 // 1: the server refused or ended the connection; 2: a local mistake, found
 // before the server is contacted; 3: no server.
+// Cleanup end to end: progress lines (or JSON lines), the used ids from the
+// command line and from a file, old unused data gone and the rest kept; a
+// connection without a database gets the failure as its stream's last
+// message and exit status 1.
+TEST(CvdbTool, CleanupRemovesOldUnusedDataWithProgress) {
+  ServerProcess server(kServer);
+  const Tool cvdb = toolOf(server, {"--db", "docs"});
+  testing_support::TempDir dir;
+  writeFile(dir / "page", "p");
+  for (const char* id : {"old", "kept-by-option", "kept-by-file", "young"}) {
+    ok(cvdb({"data", "put", id, "page", (dir / "page").string()}));
+  }
+  const auto data = server.home() / "db" / "docs" / "d";
+  const auto old = std::filesystem::file_time_type::clock::now() - std::chrono::hours(7);
+  for (const char* id : {"old", "kept-by-option", "kept-by-file"}) std::filesystem::last_write_time(data / id, old);
+  writeFile(dir / "used.txt", "kept-by-file\n");
+
+  const std::string out =
+      ok(cvdb({"cleanup", "--used", "kept-by-option", "--used-file", (dir / "used.txt").string()}));
+  EXPECT_TRUE(has(out, "Starting Database Cleanup...")) << out;
+  EXPECT_TRUE(has(out, "Erasing unused data...")) << out;
+  EXPECT_TRUE(has(out, "Removing data chunks 100% complete (4/4), 1 erased")) << out;
+  EXPECT_FALSE(std::filesystem::exists(data / "old"));
+  for (const char* id : {"kept-by-option", "kept-by-file", "young"}) EXPECT_TRUE(std::filesystem::exists(data / id)) << id;
+  EXPECT_TRUE(server.waitForLogLine("Database \"docs\" cleaned. 1 unused ids deleted, 1 unused ids too recent to clean"));
+  EXPECT_TRUE(has(ok(cvdb({"--json", "cleanup"})), "{\"percent\":0,\"text\":\"Erasing unused data...\"}"));
+
+  auto unbound = clientOf(server);
+  std::vector<std::string> seen;
+  try {
+    unbound->cleanup({}, [&](std::uint32_t, const std::string& text) { seen.push_back(text); });
+    ADD_FAILURE() << "a cleanup without a database succeeded";
+  } catch (const cvdb::OperationFailed& e) {
+    EXPECT_EQ(e.reason(),
+              "DB operation failed with error: No database associated with current connection. Connect command failed?");
+  }
+  EXPECT_EQ(seen.front(), "Starting Database Cleanup...");
+  EXPECT_TRUE(server.waitForLogLine("Async command Cleanup failed with No database associated"));
+}
+
 TEST(CvdbTool, RefusalsLocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
   std::uint16_t port;
   {

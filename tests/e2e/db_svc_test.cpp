@@ -9,7 +9,7 @@
 #include <chrono>
 #include <future>
 
-#include "service/config.h"
+#include "settings/config.h"
 #include "support/log_capture.h"
 
 namespace {

@@ -14,7 +14,7 @@
 
 #include "engine/instance_for_maintenance.h"
 #include "engine_fixture.h"
-#include "service/names.h"
+#include "settings/names.h"
 #include "support/log_capture.h"
 
 namespace {
@@ -42,21 +42,15 @@ class Recorder : public DB::DBProgressCallback {
 
 class Pool : public EngineTest {
  protected:
-  Pool() { InstanceForMaintenance::setTickForTesting(std::chrono::milliseconds(5)); }
-
   void configure(std::uint64_t maxDbs, std::uint64_t maxClients = 100, std::int32_t maxWait = 10) {
-    DBConfig c = config();
-    c.MaxActiveDBs = maxDbs;
-    c.MaxActiveClientsPerDB = maxClients;
-    c.MaxWaitMaintenanceOpSecs = maxWait;
-    applyConfig(c);
+    EngineTest::configure(testSettings(maxDbs, maxClients, maxWait));
   }
 
   // What the store does for a new instance: attach the file, or create it.
   DBInstances::OnNewInstance opener() {
     return [this](engine::Session& s) {
       ++opened_;
-      const fs::path file = DB::mainFile(s.instance()->settings().key);
+      const fs::path file = paths().mainFile(s.instance()->settings().key);
       if (fs::exists(file)) {
         s.attachDatabase(file);
       } else {
@@ -65,11 +59,11 @@ class Pool : public EngineTest {
     };
   }
 
-  std::unique_ptr<engine::Session> open(const std::string& key) { return DBInstances::inst()->newSession(key, opener()); }
+  std::unique_ptr<engine::Session> open(const std::string& key) { return pool()->newSession(key, opener()); }
   void close(const std::string& key, std::unique_ptr<engine::Session> s) {
-    DBInstances::inst()->endSession(key, std::move(s));
+    pool()->endSession(key, std::move(s));
   }
-  std::optional<DBInstances::RecordView> record(const std::string& key) { return DBInstances::inst()->record(key); }
+  std::optional<DBInstances::RecordView> record(const std::string& key) { return pool()->record(key); }
 
   std::atomic<int> opened_{0};
 };
@@ -77,6 +71,7 @@ class Pool : public EngineTest {
 TEST_F(Pool, TheEngineStartIsLoggedAndTwoClientsOfANewDatabaseShareOneInstance) {
   VerboseLog verbose;
   LogCapture log;
+  configure(100);  // a pool made while the log is captured
   std::barrier start(2);
   std::unique_ptr<engine::Session> sessions[2];
   std::vector<std::thread> threads;
@@ -109,7 +104,7 @@ TEST_F(Pool, ASlowOpeningHoldsUpOnlyItsOwnDatabase) {
   std::promise<void> release;
   auto released = release.get_future().share();
   auto slow = std::async(std::launch::async, [&] {
-    return DBInstances::inst()->newSession("slow", [&](engine::Session& s) {
+    return pool()->newSession("slow", [&](engine::Session& s) {
       entered.set_value();
       released.wait();
       opener()(s);
@@ -118,7 +113,7 @@ TEST_F(Pool, ASlowOpeningHoldsUpOnlyItsOwnDatabase) {
   entered.get_future().wait();
   // Another database, its end and a hold on it, meanwhile.
   auto other = open("other");
-  { InstanceForMaintenance hold("other", nullptr, false); }
+  { InstanceForMaintenance hold(pool(), "other", nullptr, false); }
   close("other", std::move(other));
   EXPECT_EQ(record("slow")->sessions, 1u);
   auto second = std::async(std::launch::async, [&] { return open("slow"); });
@@ -133,13 +128,13 @@ TEST_F(Pool, ASlowOpeningHoldsUpOnlyItsOwnDatabase) {
 
   std::promise<void> failing;
   auto failed = std::async(std::launch::async, [&] {
-    return DBInstances::inst()->newSession("broken", [&](engine::Session&) {
+    return pool()->newSession("broken", [&](engine::Session&) {
       failing.get_future().wait();
       throw DB::DBExc("cannot open");
     });
   });
-  auto waiter = std::async(std::launch::async, [&] { return open("broken"); });
   while (!record("broken")) std::this_thread::yield();
+  auto waiter = std::async(std::launch::async, [&] { return open("broken"); });
   failing.set_value();
   EXPECT_THROW(failed.get(), DB::DBExc);
   auto fresh = waiter.get();
@@ -154,7 +149,7 @@ TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimitOrWhenAsked) {
   LogCapture log;
   close("a", open("a"));
   close("b", open("b"));
-  EXPECT_EQ(DBInstances::inst()->recordCount(), 2u);
+  EXPECT_EQ(pool()->recordCount(), 2u);
   const int before = opened_;
   close("a", open("a"));  // below the threshold the instance stays open
   EXPECT_EQ(opened_, before);
@@ -167,10 +162,10 @@ TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimitOrWhenAsked) {
   close("a", open("a"));
   EXPECT_EQ(opened_, before + 2);
 
-  EXPECT_TRUE(DBInstances::inst()->closeIfDormant("never"));
-  EXPECT_FALSE(DBInstances::inst()->closeIfDormant("c"));
+  EXPECT_TRUE(pool()->closeIfDormant("never"));
+  EXPECT_FALSE(pool()->closeIfDormant("c"));
   close("c", std::move(c));
-  EXPECT_TRUE(DBInstances::inst()->closeIfDormant("c"));
+  EXPECT_TRUE(pool()->closeIfDormant("c"));
   EXPECT_FALSE(record("c"));
 }
 
@@ -198,7 +193,7 @@ TEST_F(Pool, ExclusiveHoldWaitsForTheLastClientRefusesSessionsAtOnceAndLeavesFor
     progress.then = [&](std::size_t n) {
       if (n == 3) close("r", std::move(s));
     };
-    InstanceForMaintenance hold("r", &progress, true);
+    InstanceForMaintenance hold(pool(), "r", &progress, true);
     ASSERT_EQ(progress.texts.size(), 3u);
     EXPECT_EQ(progress.texts[2], "Waiting for all clients connected to the database to exit (3/20seconds passed)");
     EXPECT_TRUE(record("r")->maintenance);
@@ -207,7 +202,7 @@ TEST_F(Pool, ExclusiveHoldWaitsForTheLastClientRefusesSessionsAtOnceAndLeavesFor
     const auto start = std::chrono::steady_clock::now();
     EXPECT_EQ(failureOf([&] { open("r"); }), kNotAccessible);
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
-    EXPECT_FALSE(DBInstances::inst()->closeIfDormant("r"));
+    EXPECT_FALSE(pool()->closeIfDormant("r"));
     EXPECT_EQ(record("r")->sessions, 0u);
   }
   EXPECT_FALSE(record("r"));
@@ -219,26 +214,31 @@ TEST_F(Pool, ExclusiveHoldWaitsForTheLastClientRefusesSessionsAtOnceAndLeavesFor
 
 TEST_F(Pool, SharedHoldNeedsAnOpenInstanceWaitsWithItsMessagesAndLeavesTheInstanceOpen) {
   auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(failureOf([&] { InstanceForMaintenance hold("nowhere", nullptr, false); }), "No instance exist for nowhere");
+  EXPECT_EQ(failureOf([&] { InstanceForMaintenance hold(pool(), "nowhere", nullptr, false); }), "No instance exist for nowhere");
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
+
+  // With no wait at all, a busy database fails at once and says nothing.
+  configure(100, 100, 0);
+  {
+    auto zero = open("zero");
+    InstanceForMaintenance first(pool(), "zero", nullptr, false);
+    Recorder none;
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance second(pool(), "zero", &none, false); }), "Operation timeout!");
+    EXPECT_TRUE(none.texts.empty());
+  }
 
   configure(100, 100, 12);
   auto s = open("busy");
   const auto id = record("busy")->instanceId;
   {
-    InstanceForMaintenance first("busy", nullptr, false);
+    InstanceForMaintenance first(pool(), "busy", nullptr, false);
     EXPECT_TRUE(record("busy")->maintenance);
     Recorder progress;
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance second("busy", &progress, false); }), "Operation timeout!");
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance second(pool(), "busy", &progress, false); }), "Operation timeout!");
     ASSERT_EQ(progress.texts.size(), 10u);  // ticks 1 to 9, then 10
     EXPECT_EQ(progress.texts[0], "Waiting for another database maintenance operation to finish (1/12seconds passed)");
     EXPECT_EQ(progress.texts[9], "Waiting for another database maintenance operation to finish (10/12seconds passed)");
     EXPECT_EQ(progress.percents[0], 0u);
-
-    configure(100, 100, 0);
-    Recorder none;
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance third("busy", &none, false); }), "Operation timeout!");
-    EXPECT_TRUE(none.texts.empty());
   }
   EXPECT_FALSE(record("busy")->maintenance);
   EXPECT_EQ(record("busy")->instanceId, id);
@@ -250,62 +250,62 @@ TEST_F(Pool, MaintenanceHoldsExcludeEachOther) {
   configure(100, 100, 2);
   close("m", open("m"));
   {
-    InstanceForMaintenance shared("m", nullptr, false);
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance exclusive("m", nullptr, true); }), "Operation timeout!");
+    InstanceForMaintenance shared(pool(), "m", nullptr, false);
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance exclusive(pool(), "m", nullptr, true); }), "Operation timeout!");
     EXPECT_TRUE(record("m")->initialised);
   }
   {
-    InstanceForMaintenance exclusive("m", nullptr, true);
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance other("m", nullptr, true); }), "Operation timeout!");
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance shared("m", nullptr, false); }), "Operation timeout!");
+    InstanceForMaintenance exclusive(pool(), "m", nullptr, true);
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance other(pool(), "m", nullptr, true); }), "Operation timeout!");
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance shared(pool(), "m", nullptr, false); }), "Operation timeout!");
     EXPECT_TRUE(record("m")->maintenance);
   }
   EXPECT_FALSE(record("m"));
 }
 
 TEST_F(Pool, FailedFirstSessionOrExclusiveHoldLeavesNothingCounted) {
-  const auto live = engine::liveInstances();
+  const auto live = pool()->liveInstances();
   EXPECT_EQ(failureOf([&] {
-              DBInstances::inst()->newSession("f", [](engine::Session&) { throw std::runtime_error("attach failed"); });
+              pool()->newSession("f", [](engine::Session&) { throw std::runtime_error("attach failed"); });
             }),
             "attach failed");
   EXPECT_FALSE(record("f"));
-  EXPECT_EQ(engine::liveInstances(), live);
+  EXPECT_EQ(pool()->liveInstances(), live);
 
   // A creation failure cleans up through discardInstance itself.
   EXPECT_EQ(failureOf([&] {
-              DBInstances::inst()->newSession("f", [&](engine::Session& s) {
-                s.createDatabase(DB::mainFile("f"));
-                DBInstances::existing()->discardInstance("f", s);
+              pool()->newSession("f", [&](engine::Session& s) {
+                s.createDatabase(paths().mainFile("f"));
+                pool()->discardInstance("f", s);
                 throw std::runtime_error("tables failed");
               });
             }),
             "tables failed");
   EXPECT_FALSE(record("f"));
-  EXPECT_EQ(engine::liveInstances(), live);
+  EXPECT_EQ(pool()->liveInstances(), live);
   auto s = open("f");
   EXPECT_EQ(record("f")->sessions, 1u);
 
   // Nor does a failed exclusive hold on a new instance.
   close("f", std::move(s));
-  DBInstances::teardown();
   configure(1);
   auto a = open("a");
-  EXPECT_EQ(codeOf([&] { InstanceForMaintenance hold("b", nullptr, true); }), err::kTooManyInstances);
+  EXPECT_EQ(codeOf([&] { InstanceForMaintenance hold(pool(), "b", nullptr, true); }), err::kTooManyInstances);
   EXPECT_FALSE(record("b"));
-  EXPECT_EQ(DBInstances::inst()->recordCount(), 1u);
+  EXPECT_EQ(pool()->recordCount(), 1u);
 }
 
 TEST_F(Pool, SessionsOfAnInstanceThePoolForgotAreEndedAndReported) {
   LogCapture log;
   auto s = open("gone");
   const auto id = s->id();
-  DBInstances::teardown();
-  EXPECT_FALSE(DBInstances::existing());
+  const auto old = pool();
+  configure(100);
   // A new pool with a new instance of the same database is not confused by
-  // the old session.
+  // the old session; the stopped pool lets its own sessions end quietly.
   auto fresh = open("gone");
-  DBInstances::inst()->endSession("gone", std::move(s));
+  EXPECT_EQ(codeOf([&] { old->newSession("other", opener()); }), err::kTermInProgress);
+  pool()->endSession("gone", std::move(s));
   EXPECT_EQ(log.count(Log::Error, "DBInstances: DB: gone, Session S:" + std::to_string(id) +
                                       " released for unknown instance!!!"),
             1u);
@@ -320,9 +320,9 @@ TEST_F(Pool, TeardownInterruptsAWaitingHold) {
   progress.then = [&](std::size_t n) {
     if (n == 1) waiting.set_value();
   };
-  auto hold = std::async(std::launch::async, [&] { InstanceForMaintenance h("w", &progress, true); });
+  auto hold = std::async(std::launch::async, [&] { InstanceForMaintenance h(pool(), "w", &progress, true); });
   waiting.get_future().wait();
-  DBInstances::teardown();
+  pool()->stop();
   ASSERT_EQ(hold.wait_for(std::chrono::seconds(10)), std::future_status::ready);
   EXPECT_EQ(codeOf([&] { hold.get(); }), err::kTermInProgress);
 }

@@ -1,6 +1,5 @@
 #include "engine_fixture.h"
 
-#include "engine/instance_for_maintenance.h"
 
 namespace engine_testing {
 
@@ -22,35 +21,38 @@ std::string failureOf(const std::function<void()>& action) {
   return "";
 }
 
-EngineTest::EngineTest() { applyConfig(config()); }
+DB::PoolSettings testSettings(std::uint64_t maxDbs, std::uint64_t maxClients, std::int32_t maxWait) {
+  DB::PoolSettings s;
+  s.maxActiveDBs = maxDbs;
+  s.maxClientsPerDB = maxClients;
+  s.maxWaitMaintenanceSecs = maxWait;
+  s.maintenanceTick = std::chrono::milliseconds(5);
+  return s;
+}
+
+EngineTest::EngineTest() { configure(testSettings()); }
 
 EngineTest::~EngineTest() {
-  DB::DBInstances::teardown();
-  DB::Transaction::setPauseForTesting({});
-  DB::InstanceForMaintenance::setTickForTesting(std::chrono::milliseconds(1000));
+  if (pool_) pool_->stop();
 }
 
-DBConfig EngineTest::config() const {
-  if (override_) return DBConfig::inst();
-  DBConfig c;
-  c.DBRoot = root();
-  c.DBLogRoot = dir_.path().string() + "/logs/";
-  c.BackupFolder = root() + "db.backup/";
-  return c;
+void EngineTest::configure(DB::PoolSettings settings) {
+  if (pool_) pool_->stop();
+  pool_ = DB::DBInstances::create(settings, paths(), env_);
 }
 
-void EngineTest::applyConfig(const DBConfig& changed) {
-  override_.reset();
-  override_ = std::make_unique<DBConfig::TestOverride>(changed);
+DB::Paths EngineTest::paths() const {
+  return DB::Paths(root(), dir_.path().string() + "/logs/", root() + "db.backup/", "cvdb.edb");
 }
 
-engine::InstanceSettings EngineTest::settingsFor(const std::string& key) const {
+engine::InstanceSettings EngineTest::settingsFor(const std::string& key) {
   engine::InstanceSettings settings;
   settings.key = key;
   settings.instanceFolder = root() + key + "/";
   settings.logFolder = dir_.path().string() + "/logs/" + key + "/";
   settings.databaseFileName = "cvdb.edb";
   settings.busyTimeout = std::chrono::milliseconds(5000);
+  settings.env = &env_;
   return settings;
 }
 

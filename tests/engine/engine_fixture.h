@@ -1,7 +1,8 @@
 #pragma once
-// Shared set-up of the engine tests: settings whose folders lie in a
-// temporary folder, instances and sessions made directly on the engine
-// layer, and a small counter table for write tests.
+// Shared set-up of the engine tests: a pool whose folders lie in a
+// temporary folder and whose files and clock go through a fault double,
+// instances and sessions made directly on the engine layer, and a small
+// counter table for write tests.
 
 #include <gtest/gtest.h>
 
@@ -15,7 +16,7 @@
 #include "engine/instance.h"
 #include "engine/session.h"
 #include "engine/transaction.h"
-#include "service/config.h"
+#include "support/fault_env.h"
 #include "support/temp_dir.h"
 
 namespace engine_testing {
@@ -27,21 +28,21 @@ int codeOf(const std::function<void()>& action);
 // The text of what the action throws; "" when it throws nothing.
 std::string failureOf(const std::function<void()>& action);
 
-// Settings in a temporary folder; the pool is torn down after each test so
-// that every test starts without instances.
+// A fresh pool per test (maintenance ticks of 5 ms), stopped after it.
 class EngineTest : public ::testing::Test {
  protected:
   EngineTest();
   ~EngineTest() override;
 
-  DBConfig config() const;
-  // Applies a config (from config() with changes) for the rest of the test.
-  void applyConfig(const DBConfig& changed);
+  // Replaces the pool by one with these settings (the old one is stopped).
+  void configure(DB::PoolSettings settings);
+  const std::shared_ptr<DB::DBInstances>& pool() const { return pool_; }
 
   std::string root() const { return dir_.path().string() + "/db/"; }
+  DB::Paths paths() const;
 
   // Settings of an instance of key below root(), its file "cvdb.edb".
-  engine::InstanceSettings settingsFor(const std::string& key) const;
+  engine::InstanceSettings settingsFor(const std::string& key);
   // An initialised instance of its own (not in the pool).
   std::shared_ptr<engine::Instance> makeInstance(const std::string& key, std::uint64_t maxSessions = 100);
   std::shared_ptr<engine::Instance> makeInstance(const engine::InstanceSettings& settings);
@@ -55,9 +56,13 @@ class EngineTest : public ::testing::Test {
   std::int64_t counter(engine::Session& session);
 
   testing_support::TempDir dir_;
+  testing_support::FaultEnv env_{dir_ / "scratch"};
 
  private:
-  std::unique_ptr<DBConfig::TestOverride> override_;
+  std::shared_ptr<DB::DBInstances> pool_;
 };
+
+// Pool settings of the tests: the defaults, with short maintenance ticks.
+DB::PoolSettings testSettings(std::uint64_t maxDbs = 100, std::uint64_t maxClients = 100, std::int32_t maxWait = 10);
 
 }  // namespace engine_testing

@@ -8,7 +8,7 @@
 #include <algorithm>
 
 #include "protocol/fake_socket.h"
-#include "service/config.h"
+#include "engine/db_instances.h"
 #include "support/log_capture.h"
 #include "support/temp_dir.h"
 
@@ -21,10 +21,17 @@ using testing_support::LogCapture;
 constexpr const char* kNoDatabase = "No database associated with current connection. Connect command failed?";
 constexpr const char* kTerminating = "Terminating client connection due to processing error";
 
+// A pool of databases below root.
+std::shared_ptr<DB::DBInstances> poolAt(const std::filesystem::path& root) {
+  const std::string r = root.string() + "/";
+  return DB::DBInstances::create(DB::PoolSettings{}, DB::Paths(r, r, r + "db.backup/", "cvdb.edb"), sys::Env::posix());
+}
+
 struct ListenerTest : ::testing::Test {
+  testing_support::TempDir dir;
   std::vector<std::shared_ptr<Ipc::CmdI>> answered;
-  std::shared_ptr<Listener> listener =
-      Listener::createDetached([this](const std::shared_ptr<Ipc::CmdI>& cmd) { answered.push_back(cmd); });
+  std::shared_ptr<Listener> listener = Listener::createDetached(
+      [this](const std::shared_ptr<Ipc::CmdI>& cmd) { answered.push_back(cmd); }, poolAt(dir / "db"));
   std::shared_ptr<FakeSocket> socket = std::make_shared<FakeSocket>();
   LogCapture log;
 
@@ -80,7 +87,7 @@ TEST_F(ListenerTest, OnlyTheListenersOwnBindingCountsAsADatabase) {
   } catch (const std::runtime_error& e) {
     EXPECT_STREQ(e.what(), kNoDatabase);
   }
-  auto binding = std::make_unique<Listener::ConnDB>("plant");
+  auto binding = std::make_unique<Listener::ConnDB>(poolAt(dir / "db"), "plant");
   Listener::ConnDB* raw = binding.get();
   socket->connInf() = std::move(binding);
   EXPECT_EQ(&Listener::dbOfConn(*cmd), &raw->db);
@@ -92,19 +99,16 @@ TEST_F(ListenerTest, OnlyTheListenersOwnBindingCountsAsADatabase) {
 TEST_F(ListenerTest, AFailureWhileAnsweringEndsTheConnectionAndOtherExceptionsPropagate) {
   // A handler that succeeds (DBNames over an empty root) but whose answer
   // cannot be handed on.
-  testing_support::TempDir root;
-  DBConfig config;
-  config.DBRoot = (root / "none").string() + "/";
-  DBConfig::TestOverride override(config);
-
-  auto failing = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw std::runtime_error("send"); });
+  const auto pool = poolAt(dir / "none");
+  auto failing = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw std::runtime_error("send"); },
+                                          pool);
   auto cmd = failing->makeCmd(DBNames::kTag);
   cmd->attachSocket(socket);
   failing->processCmd(cmd);
   EXPECT_TRUE(log.contains(Log::Error, "Dispatching command DBNames failed with send"));
   EXPECT_EQ(socket->closeReason(), kTerminating);
 
-  auto odd = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw 42; });
+  auto odd = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw 42; }, pool);
   cmd = odd->makeCmd(DBNames::kTag);
   EXPECT_THROW(odd->processCmd(cmd), int);
 
@@ -115,29 +119,29 @@ TEST_F(ListenerTest, AFailureWhileAnsweringEndsTheConnectionAndOtherExceptionsPr
   EXPECT_TRUE(other->isOpen());
 }
 
-TEST_F(ListenerTest, DBNamesListsEveryDatabaseBelowTheRootButNotTheServersOwnFolders) {
-  testing_support::TempDir root;
-  {
-    // A root that does not exist yet holds no database.
-    DBConfig missing;
-    missing.DBRoot = (root / "not-created-yet").string() + "/";
-    DBConfig::TestOverride override(missing);
-    listener->processCmd(received(DBNames::kTag));
-    ASSERT_EQ(answered.size(), 1u);
-    EXPECT_TRUE(std::static_pointer_cast<DBNames>(answered[0])->respList().empty());
-    answered.clear();
-  }
+// Only real databases: not the server's own folders, not a file of the
+// database file's name among another database's data files (a client may
+// name a data file so), not a file directly in the root.
+TEST_F(ListenerTest, DBNamesListsEveryDatabaseBelowTheRootButNothingElse) {
+  // A root that does not exist yet holds no database.
+  listener->processCmd(received(DBNames::kTag));
+  ASSERT_EQ(answered.size(), 1u);
+  EXPECT_TRUE(std::static_pointer_cast<DBNames>(answered[0])->respList().empty());
+  answered.clear();
+
+  const auto root = dir / "db";
   const auto db = [&](const std::string& rel) { testing_support::writeFile(root / rel / "cvdb.edb", "x"); };
   db("plant");
   db("plant/line2");
   db("other/deep/er");
   db("db.backup/old");
   db("db.temp/work");
+  db("plant/d/x");            // a data file named like the database file
+  db("plant/d/x/d/y");
+  db("docs/d/cvdb.edb/z");    // below a data folder of a folder that is no database
+  std::filesystem::create_directory_symlink(root / "plant", root / "link");
   testing_support::writeFile(root / "notes" / "cvdb.edb.bak", "x");
   testing_support::writeFile(root / "cvdb.edb", "x");  // not inside a folder below the root
-  DBConfig config;
-  config.DBRoot = root.path().string() + "/";
-  DBConfig::TestOverride override(config);
 
   auto cmd = received(DBNames::kTag);
   listener->processCmd(cmd);

@@ -14,7 +14,7 @@ TEST(PackInfo, ValuesOfTheWrongTypeReadAsAbsentAndSurviveUpdates) {
   json::Object stored = json::strToObject(
       R"({"name": 5, "owner": null, "created": "yesterday", "modified": 1.5, "docCount": 99999999999,
           "uses": "garbage"})");
-  const PackInfoPartial p(stored, Ipc::kUseLimitSeconds);
+  const PackInfoPartial p(stored, Ipc::kUseLimitSeconds, kNow);
   EXPECT_EQ(p.name, PackInfoPartial::STR_INVALID);
   EXPECT_EQ(p.owner, PackInfoPartial::STR_INVALID);
   EXPECT_EQ(p.created, PackInfoPartial::TIME_INVALID);
@@ -28,7 +28,6 @@ TEST(PackInfo, ValuesOfTheWrongTypeReadAsAbsentAndSurviveUpdates) {
 }
 
 TEST(UseInfos, ReadingDropsEntriesOlderThanTheLimit) {
-  Ipc::FixedUseClock clock(kNow);
   UseInfos list;
   list.append(UseInfo(UseInfo::OpenForEdit, "h", "u", 1, kNow - 25200));      // exactly at the limit
   list.append(UseInfo(UseInfo::LockForUpload, "h", "u", 2, kNow - 25201));    // one second too old
@@ -36,20 +35,18 @@ TEST(UseInfos, ReadingDropsEntriesOlderThanTheLimit) {
   json::Object obj;
   list.serialize(obj);
 
-  const UseInfos limited(obj, Ipc::kUseLimitSeconds);
+  const UseInfos limited(obj, Ipc::kUseLimitSeconds, kNow);
   ASSERT_EQ(limited.size(), 2u);
   EXPECT_EQ(limited[0].process, 1u);
   EXPECT_EQ(limited[1].process, 3u);
   EXPECT_EQ(limited.findUploadInf(), nullptr);  // the crashed uploader's lock is gone
 
-  EXPECT_EQ(UseInfos(obj, 0).size(), 3u);  // no limit
+  EXPECT_EQ(UseInfos(obj, 0, kNow).size(), 3u);  // no limit
 
-  clock.advance(1);
-  EXPECT_EQ(UseInfos(obj, Ipc::kUseLimitSeconds).size(), 1u);
+  EXPECT_EQ(UseInfos(obj, Ipc::kUseLimitSeconds, kNow + 1).size(), 1u);  // a second later
 }
 
 TEST(UseInfos, MalformedStoredEntriesAreDropped) {
-  Ipc::FixedUseClock clock(kNow);
   const json::Object obj = json::strToObject(R"({"entries": [
       {"state": 0, "host": "ok", "user": "u", "process": 1, "time": 1700000000},
       {"state": 0, "host": 7, "time": 1700000000},
@@ -58,11 +55,11 @@ TEST(UseInfos, MalformedStoredEntriesAreDropped) {
       {"state": 0, "host": "h", "process": -1, "time": 1700000000},
       {"state": 2, "host": "nouser", "time": 1700000000},
       17 ]})");
-  const UseInfos list(obj, Ipc::kUseLimitSeconds);
+  const UseInfos list(obj, Ipc::kUseLimitSeconds, kNow);
   ASSERT_EQ(list.size(), 2u);
   EXPECT_EQ(list[0].host, "ok");
   EXPECT_EQ(list[1], UseInfo(UseInfo::LockForUpload, "nouser", "", 0, kNow));
-  EXPECT_TRUE(UseInfos(json::Value(), Ipc::kUseLimitSeconds).empty());
+  EXPECT_TRUE(UseInfos(json::Value(), Ipc::kUseLimitSeconds, kNow).empty());
 }
 
 }  // namespace

@@ -11,7 +11,6 @@ namespace {
 
 namespace fs = std::filesystem;
 using store_testing::entries;
-using store_testing::FailingFileOps;
 using store_testing::StoreTest;
 using testing_support::LogCapture;
 using testing_support::readFile;
@@ -33,7 +32,7 @@ std::string messageOf(const std::function<void()>& op) {
 using DataFiles = StoreTest;
 
 TEST_F(DataFiles, FilesAreWrittenAndReadWholeUnderTheirIdsFolder) {
-  DB::DBLocal db("docs");  // data files need no open database
+  DB::DBLocal db(pool(), "docs");  // data files need no open database
   EXPECT_TRUE(db.loadDataBlob("1234", "page.tif").empty());
   const std::string content("binary\0bytes\xff", 13);
   save(db, "1234", "page.tif", content);
@@ -48,7 +47,7 @@ TEST_F(DataFiles, FilesAreWrittenAndReadWholeUnderTheirIdsFolder) {
 
 TEST_F(DataFiles, NamesThatAreNotOnePathComponentAreRefusedBeforeAnyFileIsTouched) {
   writeFile(dir_ / "secret", "outside the root");
-  DB::DBLocal db("docs");
+  DB::DBLocal db(pool(), "docs");
   for (const std::string& name : {std::string(""), std::string("."), std::string(".."), std::string("../../../secret"),
                                   std::string("a/b"), std::string("a\\b"), std::string("x\0y", 3)}) {
     for (const auto& [id, file] : {std::pair{name, std::string("f")}, std::pair{std::string("id"), name}}) {
@@ -66,18 +65,16 @@ TEST_F(DataFiles, NamesThatAreNotOnePathComponentAreRefusedBeforeAnyFileIsTouche
 
 TEST_F(DataFiles, AWriteThatFailsHalfWayKeepsThePreviousContent) {
   LogCapture log;
-  DB::DBLocal db("docs");
+  DB::DBLocal db(pool(), "docs");
   save(db, "7", "scan", "the previous content");
   const std::string path = root() + "docs/d/7/scan";
-  for (const auto& [step, failure] : std::vector<std::pair<std::string, FailingFileOps>>{
-           {"write", [] { FailingFileOps f; f.write_ = {.nth = 1, .error = ENOSPC, .partial = 4096}; return f; }()},
-           {"flush", [] { FailingFileOps f; f.fsync_ = {.nth = 1}; return f; }()},
-           {"rename", [] { FailingFileOps f; f.rename_ = {.nth = 1, .error = EXDEV}; return f; }()}}) {
-    FailingFileOps ops = failure;
-    DB::FileOps::Replacement replaced(ops);
+  using Op = testing_support::FaultEnv::Op;
+  for (const auto& [op, step, error] : std::vector<std::tuple<Op, std::string, int>>{
+           {Op::Write, "write", ENOSPC}, {Op::Sync, "flush", EIO}, {Op::Rename, "rename", EXDEV}}) {
+    env_.failNth(op, 1, error);
     EXPECT_EQ(messageOf([&] { save(db, "7", "scan", std::string(1 << 20, 'n')); }),
               "Error writing to database file: \"" + path + '"');
-    EXPECT_TRUE(log.contains(Log::Warning, "Failed to " + step)) << step;
+    EXPECT_TRUE(log.contains(Log::Warning, "Failed to injected: " + step)) << step;
     EXPECT_EQ(db.loadDataBlob("7", "scan").view(), "the previous content") << step;
     EXPECT_EQ(entries(root() + "docs/d/7"), std::vector<std::string>{"scan"}) << step;  // no leftover
   }
@@ -85,7 +82,7 @@ TEST_F(DataFiles, AWriteThatFailsHalfWayKeepsThePreviousContent) {
 
 TEST_F(DataFiles, CopyingAFolderMergesIntoTheTargetAndKeepsTheSource) {
   LogCapture log;
-  DB::DBLocal db("docs");
+  DB::DBLocal db(pool(), "docs");
   save(db, "old", "a", "A");
   save(db, "old", "b", "B");
   writeFile(root() + "docs/d/old/nested/c", "C");

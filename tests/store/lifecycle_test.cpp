@@ -23,21 +23,8 @@ using store_testing::StoreTest;
 using testing_support::LogCapture;
 using testing_support::RawDb;
 
-// Fails the first n access tests with the error, as if the file were
-// unreadable or not there.
-struct BlindAccess : DB::FileOps {
-  int n;
-  int error;
-  BlindAccess(int times, int err) : n(times), error(err) {}
-  int access(const char* path, int mode) override {
-    if (n-- <= 0) return DB::FileOps::access(path, mode);
-    errno = error;
-    return -1;
-  }
-};
-
-std::uint64_t sessionsOf(const std::string& key) {
-  const auto rec = DB::DBInstances::inst()->record(key);
+std::uint64_t sessionsOf(const DB::DBInstances& pool, const std::string& key) {
+  const auto rec = pool.record(key);
   return rec ? rec->sessions : 0;
 }
 
@@ -87,7 +74,7 @@ TEST_F(Lifecycle, ANewDatabaseGetsItsFileAndTablesWhoseLimitsTheEngineEnforces) 
 }
 
 TEST_F(Lifecycle, SessionsAreTakenOnlyForExistingOrCreatedDatabasesAndGivenBackOnce) {
-  DB::DBLocal missing("nowhere");
+  DB::DBLocal missing(pool(), "nowhere");
   EXPECT_FALSE(missing.exists(true));
   EXPECT_FALSE(missing.isOpen());
   EXPECT_FALSE(fs::exists(root()));
@@ -96,35 +83,34 @@ TEST_F(Lifecycle, SessionsAreTakenOnlyForExistingOrCreatedDatabasesAndGivenBackO
   auto first = open("shared");
   auto second = open("shared");
   EXPECT_EQ(log.count("New database created"), 1u);
-  EXPECT_EQ(sessionsOf("shared"), 2u);
+  EXPECT_EQ(sessionsOf(*pool(), "shared"), 2u);
   EXPECT_TRUE(second->exists(true));  // gives its old session back first
-  EXPECT_EQ(sessionsOf("shared"), 2u);
+  EXPECT_EQ(sessionsOf(*pool(), "shared"), 2u);
   EXPECT_TRUE(first->disconnect());
   EXPECT_FALSE(first->disconnect());
   second.reset();
-  EXPECT_EQ(sessionsOf("shared"), 0u);
+  EXPECT_EQ(sessionsOf(*pool(), "shared"), 0u);
   EXPECT_EQ(log.count(Log::Error, "unknown instance"), 0u);
 }
 
 TEST_F(Lifecycle, AnExistingButInaccessibleDatabaseIsReportedAndLeftAlone) {
   open("kept")->saveMetaBlob("v", 1, "k");
-  DB::DBInstances::teardown();
-  BlindAccess denied(1, EACCES);
-  DB::FileOps::Replacement replaced(denied);
-  DB::DBLocal db("kept");
+  ASSERT_TRUE(pool()->closeIfDormant("kept"));
+  env_.failNth(testing_support::FaultEnv::Op::Access, 1, EACCES);
+  DB::DBLocal db(pool(), "kept");
   expectCode([&] { db.exists(false); }, DB::err::kFileAccessDenied, root() + "kept/cvdb.edb");
-  EXPECT_FALSE(DB::DBInstances::inst()->record("kept"));
+  EXPECT_FALSE(pool()->record("kept"));
   EXPECT_TRUE(db.exists(true));  // the next look succeeds: nothing was lost
   EXPECT_EQ(db.loadMetaBlob("k").view(), "v");
 }
 
 TEST_F(Lifecycle, ADatabaseThatAppearsBeforeItsCreationIsNeverOverwritten) {
   open("raced")->saveMetaBlob("v", 1, "k");
-  DB::DBInstances::teardown();
+  ASSERT_TRUE(pool()->closeIfDormant("raced"));
   // Both looks miss the file, as when another process made it just then.
-  BlindAccess blind(2, ENOENT);
-  DB::FileOps::Replacement replaced(blind);
-  DB::DBLocal db("raced");
+  env_.failNth(testing_support::FaultEnv::Op::Access, 1, ENOENT);
+  env_.failNth(testing_support::FaultEnv::Op::Access, 2, ENOENT);
+  DB::DBLocal db(pool(), "raced");
   expectCode([&] { db.exists(false); }, DB::err::kDatabaseDuplicate);
   EXPECT_TRUE(db.exists(true));
   EXPECT_EQ(db.loadMetaBlob("k").view(), "v");
@@ -132,20 +118,21 @@ TEST_F(Lifecycle, ADatabaseThatAppearsBeforeItsCreationIsNeverOverwritten) {
 
 TEST_F(Lifecycle, AFailedCreationRemovesWhatItMadeAndNothingElse) {
   LogCapture log;
-  DB::DBLocal::setCreationHookForTesting([](engine::Session&) { throw std::runtime_error("tables failed"); });
-  DB::DBLocal fresh("Deep\\Er");
+  // The database file cannot be put in place.
+  env_.failOnPath(testing_support::FaultEnv::Op::Link, ".creating");
+  DB::DBLocal fresh(pool(), "Deep\\Er");
   EXPECT_THROW(fresh.exists(false), std::runtime_error);
   EXPECT_TRUE(log.contains(Log::Error, "Failed to create new database in \"deep\\er\""));
   EXPECT_FALSE(fs::exists(root() + "deep"));
   EXPECT_FALSE(fs::exists(logRoot() + "deep"));
-  EXPECT_FALSE(DB::DBInstances::inst()->record("deep\\er"));
+  EXPECT_FALSE(pool()->record("deep\\er"));
 
   // A folder that was there before keeps what it held.
-  DB::DBLocal closed("busy");
+  DB::DBLocal closed(pool(), "busy");
   closed.saveDataBlob("x", 1, "doc", "page");
   EXPECT_THROW(closed.exists(false), std::runtime_error);
   EXPECT_EQ(entries(root() + "busy"), std::vector<std::string>{"d"});
-  DB::DBLocal::setCreationHookForTesting({});
+  env_.clearFailures();
   EXPECT_TRUE(closed.exists(false));
   EXPECT_EQ(closed.loadDataBlob("doc", "page").view(), "x");
 }
@@ -153,11 +140,11 @@ TEST_F(Lifecycle, AFailedCreationRemovesWhatItMadeAndNothingElse) {
 TEST_F(Lifecycle, ADatabaseCutOffBeforeItsTablesGetsThemAndOneMissingATableIsRefused) {
   open("cut");
   open("half");
-  DB::DBInstances::teardown();
+  ASSERT_TRUE(pool()->closeIfDormant("cut") && pool()->closeIfDormant("half"));
   RawDb(root() + "cut/cvdb.edb").exec("DROP TABLE info; DROP TABLE meta;");
   RawDb(root() + "half/cvdb.edb").exec("DROP TABLE info;");
   open("cut")->saveMetaBlob("v", 1, "k");
-  DB::DBLocal half("half");
+  DB::DBLocal half(pool(), "half");
   expectCode([&] { half.exists(true); }, DB::err::kInvalidDatabase, "\"info\"");
 }
 

@@ -46,11 +46,11 @@ std::string refusal(const std::function<void()>& op) {
 class PackUse : public StoreTest {
  protected:
   PackUse() {
+    env_.useManualClock(sys::WallClock::time_point(std::chrono::seconds(kT0)));
     db = open("u");
     db->savePackMeta(complete("P", "f", 1), "content", 7);
   }
   std::unique_ptr<DB::DBLocal> db;
-  Ipc::FixedUseClock clock{kT0};
 
   Ipc::PackInfoPtr fetch(UseInfo::State state, const std::string& host, std::uint32_t process = 7) {
     return db->packMetadata(useRequest("P", state, host, process)).info;
@@ -106,7 +106,7 @@ TEST_F(PackUse, TheUploadLockBelongsToOneHostAndARefusalLeavesNoTrace) {
 
   // The same host renews the lock: one entry, the later time; another
   // process of that host takes it over.
-  clock.advance(60);
+  env_.advance(std::chrono::seconds(60));
   fetch(UseInfo::LockForUpload, "scan-A", 9);
   const auto list = db->infoFor("P")->uses;
   EXPECT_EQ(usesOf(*db, "P"), (E{{0, "ws-9", 1}, {2, "scan-A", 9}}));
@@ -126,12 +126,12 @@ TEST_F(PackUse, TheUploadLockBelongsToOneHostAndARefusalLeavesNoTrace) {
 TEST_F(PackUse, ALockOlderThanSevenHoursNoLongerBlocksAnotherHost) {
   fetch(UseInfo::LockForUpload, "crashed");
   fetch(UseInfo::OpenForEdit, "crashed", 3);
-  clock.advance(Ipc::kUseLimitSeconds);
+  env_.advance(std::chrono::seconds(Ipc::kUseLimitSeconds));
   // Exactly at the limit the entries still count.
   EXPECT_EQ(refusal([&] { fetch(UseInfo::LockForUpload, "scan-B"); }), kLocked);
   EXPECT_EQ(db->infoFor("P")->uses.size(), 2u);
 
-  clock.advance(1);
+  env_.advance(std::chrono::seconds(1));
   EXPECT_TRUE(db->infoFor("P")->uses.empty());  // every read applies the limit
   const auto taken = fetch(UseInfo::LockForUpload, "scan-B");
   ASSERT_EQ(taken->uses.size(), 1u);

@@ -6,45 +6,26 @@
 
 namespace store_testing {
 
-StoreTest::StoreTest() {
-  DBConfig config;
-  config.DBRoot = root();
-  config.DBLogRoot = logRoot();
-  config.BackupFolder = root() + "db.backup/";
-  override_ = std::make_unique<DBConfig::TestOverride>(config);
+namespace {
+
+DB::PoolSettings testSettings() {
+  DB::PoolSettings s;
+  s.maintenanceTick = std::chrono::milliseconds(5);
+  return s;
 }
 
-StoreTest::~StoreTest() {
-  DB::DBInstances::teardown();
-  DB::DBLocal::setCreationHookForTesting({});
-}
+}  // namespace
+
+StoreTest::StoreTest()
+    : pool_(DB::DBInstances::create(testSettings(), DB::Paths(root(), logRoot(), root() + "db.backup/", "cvdb.edb"),
+                                    env_)) {}
+
+StoreTest::~StoreTest() { pool_->stop(); }
 
 std::unique_ptr<DB::DBLocal> StoreTest::open(const std::string& name) {
-  auto db = std::make_unique<DB::DBLocal>(name);
+  auto db = std::make_unique<DB::DBLocal>(pool_, name);
   EXPECT_TRUE(db->exists(false));
   return db;
-}
-
-ssize_t FailingFileOps::write(int fd, const void* data, std::size_t size) {
-  ++writes_;
-  if (writes_ == write_.nth && write_.partial > 0) return FileOps::write(fd, data, std::min(size, write_.partial));
-  if (writes_ == write_.nth + (write_.partial > 0 ? 1 : 0)) {
-    errno = write_.error;
-    return -1;
-  }
-  return FileOps::write(fd, data, size);
-}
-
-int FailingFileOps::fsync(int fd) {
-  if (++fsyncs_ != fsync_.nth) return FileOps::fsync(fd);
-  errno = fsync_.error;
-  return -1;
-}
-
-int FailingFileOps::rename(const char* from, const char* to) {
-  if (++renames_ != rename_.nth) return FileOps::rename(from, to);
-  errno = rename_.error;
-  return -1;
 }
 
 std::vector<std::string> entries(const std::filesystem::path& folder) {

@@ -1,7 +1,7 @@
 #pragma once
-// Shared set-up of the store tests: settings whose folders lie in a
-// temporary folder, a fresh engine pool per test, a file-system double
-// that fails chosen calls, and pack records to send.
+// Shared set-up of the store tests: a fresh engine pool per test whose
+// folders lie in a temporary folder and whose files and clock go through a
+// fault double (which fails chosen calls), and pack records to send.
 
 #include <gtest/gtest.h>
 
@@ -13,9 +13,9 @@
 
 #include "framework/json.h"
 #include "protocol/pack_info.h"
-#include "service/config.h"
+#include "engine/db_instances.h"
 #include "store/db_local.h"
-#include "store/file_ops.h"
+#include "support/fault_env.h"
 #include "support/raw_db.h"
 #include "support/temp_dir.h"
 
@@ -28,32 +28,15 @@ class StoreTest : public ::testing::Test {
 
   std::string root() const { return dir_.path().string() + "/db/"; }
   std::string logRoot() const { return dir_.path().string() + "/logs/"; }
+  const std::shared_ptr<DB::DBInstances>& pool() const { return pool_; }
   // A store on the database, opened (and created when missing).
   std::unique_ptr<DB::DBLocal> open(const std::string& name);
 
   testing_support::TempDir dir_;
+  testing_support::FaultEnv env_{dir_ / "scratch"};
 
  private:
-  std::unique_ptr<DBConfig::TestOverride> override_;
-};
-
-// Real calls, except that the nth call (from 1) of a kind fails with error;
-// a write that fails after `partial` bytes first writes those bytes.
-class FailingFileOps : public DB::FileOps {
- public:
-  struct Failure {
-    int nth = 0;
-    int error = EIO;
-    std::size_t partial = 0;
-  };
-  Failure write_, fsync_, rename_;
-
-  ssize_t write(int fd, const void* data, std::size_t size) override;
-  int fsync(int fd) override;
-  int rename(const char* from, const char* to) override;
-
- private:
-  int writes_ = 0, fsyncs_ = 0, renames_ = 0;
+  std::shared_ptr<DB::DBInstances> pool_;
 };
 
 // The names in a folder, sorted; empty when it is missing.

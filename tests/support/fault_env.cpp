@@ -66,9 +66,7 @@ class FaultFile final : public sys::File {
 
 }  // namespace
 
-FaultEnv::FaultEnv(Path scratch, sys::Env& base) : base_(base), scratch_(std::move(scratch)) {
-  base_.createFolders(scratch_);
-}
+FaultEnv::FaultEnv(Path scratch, sys::Env& base) : base_(base), scratch_(std::move(scratch)) {}
 
 FaultEnv::~FaultEnv() = default;
 
@@ -104,7 +102,18 @@ std::uint64_t FaultEnv::injected() const {
   return injected_;
 }
 
+void FaultEnv::setCallHook(std::function<void(Op, const Path&)> hook) {
+  std::lock_guard lock(mutex_);
+  callHook_ = std::move(hook);
+}
+
 void FaultEnv::check(Op kind, const Path& path) {
+  std::function<void(Op, const Path&)> hook;
+  {
+    std::lock_guard lock(mutex_);
+    hook = callHook_;
+  }
+  if (hook) hook(kind, path);
   std::lock_guard lock(mutex_);
   const auto k = static_cast<int>(kind);
   const auto any = static_cast<int>(kAny);
@@ -188,6 +197,7 @@ void FaultEnv::rename(const Path& from, const Path& to) {
       n = ++keptFiles_;
     }
     replaced = scratch_ / ("replaced-" + std::to_string(n));
+    base_.createFolders(scratch_);
     base_.link(to, *replaced);
   }
   try {
@@ -235,8 +245,17 @@ std::vector<sys::DirEntry> FaultEnv::list(const Path& folder) {
   return base_.list(folder);
 }
 
+// An injected "not there" is an outcome of these two, as it is of the real
+// calls, not a failure.
+bool missing(const std::system_error& e) { return e.code().value() == ENOENT || e.code().value() == ENOTDIR; }
+
 sys::FileInfo FaultEnv::stat(const Path& path, bool follow) {
-  check(Op::Stat, path);
+  try {
+    check(Op::Stat, path);
+  } catch (const std::system_error& e) {
+    if (missing(e)) return {};
+    throw;
+  }
   return base_.stat(path, follow);
 }
 
@@ -251,7 +270,12 @@ std::uint64_t FaultEnv::freeSpace(const Path& path) {
 }
 
 bool FaultEnv::readWritable(const Path& path) {
-  check(Op::Access, path);
+  try {
+    check(Op::Access, path);
+  } catch (const std::system_error& e) {
+    if (missing(e)) return false;
+    throw;
+  }
   return base_.readWritable(path);
 }
 
@@ -304,15 +328,28 @@ sys::WallClock::time_point FaultEnv::now() {
   return base_.now();
 }
 
+void FaultEnv::setSleepHook(std::function<void(std::chrono::milliseconds)> hook) {
+  std::lock_guard lock(mutex_);
+  sleepHook_ = std::move(hook);
+}
+
 bool FaultEnv::sleepFor(std::chrono::milliseconds d, std::stop_token stop) {
+  std::function<void(std::chrono::milliseconds)> hook;
+  bool manual = false;
   {
     std::lock_guard lock(mutex_);
+    if (stop.stop_requested()) return false;
+    hook = sleepHook_;
     if (clock_) {
-      if (stop.stop_requested()) return false;
       *clock_ += d;
-      return true;
+      manual = true;
     }
   }
+  if (hook) {
+    hook(d);
+    return !stop.stop_requested();
+  }
+  if (manual) return true;
   return base_.sleepFor(d, stop);
 }
 

@@ -23,6 +23,7 @@
 #include <cerrno>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -66,6 +67,13 @@ class FaultEnv final : public sys::Env {
   // sleepFor(); until then the base clock runs.
   void useManualClock(sys::WallClock::time_point start);
   void advance(std::chrono::milliseconds d);
+  // From now on every sleepFor calls hook with its duration instead of
+  // sleeping (the manual clock, when used, still advances).
+  void setSleepHook(std::function<void(std::chrono::milliseconds)> hook);
+  // From now on hook runs at the start of every call, on the caller's
+  // thread and before any failure is injected (to interleave another
+  // thread's work with a chosen call).
+  void setCallHook(std::function<void(Op, const sys::Path&)> hook);
 
   // sys::Env
   std::unique_ptr<sys::File> open(const sys::Path& path, sys::OpenMode mode) override;
@@ -118,6 +126,8 @@ class FaultEnv final : public sys::Env {
   std::map<sys::Path, std::uint64_t> syncedSize_;      // guarded by mutex_: files written through this env
   std::uint64_t keptFiles_ = 0;                        // guarded by mutex_
   std::optional<sys::WallClock::time_point> clock_;    // guarded by mutex_
+  std::function<void(std::chrono::milliseconds)> sleepHook_;  // guarded by mutex_
+  std::function<void(Op, const sys::Path&)> callHook_;        // guarded by mutex_
 };
 
 }  // namespace testing_support

@@ -1,4 +1,4 @@
-#include "service/network_path.h"
+#include "settings/network_path.h"
 
 #include <linux/magic.h>
 #include <sys/stat.h>

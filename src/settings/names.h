@@ -7,8 +7,8 @@
 // the database, and under which it is listed and backed up. Keys keep "\" as
 // their separator; only the path functions below turn it into "/".
 //
-// All functions are pure functions of their input and of the settings
-// (DBConfig::inst()); they touch no file and may run on any thread.
+// All functions are pure functions of their input; they touch no file and
+// may run on any thread.
 
 #include <string>
 #include <string_view>
@@ -37,21 +37,17 @@ std::string folderName(std::string_view name);
 // reason.
 bool isValidDatabaseName(std::string_view name, std::string* why = nullptr);
 
-// Paths of a database, from its key; every folder ends with "/". Each "\"
-// of the key becomes "/", and empty components are dropped, so that a
-// leading separator never makes the path absolute. The key must come from
-// folderName() of a valid name (or from nameFromRelativeFolder): these
-// functions do not check for "." and "..".
-std::string databaseFolder(std::string_view key);  // DBRoot + key + "/"
-std::string logFolder(std::string_view key);       // DBLogRoot + key + "/"
-std::string tempFolder(std::string_view key);      // DBRoot + "db.temp/" + key + "/"
-std::string mainFile(std::string_view key);        // databaseFolder + DBFileName
-std::string dataFolder(std::string_view key);      // databaseFolder + "d/"
+// The path of a key below a root: each "\" of the key becomes "/", empty
+// components are dropped (a leading separator never makes the path
+// absolute), and the result ends with "/". The key must come from
+// folderName() of a valid name (or from nameFromRelativeFolder): "." and
+// ".." are not checked here. Paths (settings/paths.h) applies it to the
+// configured roots.
+std::string keyPath(std::string_view key);
 
 // The backup file name of a key (no folder), and the key read back from a
 // backup file name ("" when the name is not a backup file's).
 std::string backupFileName(std::string_view key);
-std::string backupFile(std::string_view key);  // BackupFolder + backupFileName
 std::string nameFromBackupFile(std::string_view fileName);
 
 // Whether a folder directly below DBRoot may hold databases.

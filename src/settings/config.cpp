@@ -1,8 +1,4 @@
-#include "service/config.h"
-
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
+#include "settings/config.h"
 
 #include <algorithm>
 #include <atomic>
@@ -12,9 +8,8 @@
 #include "framework/json.h"
 #include "framework/log.h"
 #include "framework/platform.h"
-#include "framework/unique_fd.h"
-#include "service/names.h"
-#include "service/network_path.h"
+#include "settings/names.h"
+#include "settings/network_path.h"
 
 namespace {
 
@@ -30,21 +25,13 @@ std::atomic<const DBConfig*> g_override{nullptr};
 // Reads the whole configuration file. False when it is missing or cannot be
 // read (a folder of that name included): the settings then keep their
 // defaults without a message, as an absent file does.
-bool readConfigFile(const std::string& path, std::string& text) {
-  const UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (fd.get() < 0) return false;
-  struct stat st {};
-  if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
-  text.clear();
-  char buffer[8192];
-  while (true) {
-    const ssize_t n = ::read(fd.get(), buffer, sizeof buffer);
-    if (n == 0) return true;
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    text.append(buffer, static_cast<std::size_t>(n));
+bool readConfigFile(sys::Env& env, const std::string& path, std::string& text) {
+  try {
+    if (env.stat(path, true).type != sys::FileType::Regular) return false;
+    text = env.readFile(path);
+    return true;
+  } catch (const std::system_error&) {
+    return false;
   }
 }
 
@@ -101,7 +88,7 @@ void readKeys(const json::Object& obj, DBConfig& c) {
 }
 
 const DBConfig& loadedRecord() {
-  static const DBConfig record = DBConfig::load(DBConfig::defaultRoot());
+  static const DBConfig record = DBConfig::load(DBConfig::defaultRoot(), sys::Env::posix());
   return record;
 }
 
@@ -122,13 +109,13 @@ const DBConfig& DBConfig::inst() {
   return loadedRecord();
 }
 
-DBConfig DBConfig::load(const std::string& defaultRoot) {
+DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env) {
   DBConfig c;
   c.DBRoot = defaultRoot;
   c.DBLogRoot = defaultRoot;
   try {
     std::string text;
-    if (readConfigFile(defaultRoot + kConfigFileName, text)) {
+    if (readConfigFile(env, defaultRoot + kConfigFileName, text)) {
       const json::Object obj = json::strToObject(text);
       if (obj.size() > 0) readKeys(obj, c);
     }

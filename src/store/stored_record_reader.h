@@ -7,8 +7,11 @@
 // most of a listing's time. The reader here streams the text through a SAX
 // parser and keeps only what PackInfoPartial holds.
 //
+// It belongs to the store, not to the wire protocol: it is how rows are
+// stored, and clients never read it.
+//
 // The result is exactly that of PackInfoPartial(json::strToObject(text),
-// useLimit) for every text, refusals included: values of the wrong type
+// useLimit, now) for every text, refusals included: values of the wrong type
 // read as absent, malformed use entries and entries older than the limit
 // are dropped, unknown keys are skipped, the last of duplicate keys wins,
 // and whatever jansson refuses (not one JSON object, trailing bytes,
@@ -19,7 +22,7 @@
 // Writes keep going through jansson (json::Object): they must keep the keys
 // this version does not know.
 //
-// Thread safety: no shared state besides the use clock (pack_info.h).
+// Thread safety: no shared state.
 // Failures: json::Exc for a text jansson refuses, std::bad_alloc.
 
 #include <cstdint>
@@ -32,11 +35,11 @@ namespace Ipc {
 // Overwrites every field of out's partial part (name, owner, created,
 // modified, docCount, uses) with those of the stored text. On a throw, out
 // holds some mix of old and new values.
-void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out);
+void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out);
 
-inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t useLimit) {
+inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now) {
   PackInfoPartial out;
-  readStoredPackInfo(text, useLimit, out);
+  readStoredPackInfo(text, useLimit, now, out);
   return out;
 }
 
@@ -47,6 +50,6 @@ inline PackInfoPartial readStoredPackInfo(std::string_view text, std::uint64_t u
 // writer stores one; jansson skips one right after a number or a literal).
 // The caller then asks jansson.
 // Exposed for the differential tests and the fuzz target.
-bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out);
+bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out);
 
 }  // namespace Ipc

@@ -1,4 +1,4 @@
-#include "service/names.h"
+#include "settings/names.h"
 
 #include <gtest/gtest.h>
 
@@ -8,25 +8,16 @@
 #include <string>
 #include <vector>
 
-#include "service/config.h"
+#include "settings/paths.h"
 #include "support/log_capture.h"
 
 namespace {
 
 using testing_support::LogCapture;
 
-DBConfig testConfig() {
-  DBConfig c;
-  c.DBRoot = "/srv/root/";
-  c.DBLogRoot = "/srv/logs/";
-  c.BackupFolder = "/srv/bak/";
-  c.DBFileName = "main.edb";
-  return c;
-}
-
 class Names : public ::testing::Test {
  protected:
-  DBConfig::TestOverride config_{testConfig()};
+  const DB::Paths paths_{"/srv/root/", "/srv/logs/", "/srv/bak/", "main.edb"};
 };
 
 TEST(FolderName, NamesBecomeLowerCaseKeysWithDataFoldersEscaped) {
@@ -73,19 +64,19 @@ TEST(ValidName, RefusesNamesThatLeaveTheRootOrAliasAnotherKey) {
 
 TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRootsAndNeverLeaveThem) {
   const std::string key = DB::folderName("Team\\Sales");
-  EXPECT_EQ(DB::databaseFolder(key), "/srv/root/team/sales/");
-  EXPECT_EQ(DB::logFolder(key), "/srv/logs/team/sales/");
-  EXPECT_EQ(DB::tempFolder(key), "/srv/root/db.temp/team/sales/");
-  EXPECT_EQ(DB::mainFile(key), "/srv/root/team/sales/main.edb");
-  EXPECT_EQ(DB::dataFolder(key), "/srv/root/team/sales/d/");
-  EXPECT_EQ(DB::backupFile(key), "/srv/bak/team_sales.cvbak");
-  EXPECT_EQ(DB::databaseFolder("root.db"), "/srv/root/root.db/");
+  EXPECT_EQ(paths_.databaseFolder(key), "/srv/root/team/sales/");
+  EXPECT_EQ(paths_.logFolder(key), "/srv/logs/team/sales/");
+  EXPECT_EQ(paths_.tempFolder(key), "/srv/root/db.temp/team/sales/");
+  EXPECT_EQ(paths_.mainFile(key), "/srv/root/team/sales/main.edb");
+  EXPECT_EQ(paths_.dataFolder(key), "/srv/root/team/sales/d/");
+  EXPECT_EQ(paths_.backupFile(key), "/srv/bak/team_sales.cvbak");
+  EXPECT_EQ(paths_.databaseFolder("root.db"), "/srv/root/root.db/");
   EXPECT_EQ(DB::nameFromRelativeFolder("Team/sales/"), "team\\sales");
   // Keys with empty components come from refused names only, but a path
   // must never turn absolute or gain "//" on the way.
-  EXPECT_EQ(DB::databaseFolder("\\sales"), "/srv/root/sales/");
-  EXPECT_EQ(DB::databaseFolder("sales\\"), "/srv/root/sales/");
-  EXPECT_EQ(DB::tempFolder("a\\\\b"), "/srv/root/db.temp/a/b/");
+  EXPECT_EQ(paths_.databaseFolder("\\sales"), "/srv/root/sales/");
+  EXPECT_EQ(paths_.databaseFolder("sales\\"), "/srv/root/sales/");
+  EXPECT_EQ(paths_.tempFolder("a\\\\b"), "/srv/root/db.temp/a/b/");
   // The server's own folders below the root are no databases.
   for (const char* name : {"db.backup", "db.temp", ".config"}) EXPECT_FALSE(DB::isDBFolderName(name)) << name;
   for (const char* name : {"DB.backup", "db.backup2", "sales", ".configx"}) EXPECT_TRUE(DB::isDBFolderName(name)) << name;
@@ -99,7 +90,7 @@ TEST_F(Names, ValidNamesStayInsideTheirOwnFolder) {
   const std::string alphabet = "aD./\\\\d..-_x";
   std::uniform_int_distribution<std::size_t> length(0, 10);
   std::uniform_int_distribution<std::size_t> pick(0, alphabet.size() - 1);
-  const std::filesystem::path root = DBConfig::inst().DBRoot;
+  const std::filesystem::path root = paths_.root();
   int valid = 0;
   for (int i = 0; i < 20000; ++i) {
     std::string name;
@@ -107,7 +98,7 @@ TEST_F(Names, ValidNamesStayInsideTheirOwnFolder) {
     if (!DB::isValidDatabaseName(name)) continue;
     ++valid;
     const std::string key = DB::folderName(name);
-    const std::string folder = DB::databaseFolder(key);
+    const std::string folder = paths_.databaseFolder(key);
     ASSERT_EQ(std::filesystem::path(folder).lexically_normal().string(), folder) << name;
     const std::filesystem::path relative = std::filesystem::path(folder).lexically_relative(root);
     ASSERT_FALSE(relative.empty()) << name;

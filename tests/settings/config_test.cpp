@@ -1,4 +1,4 @@
-#include "service/config.h"
+#include "settings/config.h"
 
 #include <gtest/gtest.h>
 #include <linux/magic.h>
@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "framework/platform.h"
-#include "service/network_path.h"
+#include "settings/network_path.h"
 #include "support/log_capture.h"
 #include "support/temp_dir.h"
 
@@ -31,7 +31,7 @@ class ConfigFile {
     if (text) testing_support::writeFile(root_ + "config.json", text);
   }
   const std::string& root() const { return root_; }
-  DBConfig load() const { return DBConfig::load(root_); }
+  DBConfig load() const { return DBConfig::load(root_, sys::Env::posix()); }
 
  private:
   TempDir dir_;

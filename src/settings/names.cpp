@@ -1,10 +1,9 @@
-#include "service/names.h"
+#include "settings/names.h"
 
 #include <array>
 #include <vector>
 
 #include "framework/log.h"
-#include "service/config.h"
 
 namespace DB {
 namespace {
@@ -28,7 +27,9 @@ std::vector<std::string_view> split(std::string_view text, char separator) {
 
 char lowerAscii(char c) { return (c >= 'A' && c <= 'Z') ? static_cast<char>(c - 'A' + 'a') : c; }
 
-// A key as a relative path: "\" becomes "/", and empty components (a
+}  // namespace
+
+// Keys as relative paths: "\" becomes "/", and empty components (a
 // leading separator, doubled or trailing ones) are dropped. Such keys come
 // only from names that isValidDatabaseName refuses; collapsing them keeps
 // every derived path a plain, canonical text below its root, so that a
@@ -42,8 +43,6 @@ std::string keyPath(std::string_view key) {
   }
   return path;
 }
-
-}  // namespace
 
 std::string folderName(std::string_view name) {
   std::string key;
@@ -96,20 +95,6 @@ bool isValidDatabaseName(std::string_view name, std::string* why) {
   return true;
 }
 
-std::string databaseFolder(std::string_view key) {
-  return DBConfig::inst().DBRoot + keyPath(key);
-}
-
-std::string logFolder(std::string_view key) { return DBConfig::inst().DBLogRoot + keyPath(key); }
-
-std::string tempFolder(std::string_view key) {
-  return DBConfig::inst().DBRoot + kTempSubfolder + keyPath(key);
-}
-
-std::string mainFile(std::string_view key) { return databaseFolder(key) + DBConfig::inst().DBFileName; }
-
-std::string dataFolder(std::string_view key) { return databaseFolder(key) + kDataSubfolder; }
-
 std::string backupFileName(std::string_view key) {
   std::string out;
   out.reserve(key.size() + 16);
@@ -124,8 +109,6 @@ std::string backupFileName(std::string_view key) {
   out += kBackupExtension;
   return out;
 }
-
-std::string backupFile(std::string_view key) { return DBConfig::inst().BackupFolder + backupFileName(key); }
 
 std::string nameFromBackupFile(std::string_view fileName) {
   const auto ext = kBackupExtensionView.size();

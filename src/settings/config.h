@@ -15,6 +15,8 @@
 #include <memory>
 #include <string>
 
+#include "framework/env.h"
+
 class DBConfig {
  public:
   std::string DBRoot;
@@ -33,11 +35,11 @@ class DBConfig {
   // The process-wide record; loads and prints it on the first call.
   static const DBConfig& inst();
 
-  // Loads a record from defaultRoot + "config.json" without touching the
-  // process-wide one: every rule of the load (defaults, key order, type
-  // errors, limits, the backup-folder rule) applies, and the printout is
-  // logged. defaultRoot must end with "/".
-  static DBConfig load(const std::string& defaultRoot);
+  // Loads a record from defaultRoot + "config.json", read through env,
+  // without touching the process-wide one: every rule of the load
+  // (defaults, key order, type errors, limits, the backup-folder rule)
+  // applies, and the printout is logged. defaultRoot must end with "/".
+  static DBConfig load(const std::string& defaultRoot, sys::Env& env);
 
   // The default database root: the platform's system configuration folder
   // joined with "db", followed by "/".

@@ -1,7 +1,7 @@
 // The streaming reader of stored pack records against the jansson path it
 // replaces: the same record, or the same refusal, for every text.
 
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 
 #include <gtest/gtest.h>
 
@@ -39,7 +39,7 @@ struct Outcome {
 Outcome viaJansson(const std::string& text) {
   Outcome o;
   try {
-    o.value = PackInfoPartial(json::strToObject(text), Ipc::kUseLimitSeconds);
+    o.value = PackInfoPartial(json::strToObject(text), Ipc::kUseLimitSeconds, kNow);
     o.ok = true;
   } catch (const json::Exc& e) {
     o.error = e.what();
@@ -50,7 +50,7 @@ Outcome viaJansson(const std::string& text) {
 Outcome viaReader(const std::string& text) {
   Outcome o;
   try {
-    o.value = Ipc::readStoredPackInfo(text, Ipc::kUseLimitSeconds);
+    o.value = Ipc::readStoredPackInfo(text, Ipc::kUseLimitSeconds, kNow);
     o.ok = true;
   } catch (const json::Exc& e) {
     o.error = e.what();
@@ -72,7 +72,7 @@ void expectSame(const std::string& text, bool mayDefer = false) {
   }
 
   PackInfoPartial fast;
-  const bool fastOk = Ipc::tryReadStoredPackInfo(text, Ipc::kUseLimitSeconds, fast);
+  const bool fastOk = Ipc::tryReadStoredPackInfo(text, Ipc::kUseLimitSeconds, kNow, fast);
   if (fastOk) {
     EXPECT_TRUE(want.ok) << "the streaming reader took a text jansson refuses: " << want.error;
     EXPECT_EQ(fast, want.value);
@@ -83,7 +83,6 @@ void expectSame(const std::string& text, bool mayDefer = false) {
 
 class StoredRecordReader : public testing::Test {
  protected:
-  Ipc::FixedUseClock clock_{kNow};
 };
 
 // Valid records of the stored form, each exercising a different part of
@@ -178,7 +177,7 @@ TEST_F(StoredRecordReader, ReadsIntoARecordInPlace) {
   Ipc::PackInfo info("P1", "f/", 3, PackInfoPartial());
   info.name = "old";
   info.uses.append(Ipc::UseInfo(Ipc::UseInfo::OpenForEdit, "h", "u", 1, kNow));
-  Ipc::readStoredPackInfo(R"({"owner":"o","docCount":4})", Ipc::kUseLimitSeconds, info);
+  Ipc::readStoredPackInfo(R"({"owner":"o","docCount":4})", Ipc::kUseLimitSeconds, kNow, info);
   EXPECT_EQ(info.id(), "P1");
   EXPECT_EQ(info.folder(), "f/");
   EXPECT_EQ(info.status(), 3);

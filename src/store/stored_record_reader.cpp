@@ -1,4 +1,4 @@
-#include "protocol/stored_record_reader.h"
+#include "store/stored_record_reader.h"
 
 #include <locale.h>
 
@@ -333,7 +333,7 @@ constexpr std::size_t kKeptCapacity = std::size_t{1} << 20;
 
 }  // namespace
 
-bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out) {
+bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out) {
   // A NUL byte is among what plainUtf8 refuses; jansson has its own ways
   // with one, and decides.
   const auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
@@ -343,7 +343,7 @@ bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackIn
   std::string& buffer = state.text;
   buffer.assign(text);
   buffer.append(kPadding, '\0');
-  RecordHandler handler(out, oldestUseKept(useLimit));
+  RecordHandler handler(out, oldestUseKept(useLimit, now));
   rapidjson::InsituStringStream in(buffer.data());
   // In place: strings are decoded where they stand, never copied to the
   // parser's stack. Iterative: nesting costs the parser's heap stack, not
@@ -356,11 +356,11 @@ bool tryReadStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackIn
   return ok;
 }
 
-void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, PackInfoPartial& out) {
-  if (tryReadStoredPackInfo(text, useLimit, out)) return;
+void readStoredPackInfo(std::string_view text, std::uint64_t useLimit, std::int64_t now, PackInfoPartial& out) {
+  if (tryReadStoredPackInfo(text, useLimit, now, out)) return;
   // jansson decides what the streaming reader refused: it throws with its
   // own message, or reads one of the few texts the reader leaves to it.
-  out = PackInfoPartial(json::strToObject(text), useLimit);
+  out = PackInfoPartial(json::strToObject(text), useLimit, now);
 }
 
 }  // namespace Ipc

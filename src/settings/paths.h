@@ -1,0 +1,42 @@
+#pragma once
+// DB::Paths: where the files of every database are, from the configured
+// roots. Built once from the settings and handed to the layers that work
+// with files, so that none of them reads the process-wide settings.
+//
+// Every folder text ends with "/". Keys come from folderName() of a valid
+// name (names.h); the paths below a root are keyPath() of the key.
+// Thread safety: immutable after construction; any thread.
+
+#include <string>
+#include <string_view>
+
+class DBConfig;
+
+namespace DB {
+
+class Paths {
+ public:
+  explicit Paths(const DBConfig& config);
+  // root, logRoot and backupFolder end with "/".
+  Paths(std::string root, std::string logRoot, std::string backupFolder, std::string dbFileName);
+
+  const std::string& root() const noexcept { return root_; }
+  const std::string& logRoot() const noexcept { return logRoot_; }
+  const std::string& backupFolder() const noexcept { return backupFolder_; }
+  const std::string& dbFileName() const noexcept { return dbFileName_; }
+
+  std::string databaseFolder(std::string_view key) const;  // root + key + "/"
+  std::string logFolder(std::string_view key) const;       // logRoot + key + "/"
+  std::string tempFolder(std::string_view key) const;      // root + "db.temp/" + key + "/"
+  std::string mainFile(std::string_view key) const;        // databaseFolder + dbFileName
+  std::string dataFolder(std::string_view key) const;      // databaseFolder + "d/"
+  std::string backupFile(std::string_view key) const;      // backupFolder + backupFileName
+
+ private:
+  std::string root_;
+  std::string logRoot_;
+  std::string backupFolder_;
+  std::string dbFileName_;
+};
+
+}  // namespace DB
