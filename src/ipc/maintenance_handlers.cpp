@@ -82,8 +82,9 @@ void Listener::stopMaintenance() { maintenance_.stopAll(); }
 
 void Listener::process(Backup& cmd) {
   runAsync(cmd, "Starting Database Backup...",
-           [](::DB::DBLocal&, std::unique_ptr<::DB::DBProgressCallback>, std::stop_token) {
-             throw std::runtime_error("Backup is not available in this build yet");
+           [target = cmd.pth(), all = cmd.all()](::DB::DBLocal& db, std::unique_ptr<::DB::DBProgressCallback> callback,
+                                                 std::stop_token stop) {
+             db.backup(target, all, std::move(callback), std::move(stop));
            });
 }
 

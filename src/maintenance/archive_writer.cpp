@@ -381,12 +381,10 @@ void ArchiveWriter::commit(std::stop_token stop) {
     try {
       env_.syncFolder(destination_.parent_path());
     } catch (const std::system_error& e) {
-      // The name may not survive a power loss: the archive is not durable, so
-      // the backup fails and leaves nothing under that name.
-      try {
-        env_.remove(destination_);
-      } catch (const std::exception&) {
-      }
+      // The archive is whole (its content reached the disk before the
+      // rename) and has replaced the older one, but its name may not
+      // survive a power loss: the backup fails, and the archive stays, since
+      // removing it would leave nothing under that name.
       throw ArchiveError("Failed to flush the folder of the archive \"" + destination_.string() + "\": " + e.what());
     }
   } catch (...) {

@@ -35,7 +35,10 @@
 // central directory, sync, close or rename, and OperationStopped when the
 // stop token was triggered. A source file that cannot be opened is left out
 // and reported as skipped; a read that fails once the file is open fails the
-// archive (a silently cut entry would pass every checksum).
+// archive (a silently cut entry would pass every checksum). One failure
+// leaves the new archive in place: the folder's sync after the rename (the
+// archive is whole and has replaced the older one; only its name may not
+// survive a power loss).
 
 #include <cstdint>
 #include <functional>

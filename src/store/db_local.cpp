@@ -12,7 +12,10 @@
 #include "engine/db_instances.h"
 #include "engine/engine_errors.h"
 #include "engine/transaction.h"
+#include "maintenance/backup.h"
 #include "maintenance/cleanup.h"
+#include "settings/config.h"
+#include "store/catalog.h"
 #include "framework/log.h"
 #include "settings/names.h"
 #include "store/schema.h"
@@ -211,6 +214,25 @@ namespace DB {
 void DBLocal::cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
                       std::stop_token stop) {
   maint::cleanUp(pool_, name_, usedIds, *callback, std::move(stop));
+}
+
+void DBLocal::backup(const std::string& target, bool all, std::unique_ptr<DBProgressCallback> callback,
+                     std::stop_token stop) {
+  if (!all) {
+    maint::backupOne(pool_, name_, target, dbFile_, *callback, stop);
+    return;
+  }
+  // One target folder for every database; empty stays empty, so that each
+  // goes to its own default backup file.
+  const std::string folder = target.empty() ? std::string() : normaliseFolder(target);
+  for (const std::string& key : databaseKeys(env_, pool_->paths())) {
+    if (stop.stop_requested()) throw std::runtime_error("Backup stopped: the server is stopping");
+    // The hold needs the database's instance running: a session of our own
+    // opens it (ours is open already).
+    DBLocal other(pool_, key);
+    if (key != name_ && !other.exists(true)) continue;
+    maint::backupOne(pool_, key, folder, dbFile_, *callback, stop);
+  }
 }
 
 }  // namespace DB

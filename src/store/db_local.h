@@ -175,6 +175,12 @@ class DBLocal {
   // that was last written more than six hours ago (maint::cleanUp).
   void cleanUp(const std::set<std::string>& usedIds, std::unique_ptr<DBProgressCallback> callback,
                std::stop_token stop = {});
+  // Backs this database up into the archive that target names
+  // (maint::backupOne has the rules), or with all every database of the
+  // catalog into the folder target (empty: each into its default backup
+  // file). The first failure ends it; archives already written stay.
+  void backup(const std::string& target, bool all, std::unique_ptr<DBProgressCallback> callback,
+              std::stop_token stop = {});
 
  private:
   // The record of a row of the pack statements (columns id, folder,
