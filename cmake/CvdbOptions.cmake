@@ -6,6 +6,11 @@ target_compile_options(cvdb_options INTERFACE -Wall -Wextra -Wpedantic -Wshadow
 if(CVDB_WERROR)
   target_compile_options(cvdb_options INTERFACE -Werror)
 endif()
+# The lock annotations of framework/thread_annotations.h; GCC has no such
+# analysis and ignores them.
+if(CVDB_THREAD_SAFETY AND CMAKE_CXX_COMPILER_ID MATCHES "Clang")
+  target_compile_options(cvdb_options INTERFACE -Wthread-safety -Werror=thread-safety)
+endif()
 target_compile_definitions(cvdb_options INTERFACE
   CVDB_VERSION="${PROJECT_VERSION}" BOOST_ASIO_NO_DEPRECATED)
 if(CVDB_SANITIZE)
