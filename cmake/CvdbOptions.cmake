@@ -6,6 +6,24 @@ target_compile_options(cvdb_options INTERFACE -Wall -Wextra -Wpedantic -Wshadow
 if(CVDB_WERROR)
   target_compile_options(cvdb_options INTERFACE -Werror)
 endif()
+# The lock annotations of framework/thread_annotations.h; GCC has no such
+# analysis and ignores them.
+if(CVDB_THREAD_SAFETY AND CMAKE_CXX_COMPILER_ID MATCHES "Clang")
+  target_compile_options(cvdb_options INTERFACE -Wthread-safety -Werror=thread-safety)
+endif()
+# clang before 15 on libstdc++ 12 has no std::source_location; the project
+# supplies it there (framework/source_location_compat.h).
+if(CMAKE_CXX_COMPILER_ID MATCHES "Clang")
+  include(CheckCXXSourceCompiles)
+  check_cxx_source_compiles([[
+#include <source_location>
+int main() { return static_cast<int>(std::source_location::current().line()) > 0 ? 0 : 1; }
+]] CVDB_HAVE_SOURCE_LOCATION)
+  if(NOT CVDB_HAVE_SOURCE_LOCATION)
+    target_compile_options(cvdb_options INTERFACE
+      "$<$<COMPILE_LANGUAGE:CXX>:SHELL:-include ${PROJECT_SOURCE_DIR}/src/framework/source_location_compat.h>")
+  endif()
+endif()
 target_compile_definitions(cvdb_options INTERFACE
   CVDB_VERSION="${PROJECT_VERSION}" BOOST_ASIO_NO_DEPRECATED)
 if(CVDB_SANITIZE)

@@ -1,7 +1,5 @@
 #include "engine/db_instances.h"
 
-#include <mutex>
-
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
 #include "framework/open_files.h"
@@ -64,17 +62,17 @@ DBInstances::DBInstances(Token, PoolSettings settings, Paths paths, sys::Env& en
 DBInstances::~DBInstances() {
   // Reached when the service did not stop the pool (a test, an early exit);
   // the logging may already be gone then, so this stops quietly.
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (!stopped_) stopEngine(false);
 }
 
 void DBInstances::stop() noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (!stopped_) stopEngine(true);
 }
 
 bool DBInstances::stopped() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return stopped_;
 }
 
@@ -125,14 +123,13 @@ std::unique_ptr<engine::Session> DBInstances::beginSession(InstanceRec& record) 
 
 // Returns a session on the database's open instance, waiting while another
 // caller opens it; null when the database has no record. Under the lock.
-std::unique_ptr<engine::Session> DBInstances::sessionOnOpen(std::unique_lock<std::mutex>& lock,
-                                                            const std::string& dbKey) {
+std::unique_ptr<engine::Session> DBInstances::sessionOnOpen(sys::MutexLock& lock, const std::string& dbKey) {
   for (;;) {
     if (stopped_) throwEngineError(err::kTermInProgress);
     const auto found = records_.find(dbKey);
     if (found == records_.end()) return nullptr;
     if (!found->second.opening) return beginSession(found->second);
-    opened_.wait(lock);
+    opened_.wait(lock.native());
   }
 }
 
@@ -143,13 +140,13 @@ std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKe
   }
   std::size_t records = 0;
   {
-    std::unique_lock lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (auto session = sessionOnOpen(lock, dbKey)) return session;
     records = records_.size();
   }
   if ((settings_.maxActiveDBs * 2) / 3 <= records) closeDormantInstances();
 
-  std::unique_lock lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (auto session = sessionOnOpen(lock, dbKey)) return session;
 
   auto instance = createInstance(dbKey);
@@ -216,7 +213,7 @@ void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::S
   // file under a connection that is still closing.
   session.reset();
 
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   // After the stop, a store that closes late simply ends its session.
   if (stopped_) return;
   const auto found = records_.find(dbKey);
@@ -235,7 +232,7 @@ void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::S
 }
 
 bool DBInstances::closeIfDormant(const std::string& dbKey) noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end()) return true;
   if (found->second.sessions > 0 || found->second.maintenance) return false;
@@ -245,7 +242,7 @@ bool DBInstances::closeIfDormant(const std::string& dbKey) noexcept {
 }
 
 void DBInstances::closeDormantInstances() noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   for (auto it = records_.begin(); it != records_.end();) {
     if (it->second.sessions == 0 && !it->second.maintenance) {
       if (g_LogVerbose && it->second.instance) {
@@ -262,7 +259,7 @@ void DBInstances::closeDormantInstances() noexcept {
 
 void DBInstances::discardInstance(const std::string& dbKey, engine::Session& session) noexcept {
   session.detachAll();
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end() || found->second.instance != session.instance()) return;
   closeInstance(found->second);
@@ -270,7 +267,7 @@ void DBInstances::discardInstance(const std::string& dbKey, engine::Session& ses
 }
 
 std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& dbKey, bool set) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (stopped_) {
     if (set) throwEngineError(err::kTermInProgress);
     return nullptr;
@@ -284,7 +281,7 @@ std::shared_ptr<engine::Instance> DBInstances::acquireShared(const std::string& 
 }
 
 std::shared_ptr<engine::Instance> DBInstances::acquireExclusive(const std::string& dbKey, bool set) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (stopped_) {
     if (set) throwEngineError(err::kTermInProgress);
     return nullptr;
@@ -340,7 +337,7 @@ void DBInstances::stopEngine(bool log) noexcept {
 std::shared_ptr<std::shared_mutex> DBInstances::dataLock(const std::string& dbKey, std::string_view id) {
   std::shared_ptr<DataLocks> locks;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     auto& weak = dataLocks_[dbKey];
     locks = weak.lock();
     if (!locks) {
@@ -358,7 +355,7 @@ std::shared_ptr<std::shared_mutex> DBInstances::dataLock(const std::string& dbKe
 }
 
 std::optional<DBInstances::RecordView> DBInstances::record(const std::string& dbKey) const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   const auto found = records_.find(dbKey);
   if (found == records_.end()) return std::nullopt;
   RecordView view;
@@ -372,7 +369,7 @@ std::optional<DBInstances::RecordView> DBInstances::record(const std::string& db
 }
 
 std::size_t DBInstances::recordCount() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return records_.size();
 }
 

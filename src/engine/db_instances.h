@@ -30,7 +30,8 @@
 // and handed back through endSession.
 // Thread safety: one mutex, the pool mutex, guards every record; it is held
 // while instances are created, initialised and
-// terminated and while sessions begin and end. onNewInstance runs without
+// terminated and while sessions begin and end. No member may be called with
+// it held (they take it). onNewInstance runs without
 // it (attaching a database may replay a large write-ahead log): the record
 // is marked as opening meanwhile, and other callers for the same database
 // wait until it is open (or gone), while other databases are served.
@@ -43,7 +44,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <shared_mutex>
 #include <string_view>
@@ -53,6 +53,7 @@
 #include "engine/instance.h"
 #include "engine/session.h"
 #include "framework/env.h"
+#include "framework/thread_annotations.h"
 #include "settings/paths.h"
 
 class DBConfig;
@@ -102,8 +103,8 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   // The service's stop: every instance terminated, waiting holds
   // interrupted; later sessions and holds fail with kTermInProgress, and
   // sessions ended later are simply closed. Never throws.
-  void stop() noexcept;
-  bool stopped() const;
+  void stop() noexcept EXCLUDES(mutex_);
+  bool stopped() const EXCLUDES(mutex_);
 
   const PoolSettings& settings() const noexcept { return settings_; }
   const Paths& paths() const noexcept { return paths_; }
@@ -117,26 +118,27 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   // hold is set, kOutOfSessions / kTooManyInstances at the limits, and
   // whatever onNewInstance throws; then no session stays counted and an
   // instance made for the call is dropped.
-  std::unique_ptr<engine::Session> newSession(const std::string& dbKey, const OnNewInstance& onNewInstance);
+  std::unique_ptr<engine::Session> newSession(const std::string& dbKey, const OnNewInstance& onNewInstance)
+      EXCLUDES(mutex_);
 
   // Ends a session that newSession handed out. A session whose database or
   // instance the pool no longer knows is logged as released for an unknown
   // instance, and ended all the same; after stop() sessions simply end.
   // Never throws.
-  void endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept;
+  void endSession(const std::string& dbKey, std::unique_ptr<engine::Session> session) noexcept EXCLUDES(mutex_);
 
   // True when the database has no instance afterwards: it had none, or it
   // had one without sessions and holds, which is closed now.
-  bool closeIfDormant(const std::string& dbKey) noexcept;
+  bool closeIfDormant(const std::string& dbKey) noexcept EXCLUDES(mutex_);
 
   // For a database creation that failed inside onNewInstance: detaches and
   // closes the session's database, uncounts the session and terminates and
   // forgets the instance. The session object itself is destroyed by
   // newSession's caller path as the failure passes on.
-  void discardInstance(const std::string& dbKey, engine::Session& session) noexcept;
+  void discardInstance(const std::string& dbKey, engine::Session& session) noexcept EXCLUDES(mutex_);
 
-  std::optional<RecordView> record(const std::string& dbKey) const;
-  std::size_t recordCount() const;
+  std::optional<RecordView> record(const std::string& dbKey) const EXCLUDES(mutex_);
+  std::size_t recordCount() const EXCLUDES(mutex_);
   // Instances of this pool not yet terminated.
   std::uint64_t liveInstances() const noexcept { return slots_->live(); }
 
@@ -161,17 +163,19 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   };
 
   std::shared_ptr<engine::Instance> createInstance(const std::string& dbKey);
-  void closeInstance(InstanceRec& record) noexcept;
-  void closeDormantInstances() noexcept;
-  std::unique_ptr<engine::Session> beginSession(InstanceRec& record);
-  std::unique_ptr<engine::Session> sessionOnOpen(std::unique_lock<std::mutex>& lock, const std::string& dbKey);
+  // The record is one of records_.
+  void closeInstance(InstanceRec& record) noexcept REQUIRES(mutex_);
+  void closeDormantInstances() noexcept EXCLUDES(mutex_);
+  std::unique_ptr<engine::Session> beginSession(InstanceRec& record) REQUIRES(mutex_);
+  // lock holds mutex_; the wait for an opening lets go of it meanwhile.
+  std::unique_ptr<engine::Session> sessionOnOpen(sys::MutexLock& lock, const std::string& dbKey) REQUIRES(mutex_);
   // Both return null when the hold cannot be taken now (busy).
-  std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set);
-  std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set);
+  std::shared_ptr<engine::Instance> acquireShared(const std::string& dbKey, bool set) EXCLUDES(mutex_);
+  std::shared_ptr<engine::Instance> acquireExclusive(const std::string& dbKey, bool set) EXCLUDES(mutex_);
   // Sleeps one tick of a maintenance wait; false when the pool stopped
   // meanwhile, or stop (the operation's, when it has one) was requested.
-  bool waitTick(const std::stop_token& stop);
-  void stopEngine(bool log) noexcept;
+  bool waitTick(const std::stop_token& stop) EXCLUDES(mutex_);
+  void stopEngine(bool log) noexcept REQUIRES(mutex_);
 
   const PoolSettings settings_;
   const Paths paths_;
@@ -182,11 +186,11 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   struct DataLocks {
     std::shared_mutex stripes[kDataLockStripes];
   };
-  std::unordered_map<std::string, std::weak_ptr<DataLocks>> dataLocks_;  // guarded by mutex_
-  mutable std::mutex mutex_;                               // the pool mutex
-  std::unordered_map<std::string, InstanceRec> records_;  // guarded by mutex_
-  bool stopped_ = false;                                   // guarded by mutex_
-  std::condition_variable opened_;                         // with mutex_: an opening ended
+  mutable sys::Mutex mutex_;  // the pool mutex
+  std::unordered_map<std::string, std::weak_ptr<DataLocks>> dataLocks_ GUARDED_BY(mutex_);
+  std::unordered_map<std::string, InstanceRec> records_ GUARDED_BY(mutex_);
+  bool stopped_ GUARDED_BY(mutex_) = false;
+  std::condition_variable opened_;  // with mutex_: an opening ended
 };
 
 }  // namespace DB

@@ -38,12 +38,12 @@ Instance::Instance(Token, InstanceSettings settings) : id_(g_nextInstanceId++), 
 Instance::~Instance() { term(); }
 
 Instance::State Instance::state() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return state_;
 }
 
 void Instance::init(const std::source_location& where) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
   if (state_ == State::Initialised) return;
   try {
@@ -59,7 +59,7 @@ void Instance::init(const std::source_location& where) {
 }
 
 void Instance::term() noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (state_ == State::Terminated) return;
   state_ = State::Terminated;
   attached_.reset();
@@ -69,7 +69,7 @@ void Instance::term() noexcept {
 std::unique_ptr<Session> Instance::beginSession(const std::source_location& where) {
   auto self = shared_from_this();
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (state_ == State::Created) DB::throwEngineError(DB::err::kNotInitialized, where);
     if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
     if (sessions_ >= settings_.maxSessions) DB::throwEngineError(DB::err::kOutOfSessions, where);
@@ -84,22 +84,22 @@ std::unique_ptr<Session> Instance::beginSession(const std::source_location& wher
 }
 
 std::uint64_t Instance::openSessions() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return sessions_;
 }
 
 std::optional<std::filesystem::path> Instance::attachedDatabase() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return attached_;
 }
 
 void Instance::sessionEnded() noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (sessions_ > 0) --sessions_;
 }
 
 std::int32_t Instance::attach(const std::filesystem::path& file, const std::source_location& where) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (state_ == State::Created) DB::throwEngineError(DB::err::kNotInitialized, where);
   if (state_ == State::Terminated) DB::throwEngineError(DB::err::kTermInProgress, where);
   if (attached_) {
@@ -111,7 +111,7 @@ std::int32_t Instance::attach(const std::filesystem::path& file, const std::sour
 }
 
 void Instance::detach() noexcept {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   attached_.reset();
 }
 

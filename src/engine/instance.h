@@ -25,13 +25,13 @@
 #include <cstdint>
 #include <filesystem>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <source_location>
 #include <string>
 
 #include "engine/write_gate.h"
 #include "framework/env.h"
+#include "framework/thread_annotations.h"
 
 namespace engine {
 
@@ -86,44 +86,45 @@ class Instance : public std::enable_shared_from_this<Instance> {
   // Process-wide number, from 1, for the "I:" of log texts.
   std::uint64_t id() const noexcept { return id_; }
   const InstanceSettings& settings() const noexcept { return settings_; }
-  State state() const;
+  State state() const EXCLUDES(mutex_);
 
   // Creates the instance and log folders with missing parents (each new
   // level synced into its parent) and lets sessions begin. Throws kFileAccessDenied or kDiskIO when a folder cannot
   // be made (the instance stays uninitialised), kTermInProgress when the
   // instance was terminated. Initialising twice does nothing.
-  void init(const std::source_location& where = std::source_location::current());
+  void init(const std::source_location& where = std::source_location::current()) EXCLUDES(mutex_);
 
   // Ends the instance: no session begins any more, transactions of late
   // sessions fail with kTermInProgress, the attached database is forgotten
   // and the process-wide slot is freed. Idempotent; never throws.
-  void term() noexcept;
+  void term() noexcept EXCLUDES(mutex_);
 
   // A new session. Throws kNotInitialized on an uninitialised instance,
   // kTermInProgress on a terminated one, kOutOfSessions when maxSessions
   // sessions are open.
-  std::unique_ptr<Session> beginSession(const std::source_location& where = std::source_location::current());
+  std::unique_ptr<Session> beginSession(const std::source_location& where = std::source_location::current())
+      EXCLUDES(mutex_);
 
-  std::uint64_t openSessions() const;
+  std::uint64_t openSessions() const EXCLUDES(mutex_);
   // The attached database file, if any.
-  std::optional<std::filesystem::path> attachedDatabase() const;
+  std::optional<std::filesystem::path> attachedDatabase() const EXCLUDES(mutex_);
 
  private:
   friend class Session;
-  void sessionEnded() noexcept;
+  void sessionEnded() noexcept EXCLUDES(mutex_);
   // Records the file as attached: kWrnDatabaseAttached when it already was,
   // 0 when newly attached; throws kTooManyAttachedDatabases for a second
   // file, kNotInitialized / kTermInProgress in the wrong state.
-  std::int32_t attach(const std::filesystem::path& file, const std::source_location& where);
-  void detach() noexcept;
+  std::int32_t attach(const std::filesystem::path& file, const std::source_location& where) EXCLUDES(mutex_);
+  void detach() noexcept EXCLUDES(mutex_);
   WriteGate& writeGate() noexcept { return writeGate_; }
 
   const std::uint64_t id_;
   const InstanceSettings settings_;
-  mutable std::mutex mutex_;
-  State state_ = State::Created;                 // guarded by mutex_
-  std::uint64_t sessions_ = 0;                   // guarded by mutex_
-  std::optional<std::filesystem::path> attached_;  // guarded by mutex_
+  mutable sys::Mutex mutex_;
+  State state_ GUARDED_BY(mutex_) = State::Created;
+  std::uint64_t sessions_ GUARDED_BY(mutex_) = 0;
+  std::optional<std::filesystem::path> attached_ GUARDED_BY(mutex_);
   WriteGate writeGate_;
 };
 

@@ -12,32 +12,33 @@
 
 #include <chrono>
 #include <condition_variable>
-#include <mutex>
+
+#include "framework/thread_annotations.h"
 
 namespace engine {
 
 class WriteGate {
  public:
   // Waits at most `timeout` for the gate; true when it is now held.
-  bool enter(std::chrono::milliseconds timeout) {
-    std::unique_lock lock(mutex_);
-    if (!freed_.wait_for(lock, timeout, [this] { return !held_; })) return false;
+  bool enter(std::chrono::milliseconds timeout) EXCLUDES(mutex_) {
+    sys::MutexLock lock(mutex_);
+    if (!freed_.wait_for(lock.native(), timeout, [this]() REQUIRES(mutex_) { return !held_; })) return false;
     held_ = true;
     return true;
   }
 
-  void leave() noexcept {
+  void leave() noexcept EXCLUDES(mutex_) {
     {
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       held_ = false;
     }
     freed_.notify_one();
   }
 
  private:
-  std::mutex mutex_;
-  std::condition_variable freed_;
-  bool held_ = false;  // guarded by mutex_
+  sys::Mutex mutex_;
+  std::condition_variable freed_;  // with mutex_: the gate was left
+  bool held_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace engine

@@ -1,5 +1,6 @@
 #include "framework/io_pool.h"
 
+#include "framework/thread_annotations.h"
 #include "framework/unique_fd.h"
 
 #include <fcntl.h>
@@ -14,7 +15,6 @@
 #include <algorithm>
 #include <list>
 #include <map>
-#include <mutex>
 #include <system_error>
 #include <thread>
 #include <vector>
@@ -80,21 +80,21 @@ struct IoPool::State {
   // A thread was needed and none could be started; reported once.
   std::atomic<bool> starved{false};
 
-  std::mutex mutex;
-  std::condition_variable wake;                    // the watcher's
-  std::weak_ptr<boost::asio::io_context> io;       // guarded by mutex; the threads own it
-  std::map<std::thread::id, std::thread> threads;  // guarded by mutex
-  std::vector<std::thread> finished;               // guarded by mutex: retired spares to join
-  std::list<Slot> slots;                           // guarded by mutex: one per running thread
-  std::thread watcher;                             // guarded by mutex
-  std::condition_variable unpark;                  // parked spares wait here
-  std::size_t parked = 0;                          // guarded by mutex: spares parked, not woken
-  std::size_t wakeups = 0;                         // guarded by mutex: wake-ups not yet taken
-  bool stopping = false;                           // guarded by mutex
+  sys::Mutex mutex;
+  std::condition_variable wake;                                      // the watcher's
+  std::weak_ptr<boost::asio::io_context> io GUARDED_BY(mutex);       // the threads own it
+  std::map<std::thread::id, std::thread> threads GUARDED_BY(mutex);
+  std::vector<std::thread> finished GUARDED_BY(mutex);               // retired spares to join
+  std::list<Slot> slots GUARDED_BY(mutex);                           // one per running thread
+  std::thread watcher GUARDED_BY(mutex);
+  std::condition_variable unpark;                                    // parked spares wait here
+  std::size_t parked GUARDED_BY(mutex) = 0;                          // spares parked, not woken
+  std::size_t wakeups GUARDED_BY(mutex) = 0;                         // wake-ups not yet taken
+  bool stopping GUARDED_BY(mutex) = false;
 
-  // Threads that run the I/O context (not parked). Under mutex.
-  std::size_t active() const { return threads.size() - parked; }
-  void countActive() { total = active(); }
+  // Threads that run the I/O context (not parked).
+  std::size_t active() const REQUIRES(mutex) { return threads.size() - parked; }
+  void countActive() REQUIRES(mutex) { total = active(); }
 
   void tell(const std::string& text) const noexcept {
     if (!report) return;
@@ -126,26 +126,27 @@ constexpr unsigned kQuietPolls = 100;
 thread_local const void* tPoolOf = nullptr;
 thread_local Slot* tSlot = nullptr;
 
-// Registers the calling thread with the watcher for its life.
+// Registers the calling thread with the watcher for its life. (A template
+// only because the pool's state is a type private to IoPool.)
+template <class PoolState>
 class SlotGuard {
  public:
-  SlotGuard(std::mutex& mutex, std::list<Slot>& slots) : mutex_(mutex), slots_(slots) {
-    std::lock_guard lock(mutex_);
-    slots_.emplace_back();
-    it_ = std::prev(slots_.end());
+  explicit SlotGuard(PoolState& s) : s_(s) {
+    sys::MutexLock lock(s_.mutex);
+    s_.slots.emplace_back();
+    it_ = std::prev(s_.slots.end());
     tSlot = &*it_;
   }
   ~SlotGuard() {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(s_.mutex);
     tSlot = nullptr;
-    slots_.erase(it_);
+    s_.slots.erase(it_);
   }
   SlotGuard(const SlotGuard&) = delete;
   SlotGuard& operator=(const SlotGuard&) = delete;
 
  private:
-  std::mutex& mutex_;
-  std::list<Slot>& slots_;
+  PoolState& s_;
   std::list<Slot>::iterator it_;
 };
 
@@ -184,7 +185,7 @@ IoPool::IoPool(Options options, ErrorReport report) : state_(std::make_shared<St
 IoPool::~IoPool() { join(); }
 
 void IoPool::start(std::shared_ptr<boost::asio::io_context> io) {
-  std::lock_guard lock(state_->mutex);
+  sys::MutexLock lock(state_->mutex);
   state_->io = io;
   state_->watcher = std::thread([s = state_] { watcherMain(s); });
   for (unsigned i = 0; i < state_->options.base; ++i) {
@@ -198,7 +199,7 @@ void IoPool::start(std::shared_ptr<boost::asio::io_context> io) {
 }
 
 std::string IoPool::spawn(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
-                          bool spare) {
+                          bool spare) REQUIRES(s->mutex) {
   if (s->threads.size() >= s->options.maxThreads) {
     if (s->starved.exchange(true)) return {};
     return "All " + std::to_string(s->threads.size()) +
@@ -221,7 +222,7 @@ std::string IoPool::spawn(const std::shared_ptr<State>& s, const std::shared_ptr
 void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
                         bool spare) {
   tPoolOf = s.get();
-  const SlotGuard slot(s->mutex, s->slots);
+  const SlotGuard slot(*s);
   for (;;) {
     if (spare && s->parkSpares.load()) {
       // What the last handler deferred (a read's command, a command's
@@ -249,7 +250,7 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
     }
     // A spare that ran nothing for spareIdle ends, unless that would leave
     // no thread free for the connections.
-    std::lock_guard lock(s->mutex);
+    sys::MutexLock lock(s->mutex);
     if (s->stopping) return;  // join() owns the handles now
     if (!mayStepAside(*s)) continue;
     retire(*s);
@@ -268,7 +269,7 @@ void IoPool::threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<b
 // lowered total (and wakes the watcher) or busy read here includes it (and
 // the thread stays). Lowering total after reading busy would let both miss
 // each other and leave no thread to run the I/O context.
-bool IoPool::mayStepAside(State& s) {
+bool IoPool::mayStepAside(State& s) REQUIRES(s.mutex) {
   s.total = s.active() - 1;
   if (s.busy.load() >= s.total.load()) {
     s.countActive();
@@ -291,7 +292,7 @@ bool IoPool::drain(State& s, boost::asio::io_context& io) {
 }
 
 // Moves the calling thread's handle to the threads to join. Under mutex.
-void IoPool::retire(State& s) {
+void IoPool::retire(State& s) REQUIRES(s.mutex) {
   const auto it = s.threads.find(std::this_thread::get_id());
   if (it == s.threads.end()) return;
   s.finished.push_back(std::move(it->second));
@@ -305,14 +306,14 @@ void IoPool::retire(State& s) {
 // other thread is in a command: parking then would leave nobody to serve
 // the connections.
 IoPool::Park IoPool::park(const std::shared_ptr<State>& s) {
-  std::unique_lock lock(s->mutex);
+  sys::MutexLock lock(s->mutex);
   if (s->stopping) return Park::End;
   if (!s->parkSpares.load()) return Park::Resume;
   if (!mayStepAside(*s)) return Park::Stay;
   ++s->parked;
   s->countActive();
   const bool woken =
-      s->unpark.wait_for(lock, s->options.spareIdle, [&] { return s->stopping || s->wakeups > 0; });
+      s->unpark.wait_for(lock.native(), s->options.spareIdle, [&]() REQUIRES(s->mutex) { return s->stopping || s->wakeups > 0; });
   if (s->stopping) return Park::End;
   if (woken) {
     --s->wakeups;  // the watcher counted this thread active again
@@ -327,14 +328,14 @@ IoPool::Park IoPool::park(const std::shared_ptr<State>& s) {
 // blockedAfter and starts a spare when a thread is blocked in its command or
 // no command has ended meanwhile.
 void IoPool::watcherMain(const std::shared_ptr<State>& s) {
-  std::unique_lock lock(s->mutex);
+  sys::MutexLock lock(s->mutex);
   unsigned quiet = 0;
   for (;;) {
-    s->wake.wait(lock, [&] { return s->stopping || s->watching.load(); });
+    s->wake.wait(lock.native(), [&]() REQUIRES(s->mutex) { return s->stopping || s->watching.load(); });
     if (s->stopping) return;
     const bool allBusyBefore = s->busy.load() >= s->active();
     const std::uint64_t doneBefore = s->done.load();
-    s->wake.wait_for(lock, s->options.blockedAfter, [&] { return s->stopping; });
+    s->wake.wait_for(lock.native(), s->options.blockedAfter, [&]() REQUIRES(s->mutex) { return s->stopping; });
     if (s->stopping) return;
     const bool allBusy = s->busy.load() >= s->active();
     const std::size_t blocked = allBusy ? countBlocked(s->slots) : 0;
@@ -388,7 +389,7 @@ IoPool::Busy::Busy(IoPool& pool) : state_(pool.state_.get()) {
   if (tSlot) tSlot->since = nowNs();
   const std::size_t busy = s.busy.fetch_add(1) + 1;
   if (busy < s.total.load() || s.watching.load()) return;
-  std::lock_guard lock(s.mutex);
+  sys::MutexLock lock(s.mutex);
   if (!s.watching.load()) {
     s.watching = true;
     s.wake.notify_one();
@@ -408,7 +409,7 @@ void IoPool::join() {
   const bool own = runningInThisThread();
   std::vector<std::thread> all;
   {
-    std::lock_guard lock(state_->mutex);
+    sys::MutexLock lock(state_->mutex);
     state_->stopping = true;
     if (state_->watcher.joinable()) all.push_back(std::move(state_->watcher));
     for (auto& [id, t] : state_->threads) all.push_back(std::move(t));
@@ -431,12 +432,12 @@ void IoPool::join() {
 bool IoPool::runningInThisThread() const noexcept { return tPoolOf == state_.get(); }
 
 std::size_t IoPool::threadCount() const {
-  std::lock_guard lock(state_->mutex);
+  sys::MutexLock lock(state_->mutex);
   return state_->threads.size();
 }
 
 std::size_t IoPool::activeCount() const {
-  std::lock_guard lock(state_->mutex);
+  sys::MutexLock lock(state_->mutex);
   return state_->active();
 }
 

@@ -102,6 +102,8 @@ class IoPool {
   std::size_t busyCount() const;
 
  private:
+  // Those that need the state's mutex held say so (REQUIRES) where they are
+  // defined: the state's members are not known here.
   static void threadMain(const std::shared_ptr<State>& s, const std::shared_ptr<boost::asio::io_context>& io,
                          bool spare);
   static void watcherMain(const std::shared_ptr<State>& s);

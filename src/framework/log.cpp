@@ -8,9 +8,9 @@
 #include <filesystem>
 #include <map>
 #include <memory>
-#include <mutex>
 
 #include "framework/platform.h"
+#include "framework/thread_annotations.h"
 
 std::atomic<bool> g_LogVerbose{false};
 
@@ -18,13 +18,13 @@ namespace Log {
 namespace {
 
 struct State {
-  std::mutex mutex;
-  std::shared_ptr<spdlog::logger> logger;  // guarded by mutex
-  bool console = false;                    // guarded by mutex
-  bool reportedFailure = false;            // guarded by mutex
-  std::mutex observerMutex;
-  std::map<std::uint64_t, Observer> observers;  // guarded by observerMutex
-  std::uint64_t nextObserver = 1;               // guarded by observerMutex
+  sys::Mutex mutex;
+  std::shared_ptr<spdlog::logger> logger GUARDED_BY(mutex);
+  bool console GUARDED_BY(mutex) = false;
+  bool reportedFailure GUARDED_BY(mutex) = false;
+  sys::Mutex observerMutex;
+  std::map<std::uint64_t, Observer> observers GUARDED_BY(observerMutex);
+  std::uint64_t nextObserver GUARDED_BY(observerMutex) = 1;
 };
 
 State& state() {
@@ -52,8 +52,8 @@ spdlog::level::level_enum levelOf(LogPriority p) {
   return spdlog::level::info;
 }
 
-// Builds the logger for the current log folder. Called with the mutex held.
-std::shared_ptr<spdlog::logger> makeLogger(State& s) {
+// Builds the logger for the current log folder.
+std::shared_ptr<spdlog::logger> makeLogger(State& s) REQUIRES(s.mutex) {
   std::vector<spdlog::sink_ptr> sinks;
   try {
     const auto dir = Platform::inst().logDir();
@@ -80,7 +80,7 @@ std::shared_ptr<spdlog::logger> makeLogger(State& s) {
 
 std::shared_ptr<spdlog::logger> currentLogger() {
   State& s = state();
-  std::lock_guard lock(s.mutex);
+  sys::MutexLock lock(s.mutex);
   if (!s.logger) s.logger = makeLogger(s);
   return s.logger;
 }
@@ -96,7 +96,7 @@ Lock::~Lock() {
     auto logger = currentLogger();
     logger->log(levelOf(priority_), "[{}] {}", priorityName(priority_), text);
     State& s = state();
-    std::lock_guard lock(s.observerMutex);
+    sys::MutexLock lock(s.observerMutex);
     for (auto& [id, observer] : s.observers) observer(priority_, text);
   } catch (...) {
     // A log entry must never take its caller down.
@@ -105,7 +105,7 @@ Lock::~Lock() {
 
 void setConsole(bool on) {
   State& s = state();
-  std::lock_guard lock(s.mutex);
+  sys::MutexLock lock(s.mutex);
   s.console = on;
   s.logger.reset();
 }
@@ -114,7 +114,7 @@ void reopen() {
   State& s = state();
   std::shared_ptr<spdlog::logger> old;
   {
-    std::lock_guard lock(s.mutex);
+    sys::MutexLock lock(s.mutex);
     old.swap(s.logger);
   }
   if (old) old->flush();
@@ -124,7 +124,7 @@ void flush() {
   State& s = state();
   std::shared_ptr<spdlog::logger> logger;
   {
-    std::lock_guard lock(s.mutex);
+    sys::MutexLock lock(s.mutex);
     logger = s.logger;
   }
   if (logger) logger->flush();
@@ -132,7 +132,7 @@ void flush() {
 
 std::uint64_t addObserver(Observer observer) {
   State& s = state();
-  std::lock_guard lock(s.observerMutex);
+  sys::MutexLock lock(s.observerMutex);
   const std::uint64_t id = s.nextObserver++;
   s.observers.emplace(id, std::move(observer));
   return id;
@@ -140,7 +140,7 @@ std::uint64_t addObserver(Observer observer) {
 
 void removeObserver(std::uint64_t id) {
   State& s = state();
-  std::lock_guard lock(s.observerMutex);
+  sys::MutexLock lock(s.observerMutex);
   s.observers.erase(id);
 }
 

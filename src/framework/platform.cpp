@@ -32,24 +32,24 @@ Platform::Platform() {
 }
 
 std::filesystem::path Platform::logDir() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return logDir_;
 }
 
 void Platform::changeLogDir(const std::filesystem::path& dir) {
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     logDir_ = dir;
   }
   Log::reopen();
 }
 
 std::filesystem::path Platform::corvinaSystemConfigDir() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return configDir_;
 }
 
 void Platform::changeSystemConfigDir(const std::filesystem::path& dir) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   configDir_ = dir;
 }

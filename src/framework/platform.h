@@ -12,23 +12,24 @@
 // Thread safety: every member may be called from any thread.
 
 #include <filesystem>
-#include <mutex>
+
+#include "framework/thread_annotations.h"
 
 class Platform {
  public:
   static Platform& inst();
 
-  std::filesystem::path logDir() const;
+  std::filesystem::path logDir() const EXCLUDES(mutex_);
   // Later log entries go to the new folder (created on the first entry).
-  void changeLogDir(const std::filesystem::path& dir);
+  void changeLogDir(const std::filesystem::path& dir) EXCLUDES(mutex_);
 
-  std::filesystem::path corvinaSystemConfigDir() const;
-  void changeSystemConfigDir(const std::filesystem::path& dir);
+  std::filesystem::path corvinaSystemConfigDir() const EXCLUDES(mutex_);
+  void changeSystemConfigDir(const std::filesystem::path& dir) EXCLUDES(mutex_);
 
  private:
   Platform();
 
-  mutable std::mutex mutex_;
-  std::filesystem::path logDir_;     // guarded by mutex_
-  std::filesystem::path configDir_;  // guarded by mutex_
+  mutable sys::Mutex mutex_;
+  std::filesystem::path logDir_ GUARDED_BY(mutex_);
+  std::filesystem::path configDir_ GUARDED_BY(mutex_);
 };

@@ -1,12 +1,12 @@
 #include "framework/svc_stub.h"
 
 #include <boost/asio/executor_work_guard.hpp>
-#include <mutex>
 #include <optional>
 
 #include "framework/acceptor.h"
 #include "framework/connection.h"
 #include "framework/log.h"
+#include "framework/thread_annotations.h"
 #include "framework/transport_core.h"
 
 namespace Ipc {
@@ -55,8 +55,8 @@ class SvcStub::Impl {
     return true;
   }
 
-  void waitToFinish() {
-    std::lock_guard lock(waitMutex_);
+  void waitToFinish() EXCLUDES(waitMutex_) {
+    sys::MutexLock lock(waitMutex_);
     if (finished_) return;
     // Connections end within their close grace; an I/O thread of ours would
     // be waiting for itself, so it only stops what it can.
@@ -74,9 +74,9 @@ class SvcStub::Impl {
  private:
   std::shared_ptr<detail::ServerCore> core_;
   std::shared_ptr<detail::Acceptor> acceptor_;
-  std::optional<WorkGuard> work_;
-  std::mutex waitMutex_;
-  bool finished_ = false;  // guarded by waitMutex_
+  std::optional<WorkGuard> work_ GUARDED_BY(waitMutex_);
+  sys::Mutex waitMutex_;
+  bool finished_ GUARDED_BY(waitMutex_) = false;
 };
 
 SvcStub::SvcStub(std::uint16_t port, bool forceIp4, CmdFactory factory, IpcErrorHandler onError)

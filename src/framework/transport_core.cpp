@@ -36,7 +36,7 @@ void ServerCore::report(const std::shared_ptr<Socket>& socket, const std::string
 }
 
 bool ServerCore::add(const std::shared_ptr<Connection>& connection) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (stopping_) return false;
   connections_.emplace(connection.get(), connection);
   return true;
@@ -44,7 +44,7 @@ bool ServerCore::add(const std::shared_ptr<Connection>& connection) {
 
 void ServerCore::remove(const Connection* connection) {
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (connections_.erase(connection) == 0) return;
   }
   changed_.notify_all();
@@ -53,7 +53,7 @@ void ServerCore::remove(const Connection* connection) {
 std::vector<std::shared_ptr<Connection>> ServerCore::beginStop(bool* first) {
   std::vector<std::shared_ptr<Connection>> open;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     *first = !stopping_;
     if (stopping_) return open;
     stopping_ = true;
@@ -67,17 +67,17 @@ std::vector<std::shared_ptr<Connection>> ServerCore::beginStop(bool* first) {
 }
 
 bool ServerCore::stopping() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return stopping_;
 }
 
 void ServerCore::waitUntilEmpty() {
-  std::unique_lock lock(mutex_);
-  changed_.wait(lock, [this] { return stopping_ && connections_.empty(); });
+  sys::MutexLock lock(mutex_);
+  changed_.wait(lock.native(), [this]() REQUIRES(mutex_) { return stopping_ && connections_.empty(); });
 }
 
 std::size_t ServerCore::connectionCount() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return connections_.size();
 }
 

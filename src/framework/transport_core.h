@@ -12,13 +12,13 @@
 #include <condition_variable>
 #include <cstddef>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "framework/svc_stub.h"
 #include "framework/io_pool.h"
+#include "framework/thread_annotations.h"
 
 namespace Ipc::detail {
 
@@ -41,23 +41,23 @@ class ServerCore {
   void report(const std::shared_ptr<Socket>& socket, const std::string& text) const noexcept;
 
   // Adds an accepted connection; false once the server is stopping.
-  bool add(const std::shared_ptr<Connection>& connection);
+  bool add(const std::shared_ptr<Connection>& connection) EXCLUDES(mutex_);
   // Removes a connection whose socket has been closed.
-  void remove(const Connection* connection);
+  void remove(const Connection* connection) EXCLUDES(mutex_);
   // Marks the server as stopping and returns the open connections. Returns
   // nothing when it was stopping already (then *first is false).
-  std::vector<std::shared_ptr<Connection>> beginStop(bool* first);
-  bool stopping() const;
+  std::vector<std::shared_ptr<Connection>> beginStop(bool* first) EXCLUDES(mutex_);
+  bool stopping() const EXCLUDES(mutex_);
   // Blocks until the server is stopping and every connection is removed.
-  void waitUntilEmpty();
-  std::size_t connectionCount() const;
+  void waitUntilEmpty() EXCLUDES(mutex_);
+  std::size_t connectionCount() const EXCLUDES(mutex_);
 
  private:
   const IpcErrorHandler onError_;
-  mutable std::mutex mutex_;
-  std::condition_variable changed_;
-  std::unordered_map<const Connection*, std::weak_ptr<Connection>> connections_;  // guarded by mutex_
-  bool stopping_ = false;                                                         // guarded by mutex_
+  mutable sys::Mutex mutex_;
+  std::condition_variable changed_;  // with mutex_: a connection was removed, or the stop began
+  std::unordered_map<const Connection*, std::weak_ptr<Connection>> connections_ GUARDED_BY(mutex_);
+  bool stopping_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace Ipc::detail

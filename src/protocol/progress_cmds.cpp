@@ -17,7 +17,7 @@ std::pair<std::uint32_t, std::string> ProgressCmdsBase::readProgress(wire::Reade
 }
 
 void ProgressCmdsBase::sendProgress(std::uint32_t percent, const std::string& text) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (ended_ || !socket()) return;
   wire::OutFrame frame;
   wire::beginFrame(frame.head, tag(), wire::FrameKind::Progress);
@@ -34,7 +34,7 @@ void ProgressCmdsBase::sendMoreProgress(std::uint32_t percent, const std::string
 }
 
 void ProgressCmdsBase::sendNoMoreProgress() {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (ended_) return;
   ended_ = true;
   if (!socket()) return;

@@ -9,11 +9,11 @@
 // sent after it is dropped, so the end is always the stream's last frame.
 
 #include <cstdint>
-#include <mutex>
 #include <set>
 #include <string>
 #include <utility>
 
+#include "framework/thread_annotations.h"
 #include "protocol/db_cmd.h"
 
 namespace Ipc::DB {
@@ -25,11 +25,11 @@ class ProgressCmdsBase : public DbCmdBase {
   bool streamsProgress() const noexcept override { return true; }
 
   // The stream's first message: percent 0 and the text.
-  void firstProgressMsg(const std::string& text);
+  void firstProgressMsg(const std::string& text) EXCLUDES(mutex_);
   // One more message; percent runs from 0 to 100.
-  void sendMoreProgress(std::uint32_t percent, const std::string& text);
+  void sendMoreProgress(std::uint32_t percent, const std::string& text) EXCLUDES(mutex_);
   // Ends the stream and lets the connection read its next request.
-  void sendNoMoreProgress();
+  void sendNoMoreProgress() EXCLUDES(mutex_);
 
   // No Answer frame: the stream is the answer.
   void writeAnswer(wire::Writer&) const override {}
@@ -40,10 +40,10 @@ class ProgressCmdsBase : public DbCmdBase {
   static void writeProgress(wire::Writer& out, std::uint32_t percent, const std::string& text);
 
  private:
-  void sendProgress(std::uint32_t percent, const std::string& text);
+  void sendProgress(std::uint32_t percent, const std::string& text) EXCLUDES(mutex_);
 
-  std::mutex mutex_;  // orders the frames of concurrent callers
-  bool ended_ = false;  // guarded by mutex_
+  sys::Mutex mutex_;  // orders the frames of concurrent callers
+  bool ended_ GUARDED_BY(mutex_) = false;
 };
 
 // Backup (tag 16) and Restore (tag 17) share their request: the archive file

@@ -23,7 +23,7 @@ DBSvc::DBSvc() = default;
 
 DBSvc::~DBSvc() {
   debugLine("Svc object destroyed");
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   listener.reset();
 }
 
@@ -42,7 +42,7 @@ void DBSvc::runSvc() {
         Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       listener = created;
       // A stop that came while there was no server to tell.
       if (stopRequested_) server.signalStop();
@@ -52,7 +52,7 @@ void DBSvc::runSvc() {
     // clients are gone already) before the pool they use is stopped.
     created->stopMaintenance();
     {
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       listener.reset();
     }
     // The Listener and its server go with the last command that holds them.
@@ -73,7 +73,7 @@ void DBSvc::runSvc() {
 
 void DBSvc::stopSvc() {
   debugLine("Svc stopping...");
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   stopRequested_ = true;
   if (listener) Ipc::DB::serverOf(*listener).signalStop();
 }

@@ -14,10 +14,10 @@
 // main failed with unknown error") and rethrows.
 
 #include <memory>
-#include <mutex>
 #include <string>
 
 #include "framework/service_host.h"
+#include "framework/thread_annotations.h"
 
 namespace Ipc::DB {
 class Listener;
@@ -42,9 +42,9 @@ class DBSvc final : public Service::I {
   const std::string& svcDisplayName() const override;
 
  private:
-  std::mutex mutex_;
-  std::shared_ptr<Ipc::DB::Listener> listener;  // guarded by mutex_
-  bool stopRequested_ = false;                  // guarded by mutex_
+  sys::Mutex mutex_;
+  std::shared_ptr<Ipc::DB::Listener> listener GUARDED_BY(mutex_);
+  bool stopRequested_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace DBServer

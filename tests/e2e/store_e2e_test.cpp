@@ -102,8 +102,10 @@ TEST(StoreEndToEnd, DataFilesRoundTripAndNamesCannotReachOtherFiles) {
   EXPECT_TRUE(c->getData("doc-1", "page.tif").view() == content);
 
   const std::string config = testing_support::readFile(dbRoot(server) / "config.json");
-  for (const auto& [id, file] : std::vector<std::pair<std::string, std::string>>{
+  for (const auto& idAndFile : std::vector<std::pair<std::string, std::string>>{
            {"..", "config.json"}, {"doc-1", "../../../config.json"}, {"..\\..", "config.json"}}) {
+    const std::string& id = idAndFile.first;  // no structured binding: clang 14 cannot capture one
+    const std::string& file = idAndFile.second;
     auto attacker = clientOf(server, "docs");
     EXPECT_EQ(endedBy([&] { attacker->setData(id, file, bytes("overwritten")); }), kTerminating);
     attacker = clientOf(server, "docs");

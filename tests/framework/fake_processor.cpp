@@ -43,15 +43,15 @@ void FakeProcessor::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
       c.answer = c.text;
       break;
     case kBlock: {
-      std::unique_lock lock(mutex_);
-      changed_.wait(lock, [this] { return gateOpen_; });
+      sys::MutexLock lock(mutex_);
+      changed_.wait(lock.native(), [this]() REQUIRES(mutex_) { return gateOpen_; });
       c.answer = c.text;
       break;
     }
     case kProgress: {
       const auto socket = cmd->socket();
       socket->send(progressFrame(c.tag(), wire::FrameKind::Progress, 0, "start"));
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       threads_.emplace_back([cmd, socket] {
         for (std::uint32_t p = 25; p <= 75; p += 25) {
           socket->send(progressFrame(cmd->tag(), wire::FrameKind::Progress, p, "step " + std::to_string(p)));
@@ -80,7 +80,7 @@ void FakeProcessor::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
     case kSlot: {
       cmd->socket()->connInf() = std::make_unique<TrackedConnInf>(liveSlots);
       if (c.text == "keep") {
-        std::lock_guard lock(mutex_);
+        sys::MutexLock lock(mutex_);
         keptSocket = cmd->socket();
       }
       break;
@@ -95,25 +95,25 @@ void FakeProcessor::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
 void FakeProcessor::onDisconnect(const std::shared_ptr<Ipc::Socket>&) { ++disconnects; }
 
 void FakeProcessor::openGate() {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   gateOpen_ = true;
   changed_.notify_all();
 }
 
 bool FakeProcessor::waitStarted(const std::string& text, std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  return changed_.wait_for(lock, timeout, [&] {
+  sys::MutexLock lock(mutex_);
+  return changed_.wait_for(lock.native(), timeout, [&]() REQUIRES(mutex_) {
     return std::find(events_.begin(), events_.end(), "start:" + text) != events_.end();
   });
 }
 
 std::vector<std::string> FakeProcessor::events() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return events_;
 }
 
 void FakeProcessor::record(const std::string& event) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   events_.push_back(event);
   changed_.notify_all();
 }
@@ -121,7 +121,7 @@ void FakeProcessor::record(const std::string& event) {
 void FakeProcessor::joinThreads() {
   std::vector<std::thread> threads;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     threads.swap(threads_);
   }
   for (auto& t : threads) t.join();

@@ -6,12 +6,12 @@
 #include <chrono>
 #include <condition_variable>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "framework/svc_stub.h"
+#include "framework/thread_annotations.h"
 
 namespace transport_test {
 
@@ -92,13 +92,13 @@ class FakeProcessor final : public Ipc::CmdProcessorI {
   Ipc::CmdFactory factory();
 
  private:
-  void record(const std::string& event);
+  void record(const std::string& event) EXCLUDES(mutex_);
 
-  mutable std::mutex mutex_;
-  std::condition_variable changed_;
-  bool gateOpen_ = false;
-  std::vector<std::string> events_;
-  std::vector<std::thread> threads_;
+  mutable sys::Mutex mutex_;
+  std::condition_variable changed_;  // with mutex_: the gate opened, or an event came
+  bool gateOpen_ GUARDED_BY(mutex_) = false;
+  std::vector<std::string> events_ GUARDED_BY(mutex_);
+  std::vector<std::thread> threads_ GUARDED_BY(mutex_);
 };
 
 }  // namespace transport_test

@@ -2,12 +2,12 @@
 // A connection without a network for command and processor tests: keeps
 // every frame sent, the end of the connection and the commandDone calls.
 
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "framework/cmd.h"
 #include "framework/frame.h"
+#include "framework/thread_annotations.h"
 #include "framework/wire.h"
 
 namespace testing_support {
@@ -29,45 +29,45 @@ inline SentFrame splitFrame(const std::string& bytes) {
 class FakeSocket : public Ipc::Socket {
  public:
   void send(wire::OutFrame frame) override {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (closed_) return;
     frames_.push_back(splitFrame(frame.head + std::string(frame.tail.view())));
   }
   void close(const std::string& reason) override {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (closed_) return;
     closed_ = true;
     reason_ = reason;
   }
   void commandDone() override {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     ++done_;
   }
   std::string peer() const override { return "127.0.0.1:1"; }
   bool isOpen() const override {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     return !closed_;
   }
 
   std::vector<SentFrame> frames() const {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     return frames_;
   }
   std::string closeReason() const {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     return reason_;
   }
   int doneCalls() const {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     return done_;
   }
 
  private:
-  mutable std::mutex mutex_;
-  std::vector<SentFrame> frames_;
-  bool closed_ = false;
-  std::string reason_;
-  int done_ = 0;
+  mutable sys::Mutex mutex_;
+  std::vector<SentFrame> frames_ GUARDED_BY(mutex_);
+  bool closed_ GUARDED_BY(mutex_) = false;
+  std::string reason_ GUARDED_BY(mutex_);
+  int done_ GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace testing_support

@@ -50,7 +50,9 @@ TEST_F(DataFiles, NamesThatAreNotOnePathComponentAreRefusedBeforeAnyFileIsTouche
   DB::DBLocal db(pool(), "docs");
   for (const std::string& name : {std::string(""), std::string("."), std::string(".."), std::string("../../../secret"),
                                   std::string("a/b"), std::string("a\\b"), std::string("x\0y", 3)}) {
-    for (const auto& [id, file] : {std::pair{name, std::string("f")}, std::pair{std::string("id"), name}}) {
+    for (const auto& idAndFile : {std::pair{name, std::string("f")}, std::pair{std::string("id"), name}}) {
+      const std::string& id = idAndFile.first;  // no structured binding: clang 14 cannot capture one
+      const std::string& file = idAndFile.second;
       EXPECT_NE(messageOf([&] { save(db, id, file, "overwritten"); }).find("must be one path component"),
                 std::string::npos);
       EXPECT_THROW(db.loadDataBlob(id, file), DB::DBExc);

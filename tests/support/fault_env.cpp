@@ -71,50 +71,50 @@ FaultEnv::FaultEnv(Path scratch, sys::Env& base) : base_(base), scratch_(std::mo
 FaultEnv::~FaultEnv() = default;
 
 void FaultEnv::failNth(Op kind, std::uint64_t n, int error) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   nth_.push_back({kind, counts_[static_cast<int>(kind)] + n, error});
 }
 
 void FaultEnv::failOnPath(Op kind, std::string fragment, int error) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   onPath_.push_back({kind, std::move(fragment), error});
 }
 
 void FaultEnv::clearFailures() {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   nth_.clear();
   onPath_.clear();
 }
 
 std::uint64_t FaultEnv::count(Op kind) const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return counts_[static_cast<int>(kind)];
 }
 
 void FaultEnv::resetCounts() {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   std::fill(std::begin(counts_), std::end(counts_), 0);
   nth_.clear();
 }
 
 std::uint64_t FaultEnv::injected() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return injected_;
 }
 
 void FaultEnv::setCallHook(std::function<void(Op, const Path&)> hook) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   callHook_ = std::move(hook);
 }
 
 void FaultEnv::check(Op kind, const Path& path) {
   std::function<void(Op, const Path&)> hook;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     hook = callHook_;
   }
   if (hook) hook(kind, path);
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   const auto k = static_cast<int>(kind);
   const auto any = static_cast<int>(kAny);
   ++counts_[k];
@@ -133,12 +133,12 @@ void FaultEnv::check(Op kind, const Path& path) {
 }
 
 void FaultEnv::synced(const Path& file, std::uint64_t size) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   syncedSize_[normal(file)] = size;
 }
 
 void FaultEnv::pending(const Path& folder, Change change) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   changes_.emplace_back(normal(folder), std::move(change));
 }
 
@@ -149,7 +149,7 @@ std::unique_ptr<sys::File> FaultEnv::open(const Path& path, sys::OpenMode mode) 
   auto file = base_.open(path, mode);
   const bool writable = mode != sys::OpenMode::Read;
   if (writable) {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     syncedSize_.emplace(normal(path), creates ? 0 : file->size());
     if (mode == sys::OpenMode::CreateOrTruncate) syncedSize_[normal(path)] = 0;
   }
@@ -163,7 +163,7 @@ std::unique_ptr<sys::File> FaultEnv::createTemp(const Path& folder, std::string_
   auto file = base_.createTemp(folder, prefix, &name);
   if (made != nullptr) *made = name;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     syncedSize_[normal(name)] = 0;
   }
   pending(folder, {Change::Created, name, {}, std::nullopt});
@@ -175,7 +175,7 @@ void FaultEnv::syncFolder(const Path& folder) {
   base_.syncFolder(folder);
   std::vector<Path> kept;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     const Path f = normal(folder);
     const auto settled = std::remove_if(changes_.begin(), changes_.end(), [&](const auto& c) {
       if (c.first != f) return false;
@@ -193,7 +193,7 @@ void FaultEnv::rename(const Path& from, const Path& to) {
   if (base_.stat(to).type == sys::FileType::Regular) {
     std::uint64_t n = 0;
     {
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       n = ++keptFiles_;
     }
     replaced = scratch_ / ("replaced-" + std::to_string(n));
@@ -207,7 +207,7 @@ void FaultEnv::rename(const Path& from, const Path& to) {
     throw;
   }
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     const auto found = syncedSize_.find(normal(from));
     if (found != syncedSize_.end()) {
       syncedSize_[normal(to)] = found->second;
@@ -283,7 +283,7 @@ void FaultEnv::dropUnsynced() {
   std::vector<std::pair<Path, Change>> changes;
   std::map<Path, std::uint64_t> sizes;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     changes.swap(changes_);
     sizes.swap(syncedSize_);
   }
@@ -311,25 +311,25 @@ void FaultEnv::dropUnsynced() {
 }
 
 void FaultEnv::useManualClock(sys::WallClock::time_point start) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   clock_ = start;
 }
 
 void FaultEnv::advance(std::chrono::milliseconds d) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (clock_) *clock_ += d;
 }
 
 sys::WallClock::time_point FaultEnv::now() {
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (clock_) return *clock_;
   }
   return base_.now();
 }
 
 void FaultEnv::setSleepHook(std::function<void(std::chrono::milliseconds)> hook) {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   sleepHook_ = std::move(hook);
 }
 
@@ -337,7 +337,7 @@ bool FaultEnv::sleepFor(std::chrono::milliseconds d, std::stop_token stop) {
   std::function<void(std::chrono::milliseconds)> hook;
   bool manual = false;
   {
-    std::lock_guard lock(mutex_);
+    sys::MutexLock lock(mutex_);
     if (stop.stop_requested()) return false;
     hook = sleepHook_;
     if (clock_) {

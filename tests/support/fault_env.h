@@ -25,12 +25,12 @@
 #include <cstdint>
 #include <functional>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
 #include "framework/env.h"
+#include "framework/thread_annotations.h"
 
 namespace testing_support {
 
@@ -93,8 +93,8 @@ class FaultEnv final : public sys::Env {
   bool sleepFor(std::chrono::milliseconds d, std::stop_token stop = {}) override;
 
   // For the files it opened.
-  void check(Op kind, const sys::Path& path);
-  void synced(const sys::Path& file, std::uint64_t size);
+  void check(Op kind, const sys::Path& path) EXCLUDES(mutex_);
+  void synced(const sys::Path& file, std::uint64_t size) EXCLUDES(mutex_);
 
  private:
   struct Change {
@@ -103,31 +103,31 @@ class FaultEnv final : public sys::Env {
     sys::Path from;  // renamed from
     std::optional<sys::Path> replaced;  // a link to the file the rename replaced
   };
-  void pending(const sys::Path& folder, Change change);
+  void pending(const sys::Path& folder, Change change) EXCLUDES(mutex_);
 
   sys::Env& base_;
   const sys::Path scratch_;
-  mutable std::mutex mutex_;
-  std::uint64_t counts_[static_cast<int>(Op::kCount) + 1]{};  // guarded by mutex_
+  mutable sys::Mutex mutex_;
+  std::uint64_t counts_[static_cast<int>(Op::kCount) + 1] GUARDED_BY(mutex_){};
   struct Nth {
     Op kind;
     std::uint64_t at;  // in the kind's count
     int error;
   };
-  std::vector<Nth> nth_;  // guarded by mutex_
+  std::vector<Nth> nth_ GUARDED_BY(mutex_);
   struct OnPath {
     Op kind;
     std::string fragment;
     int error;
   };
-  std::vector<OnPath> onPath_;  // guarded by mutex_
-  std::uint64_t injected_ = 0;  // guarded by mutex_
-  std::vector<std::pair<sys::Path, Change>> changes_;  // guarded by mutex_: by folder, in order
-  std::map<sys::Path, std::uint64_t> syncedSize_;      // guarded by mutex_: files written through this env
-  std::uint64_t keptFiles_ = 0;                        // guarded by mutex_
-  std::optional<sys::WallClock::time_point> clock_;    // guarded by mutex_
-  std::function<void(std::chrono::milliseconds)> sleepHook_;  // guarded by mutex_
-  std::function<void(Op, const sys::Path&)> callHook_;        // guarded by mutex_
+  std::vector<OnPath> onPath_ GUARDED_BY(mutex_);
+  std::uint64_t injected_ GUARDED_BY(mutex_) = 0;
+  std::vector<std::pair<sys::Path, Change>> changes_ GUARDED_BY(mutex_);  // by folder, in order
+  std::map<sys::Path, std::uint64_t> syncedSize_ GUARDED_BY(mutex_);      // files written through this env
+  std::uint64_t keptFiles_ GUARDED_BY(mutex_) = 0;
+  std::optional<sys::WallClock::time_point> clock_ GUARDED_BY(mutex_);
+  std::function<void(std::chrono::milliseconds)> sleepHook_ GUARDED_BY(mutex_);
+  std::function<void(Op, const sys::Path&)> callHook_ GUARDED_BY(mutex_);
 };
 
 }  // namespace testing_support

@@ -3,11 +3,11 @@
 // server's log lines.
 
 #include <cstdint>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "framework/log.h"
+#include "framework/thread_annotations.h"
 
 namespace testing_support {
 
@@ -34,8 +34,8 @@ class LogCapture {
   void clear();
 
  private:
-  mutable std::mutex mutex_;
-  std::vector<Entry> entries_;
+  mutable sys::Mutex mutex_;
+  std::vector<Entry> entries_ GUARDED_BY(mutex_);
   std::uint64_t id_;
 };
 

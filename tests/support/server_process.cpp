@@ -123,9 +123,9 @@ ServerProcess::ServerProcess(std::filesystem::path binary, ServerOptions options
   start(binary, args, options.env);
   if (!options.waitUntilListening) return;
   static const std::regex listening("Listening on port ([0-9]+)");
-  std::unique_lock lock(mutex_);
+  sys::MutexLock lock(mutex_);
   std::smatch m;
-  const bool found = changed_.wait_for(lock, options.startTimeout, [&] {
+  const bool found = changed_.wait_for(lock.native(), options.startTimeout, [&]() REQUIRES(mutex_) {
     for (const auto& line : lines_) {
       if (std::regex_search(line, m, listening)) return true;
     }
@@ -176,22 +176,22 @@ void ServerProcess::readOutput(int fd) {
     pending.append(buf, static_cast<std::size_t>(n));
     std::size_t nl;
     while ((nl = pending.find('\n')) != std::string::npos) {
-      std::lock_guard lock(mutex_);
+      sys::MutexLock lock(mutex_);
       lines_.push_back(pending.substr(0, nl));
       pending.erase(0, nl + 1);
       changed_.notify_all();
     }
   }
   ::close(fd);
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   if (!pending.empty()) lines_.push_back(pending);
   outputEnded_ = true;
   changed_.notify_all();
 }
 
 bool ServerProcess::waitForLogLine(const std::string& fragment, std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  return changed_.wait_for(lock, timeout, [&] {
+  sys::MutexLock lock(mutex_);
+  return changed_.wait_for(lock.native(), timeout, [&]() REQUIRES(mutex_) {
     for (const auto& line : lines_) {
       if (line.find(fragment) != std::string::npos) return true;
     }
@@ -200,14 +200,14 @@ bool ServerProcess::waitForLogLine(const std::string& fragment, std::chrono::mil
 }
 
 std::size_t ServerProcess::countLogLines(const std::string& fragment) const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   std::size_t n = 0;
   for (const auto& line : lines_) n += line.find(fragment) != std::string::npos;
   return n;
 }
 
 std::vector<std::string> ServerProcess::lines() const {
-  std::lock_guard lock(mutex_);
+  sys::MutexLock lock(mutex_);
   return lines_;
 }
 
@@ -228,8 +228,8 @@ int ServerProcess::wait(std::chrono::milliseconds timeout) {
   status_ = status;
   // What the process wrote last may still be in the pipe: the lines are
   // complete once the reader has seen the end of its output.
-  std::unique_lock lock(mutex_);
-  changed_.wait_for(lock, std::chrono::seconds(10), [this] { return outputEnded_; });
+  sys::MutexLock lock(mutex_);
+  changed_.wait_for(lock.native(), std::chrono::seconds(10), [this]() REQUIRES(mutex_) { return outputEnded_; });
   return *status_;
 }
 

@@ -18,12 +18,12 @@
 #include <condition_variable>
 #include <cstdint>
 #include <filesystem>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "framework/thread_annotations.h"
 #include "support/temp_dir.h"
 
 namespace testing_support {
@@ -83,7 +83,7 @@ class ServerProcess {
   void start(const std::filesystem::path& binary, const std::vector<std::string>& args,
              const std::vector<std::string>& env);
   void readOutput(int fd);
-  void throwStartFailure(const std::string& why);
+  void throwStartFailure(const std::string& why) EXCLUDES(mutex_);
 
   TempDir dir_;
   std::filesystem::path home_;
@@ -93,10 +93,10 @@ class ServerProcess {
   std::optional<int> status_;
   std::thread reader_;
 
-  mutable std::mutex mutex_;
-  std::condition_variable changed_;
-  std::vector<std::string> lines_;  // guarded by mutex_
-  bool outputEnded_ = false;        // guarded by mutex_
+  mutable sys::Mutex mutex_;
+  std::condition_variable changed_;  // with mutex_: a line came, or the output ended
+  std::vector<std::string> lines_ GUARDED_BY(mutex_);
+  bool outputEnded_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace testing_support
