@@ -106,7 +106,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   template <typename F>
   void onStrand(F&& f, bool last = false);
 
-  // Strand only, from here on.
+  // Strand only, from here on. The reading side (connection_read.cpp) and
+  // the write queue (connection_write.cpp) have files of their own; the
+  // rest, with ending and stalls, is in connection.cpp.
   bool partialFrame() const noexcept { return inBody_ || stageEnd_ > stageBegin_; }
   bool mayTakeRequest() const noexcept {
     return !busy_ && !closing_ && !finished_ && outBytes_ <= kOutHighWater;
@@ -139,6 +141,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
 
   void armStallTimer();
   void onStallTimer(const boost::system::error_code& ec);
+
+  // A frame of the given kind whose payload is one string.
+  static wire::OutFrame textFrame(std::uint8_t tag, wire::FrameKind kind, const std::string& text);
 
   const std::shared_ptr<ServerCore> core_;
   StrandSocket socket_;

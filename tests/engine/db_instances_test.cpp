@@ -126,15 +126,20 @@ TEST_F(Pool, ASlowOpeningHoldsUpOnlyItsOwnDatabase) {
   close("slow", std::move(first));
   close("slow", std::move(next));
 
+  std::promise<void> opening;
   std::promise<void> failing;
   auto failed = std::async(std::launch::async, [&] {
     return pool()->newSession("broken", [&](engine::Session&) {
+      opening.set_value();
       failing.get_future().wait();
       throw DB::DBExc("cannot open");
     });
   });
-  while (!record("broken")) std::this_thread::yield();
+  // The failing opener must be the first: a waiter that came first would
+  // open the database itself, and the failing one would join it.
+  opening.get_future().wait();
   auto waiter = std::async(std::launch::async, [&] { return open("broken"); });
+  EXPECT_EQ(waiter.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
   failing.set_value();
   EXPECT_THROW(failed.get(), DB::DBExc);
   auto fresh = waiter.get();

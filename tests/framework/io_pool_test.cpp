@@ -221,6 +221,10 @@ TEST(IoPool, ACommandMayReleaseTheLastOwnerOfThePool) {
   auto rig = std::make_shared<Rig>(IoPool::Options{2, 4, 30s, 1000us});
   std::promise<void> released;
   Rig* raw = rig.get();
+  // The command may run, and release every other owner of the context,
+  // before post has returned from waking a thread for it: post must not
+  // wake it through a context that is gone.
+  const auto io = rig->io;
   raw->command([owner = std::move(rig), &released]() mutable {
     owner->work.reset();
     owner.reset();  // joins the other threads, detaches this one

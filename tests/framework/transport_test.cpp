@@ -27,6 +27,14 @@ namespace {
 using namespace std::chrono_literals;
 using wire::FrameKind;
 
+// Deadlines stretch under ThreadSanitizer, which runs the transport (and a
+// test's megabytes of frames) five to fifteen times slower.
+#if defined(__SANITIZE_THREAD__)
+constexpr int kSlow = 4;
+#else
+constexpr int kSlow = 1;
+#endif
+
 // The reports that the transport hands to its error handler.
 class Reports {
  public:
@@ -37,7 +45,7 @@ class Reports {
   }
   bool waitFor(const std::string& fragment) {
     std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, 10s, [&] {
+    return changed_.wait_for(lock, 10s * kSlow, [&] {
       return std::any_of(texts_.begin(), texts_.end(), [&](const auto& t) { return t.find(fragment) != t.npos; });
     });
   }
@@ -50,7 +58,7 @@ class Reports {
 
 template <typename Pred>
 bool eventually(Pred pred) {
-  const auto deadline = std::chrono::steady_clock::now() + 10s;
+  const auto deadline = std::chrono::steady_clock::now() + 10s * kSlow;
   while (!pred()) {
     if (std::chrono::steady_clock::now() > deadline) return false;
     std::this_thread::sleep_for(5ms);
@@ -65,7 +73,7 @@ class TransportTest : public ::testing::Test {
 
   void start(bool forceIp4 = false) {
     Ipc::SvcStub::Options o;
-    o.stallTimeout = 300ms;
+    o.stallTimeout = 300ms * kSlow;
     o.closeGrace = 300ms;
     o.ioThreads = 2;
     proc = std::make_shared<FakeProcessor>();

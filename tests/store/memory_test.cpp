@@ -56,6 +56,11 @@ constexpr std::int64_t kOverhead = 48 * kMiB;
 using LongValueMemory = store_testing::StoreTest;
 
 TEST_F(LongValueMemory, SavingAndLoading200MiBHoldsTheValueOnce) {
+#if defined(__SANITIZE_THREAD__)
+  // Its shadow memory, four times what the process touches, is part of the
+  // resident size measured here.
+  GTEST_SKIP() << "the resident size is not the store's under ThreadSanitizer";
+#endif
   auto db = open("big");
   std::int64_t saveCost = 0;
   {

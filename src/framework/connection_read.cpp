@@ -1,0 +1,232 @@
+// A connection's reading side: bytes off the socket into the stage or a
+// large frame's own buffer, frames cut from them, each decoded and run as a
+// command; and the end of the peer's stream.
+
+#include "framework/connection.h"
+
+#include <boost/asio/defer.hpp>
+#include <cstring>
+
+#include "framework/request_decoder.h"
+#include "framework/transport_core.h"
+#include "framework/wire.h"
+
+namespace Ipc::detail {
+namespace {
+
+namespace asio = boost::asio;
+using Clock = std::chrono::steady_clock;
+
+}  // namespace
+
+void Connection::startRead() {
+  if (reading_ || peerDone_ || !mayTakeRequest()) return;
+  reading_ = true;
+  readSince_ = Clock::now();
+  if (inBody_) {
+    if (bodyGot_ == body_->size()) {
+      // The frame's bytes go into a buffer that grows with what has arrived,
+      // so that a length field alone never reserves the announced size.
+      const std::uint64_t capacity = std::min<std::uint64_t>(bodyLen_, body_->size() * 2);
+      auto bigger = std::make_shared<MemBuffer>(capacity);
+      std::memcpy(bigger->data(), body_->data(), static_cast<std::size_t>(bodyGot_));
+      body_ = std::move(bigger);
+    }
+    readInto(body_, body_->data() + bodyGot_, static_cast<std::size_t>(body_->size() - bodyGot_));
+  } else {
+    if (stageBegin_ > 0) {
+      std::memmove(stage_.get(), stage_.get() + stageBegin_, stageEnd_ - stageBegin_);
+      stageEnd_ -= stageBegin_;
+      stageBegin_ = 0;
+    }
+    readInto(stage_, stage_.get() + stageEnd_, kStageSize - stageEnd_);
+  }
+  if (partialFrame()) armStallTimer();
+}
+
+void Connection::readInto(std::shared_ptr<const void> owner, unsigned char* data, std::size_t size) {
+  socket_.async_read_some(asio::buffer(data, size), [self = shared_from_this(), owner = std::move(owner)](
+                                                        const boost::system::error_code& ec, std::size_t n) {
+    // owner kept the bytes alive until here, whatever has become of the
+    // connection's own share meanwhile.
+    self->onRead(ec, n);
+  });
+}
+
+void Connection::onRead(const boost::system::error_code& ec, std::size_t n) {
+  reading_ = false;
+  if (finished_) return;
+  if (closing_) {
+    // Draining after a Bye: what the peer still sends is dropped.
+    if (ec) {
+      peerDone_ = true;
+      if (byeFlushed_) finish();
+      return;
+    }
+    startDrain();
+    return;
+  }
+  if (ec) {
+    peerDone_ = true;
+    if (ec == asio::error::eof) {
+      goOn();
+      return;
+    }
+    if (partialFrame()) {
+      core_->report(shared_from_this(), "Connection from " + peer_ + " broke in the middle of a frame (" +
+                                            ec.message() + ")");
+    }
+    finish();
+    return;
+  }
+  if (inBody_) {
+    bodyGot_ += n;
+  } else {
+    stageEnd_ += n;
+  }
+  goOn();
+}
+
+void Connection::parse() {
+  while (mayTakeRequest()) {
+    if (inBody_) {
+      if (bodyGot_ < bodyLen_) return;
+      inBody_ = false;
+      const std::uint32_t size = bodyLen_;
+      auto owner = SharedMemBuffer(std::move(*body_)).owner();
+      body_.reset();
+      handleFrame(std::move(owner), size);
+      continue;
+    }
+    const std::size_t avail = stageEnd_ - stageBegin_;
+    if (avail < wire::kLengthSize) return;
+    const std::uint32_t length = wire::frameLength(stage_.get() + stageBegin_);
+    if (!frameLengthValid(length)) {
+      fail("Malformed frame from " + peer_ + ": length " + std::to_string(length) + " is out of range (2 to " +
+               std::to_string(wire::kMaxBody) + "); connection ended",
+           "Malformed frame: length out of range");
+      return;
+    }
+    const std::size_t got = avail - wire::kLengthSize;
+    const unsigned char* start = stage_.get() + stageBegin_ + wire::kLengthSize;
+    if (got >= length) {
+      std::shared_ptr<unsigned char> owner(ExportedUCharAlloc::alloc(length), ExportedUCharAlloc());
+      std::memcpy(owner.get(), start, length);
+      stageBegin_ += wire::kLengthSize + length;
+      if (stageBegin_ == stageEnd_) stageBegin_ = stageEnd_ = 0;
+      handleFrame(std::move(owner), length);
+      continue;
+    }
+    if (wire::kLengthSize + length <= kStageSize) return;  // the rest fits in the stage
+    // A large frame: what has arrived moves into a buffer of its own, and the
+    // rest is read straight into it.
+    body_ = std::make_shared<MemBuffer>(std::min<std::uint64_t>(length, std::max<std::uint64_t>(kFirstBodyChunk, got)));
+    std::memcpy(body_->data(), start, got);
+    bodyLen_ = length;
+    bodyGot_ = got;
+    inBody_ = true;
+    stageBegin_ = stageEnd_ = 0;
+  }
+}
+
+void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size) {
+  using Outcome = DecodedRequest::Outcome;
+  DecodedRequest r = decodeRequest(body, size, core_->factory);
+  body.reset();
+  const std::string tag = std::to_string(r.tag);
+  switch (r.outcome) {
+    case Outcome::NotARequest:
+      fail("Malformed frame from " + peer_ + ": kind " + std::to_string(r.kind) +
+               " is not a request; connection ended",
+           "Malformed frame: not a request");
+      return;
+    case Outcome::FactoryFailed:
+      fail("Cannot create a command for tag " + tag + " from " + peer_ + ": " + r.problem + "; connection ended",
+           "Terminating client connection due to processing error");
+      return;
+    case Outcome::UnknownTag:
+      // The processor has said what it thinks of the tag; the client learns
+      // that nothing ran, and may go on.
+      enqueue(textFrame(r.tag, wire::FrameKind::Refused, "Unknown command tag " + tag));
+      return;
+    case Outcome::Malformed:
+      fail("Malformed request " + r.cmd->name() + " from " + peer_ + ": " + r.problem + "; connection ended",
+           "Malformed request " + r.cmd->name() + ": " + r.problem);
+      return;
+    case Outcome::Command:
+      break;
+  }
+
+  const std::shared_ptr<CmdI>& cmd = r.cmd;
+  cmd->attachSocket(shared_from_this());
+  const auto processor = cmd->processor();
+  if (!processor) {
+    // Keep-alive and the like: answered here, without a processor.
+    wire::OutFrame answer;
+    try {
+      answer = cmd->answerFrame();
+    } catch (const std::exception& e) {
+      fail("Cannot encode the answer of " + cmd->name() + " for " + peer_ + ": " + e.what() + "; connection ended",
+           "Terminating client connection due to processing error");
+      return;
+    }
+    enqueue(std::move(answer));
+    return;
+  }
+  runCommand(cmd, processor);
+}
+
+void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+  busy_ = true;
+  answered_ = false;
+  inFlight_ = cmd.get();
+  processor_ = processor;
+  // The command runs on this thread once the strand's handler has returned
+  // (a deferred task is not handed to another thread), but outside the
+  // strand: the connection's writes, timers and closing go on meanwhile.
+  asio::defer(core_->io.get_executor(),
+              [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
+}
+
+void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+  // Closed before it started (the server is stopping): nobody waits for it.
+  if (!open_.load()) return;
+  // Another thread takes over the other connections if this one blocks.
+  IoPool::Busy busy(core_->threads);
+  try {
+    processor->processCmd(cmd);
+  } catch (const std::exception& e) {
+    fail("Command " + cmd->name() + " from " + peer_ + " failed: " + e.what() + "; connection ended",
+         "Terminating client connection due to processing error");
+    return;
+  } catch (...) {
+    fail("Command " + cmd->name() + " from " + peer_ + " failed with an unknown exception; connection ended",
+         "Terminating client connection due to processing error");
+    return;
+  }
+  if (unanswered(cmd.get())) {
+    // A processor must answer or end the connection; waiting for it would
+    // leave the client hanging for ever.
+    fail("Command " + cmd->name() + " from " + peer_ + " ended without an answer; connection ended",
+         "Terminating client connection due to processing error");
+  }
+}
+
+// The peer has sent its end: once everything it asked for is answered and
+// sent, the connection ends without a Bye.
+void Connection::settleAfterEof() {
+  if (!peerDone_ || closing_ || finished_ || busy_ || writing_ || !out_.empty()) return;
+  if (partialFrame()) {
+    const std::uint64_t got = inBody_ ? bodyGot_ + wire::kLengthSize : stageEnd_ - stageBegin_;
+    const std::uint64_t want =
+        inBody_ ? std::uint64_t{bodyLen_} + wire::kLengthSize
+                : (stageEnd_ - stageBegin_ >= wire::kLengthSize
+                       ? std::uint64_t{wire::frameLength(stage_.get() + stageBegin_)} + wire::kLengthSize
+                       : wire::kLengthSize);
+    core_->report(shared_from_this(), "Connection from " + peer_ + " ended in the middle of a frame (" +
+                                          std::to_string(got) + " of " + std::to_string(want) + " bytes)");
+  }
+  finish();
+}
+
+}  // namespace Ipc::detail
