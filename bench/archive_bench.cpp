@@ -62,8 +62,8 @@ std::string quoted(const fs::path& p) { return "'" + p.string() + "'"; }
 
 void makeTree(const fs::path& root, std::uint64_t total, int files) {
   std::mt19937_64 gen(42);
-  static const char* const words[] = {"pack", "document", "record", "client", "the", "of", "upload", "scan",
-                                      "invoice", "2024", "page", "user", "lock", "status", "signed", "copy"};
+  static const char* const words[] = {"pack",    "document", "record", "client", "the",  "of",     "upload", "scan",
+                                      "invoice", "2024",     "page",   "user",   "lock", "status", "signed", "copy"};
   const std::uint64_t average = total / static_cast<std::uint64_t>(files);
   for (int i = 0; i < files; ++i) {
     // Sizes from a fifth to nine fifths of the average.
@@ -169,14 +169,21 @@ int main(int argc, char** argv) {
   fs::path dir = fs::temp_directory_path();
   for (int i = 1; i + 1 < argc; i += 2) {
     const std::string k = argv[i];
-    if (k == "--mib") mib = std::stoull(argv[i + 1]);
-    else if (k == "--files") files = std::stoi(argv[i + 1]);
-    else if (k == "--runs") runs = std::stoi(argv[i + 1]);
-    else if (k == "--threads") threads = static_cast<unsigned>(std::stoi(argv[i + 1]));
-    else if (k == "--dir") dir = argv[i + 1];
-    else if (k == "--worker-nice") workerNice = std::stoi(argv[i + 1]);
+    if (k == "--mib")
+      mib = std::stoull(argv[i + 1]);
+    else if (k == "--files")
+      files = std::stoi(argv[i + 1]);
+    else if (k == "--runs")
+      runs = std::stoi(argv[i + 1]);
+    else if (k == "--threads")
+      threads = static_cast<unsigned>(std::stoi(argv[i + 1]));
+    else if (k == "--dir")
+      dir = argv[i + 1];
+    else if (k == "--worker-nice")
+      workerNice = std::stoi(argv[i + 1]);
     else {
-      std::cerr << "usage: archive_bench [--mib S] [--files N] [--runs R] [--threads T] [--worker-nice N] [--dir PATH]\n";
+      std::cerr
+          << "usage: archive_bench [--mib S] [--files N] [--runs R] [--threads T] [--worker-nice N] [--dir PATH]\n";
       return 2;
     }
   }
@@ -196,7 +203,8 @@ int main(int argc, char** argv) {
       fs::remove(work / "z.zip");
       fs::remove(work / "t.tgz");
       run("sync");
-      const ChildResult w = runChild(self, "write " + quoted(src / "d") + " " + quoted(work / "a.cvbak") + " " + std::to_string(threads) + " " + std::to_string(workerNice));
+      const ChildResult w = runChild(self, "write " + quoted(src / "d") + " " + quoted(work / "a.cvbak") + " " +
+                                               std::to_string(threads) + " " + std::to_string(workerNice));
       ours.push_back(w.seconds);
       writeKiB = std::max(writeKiB, w.extraKiB);
       run("sync");
@@ -210,7 +218,8 @@ int main(int argc, char** argv) {
       fs::remove_all(work / "u1");
       fs::remove_all(work / "u2");
       run("sync");
-      const ChildResult u = runChild(self, "read " + quoted(work / "a.cvbak") + " " + quoted(work / "u1") + " " + std::to_string(threads));
+      const ChildResult u = runChild(
+          self, "read " + quoted(work / "a.cvbak") + " " + quoted(work / "u1") + " " + std::to_string(threads));
       unpack.push_back(u.seconds);
       readKiB = std::max(readKiB, u.extraKiB);
       run("sync");
@@ -226,10 +235,12 @@ int main(int argc, char** argv) {
     std::printf("write throughput vs zip -3: %.2fx   vs tar|pigz -3: %.2fx\n", mZip / mOurs, mPigz / mOurs);
     std::printf("compressed size: ours %.1f%%, zip -3 %.1f%%, pigz -3 %.1f%% of input; ours/zip = %.4f\n",
                 100.0 * static_cast<double>(oursSize) / input, 100.0 * static_cast<double>(zipSize) / input,
-                100.0 * static_cast<double>(pigzSize) / input, static_cast<double>(oursSize) / static_cast<double>(zipSize));
+                100.0 * static_cast<double>(pigzSize) / input,
+                static_cast<double>(oursSize) / static_cast<double>(zipSize));
     std::printf("unpack (synced): ours %.1f MB/s, unzip+sync %.1f MB/s; ratio %.2fx\n", mb / mUnpack, mb / mUnzip,
                 mUnzip / mUnpack);
-    std::printf("extra resident memory (peak): writer %.1f MiB, reader %.1f MiB\n", writeKiB / 1024.0, readKiB / 1024.0);
+    std::printf("extra resident memory (peak): writer %.1f MiB, reader %.1f MiB\n", writeKiB / 1024.0,
+                readKiB / 1024.0);
   } catch (const std::exception& e) {
     std::cerr << "archive_bench: " << e.what() << '\n';
     fs::remove_all(work);

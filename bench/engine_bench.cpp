@@ -46,7 +46,8 @@ namespace fs = std::filesystem;
 using Clock = std::chrono::steady_clock;
 
 constexpr int kKeys = 1000;
-constexpr const char* kSchema = "CREATE TABLE IF NOT EXISTS kv(k BLOB NOT NULL PRIMARY KEY, v INTEGER NOT NULL) STRICT, WITHOUT ROWID";
+constexpr const char* kSchema =
+    "CREATE TABLE IF NOT EXISTS kv(k BLOB NOT NULL PRIMARY KEY, v INTEGER NOT NULL) STRICT, WITHOUT ROWID";
 constexpr const char* kUpsert = "INSERT INTO kv(k, v) VALUES(?, ?) ON CONFLICT(k) DO UPDATE SET v = excluded.v";
 
 struct Options {
@@ -292,7 +293,9 @@ void longValue() {
   engine::readBlob(*session, "meta", "blob", *engine::findRowid(*session, "meta", "id", "big"), value);
   const double readSeconds = std::chrono::duration<double>(Clock::now() - start).count();
   const auto readPeak = peakResident();
-  const auto extra = [&](std::uint64_t peak) { return peak > base ? static_cast<double>(peak - base) / 1048576.0 : 0.0; };
+  const auto extra = [&](std::uint64_t peak) {
+    return peak > base ? static_cast<double>(peak - base) / 1048576.0 : 0.0;
+  };
   std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "write a 256 MiB value", writeSeconds, extra(writePeak));
   std::printf("%-40s %10.2f s, %6.1f MiB beyond the buffer\n", "read it back", readSeconds, extra(readPeak));
   g_pool->endSession("long", std::move(session));
@@ -394,8 +397,7 @@ int main(int argc, char** argv) try {
   const double layer = median(measures[2].results);
   std::printf("%-40s %11.1f%%\n", "layer overhead, from the medians", (direct - layer) / direct * 100.0);
   std::printf("%-40s %11.1f%%\n", "layer overhead, paired slices", pairedOverhead(o));
-  std::printf("%-40s %12.2f\n\n", "16 databases against 1 session",
-              median(measures[5].results) / layer);
+  std::printf("%-40s %12.2f\n\n", "16 databases against 1 session", median(measures[5].results) / layer);
 
   longValue();
   openManySessions(o);

@@ -318,6 +318,8 @@ int main(int argc, char** argv) {
     if (errors) std::printf(", %llu error(s), first: %s", static_cast<unsigned long long>(errors), firstError.c_str());
     std::printf("\n");
   }
-  if (errors) std::fprintf(stderr, "load_gen: %llu error(s), first: %s\n", static_cast<unsigned long long>(errors), firstError.c_str());
+  if (errors)
+    std::fprintf(stderr, "load_gen: %llu error(s), first: %s\n", static_cast<unsigned long long>(errors),
+                 firstError.c_str());
   return errors ? 1 : 0;
 }

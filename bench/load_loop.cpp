@@ -185,7 +185,8 @@ class Loop {
       }
       c.have = 0;
       const std::string problem =
-          c.s->check ? c.s->check(std::string_view(reinterpret_cast<const char*>(c.in.data()), len), c.current) : std::string();
+          c.s->check ? c.s->check(std::string_view(reinterpret_cast<const char*>(c.in.data()), len), c.current)
+                     : std::string();
       if (!problem.empty()) {
         if (c.s->errors++ == 0) c.s->firstError = problem;
       } else if (end <= deadline_) {

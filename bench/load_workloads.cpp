@@ -43,9 +43,14 @@ void fillListFolder(cvdb::Client& c, const Params& p) {
 
 std::vector<std::string> packFields(const std::string& key, int variant, const Params& p) {
   const Ipc::PackInfo r = packRecord(key, kPackFolder, variant, p);
-  return {"id", r.id(), "folder", r.folder(), "status", std::to_string(r.status()), "name", r.name, "owner", r.owner,
-          "created", std::to_string(r.created), "modified", std::to_string(r.modified), "docCount",
-          std::to_string(r.docCount)};
+  return {"id",       r.id(),
+          "folder",   r.folder(),
+          "status",   std::to_string(r.status()),
+          "name",     r.name,
+          "owner",    r.owner,
+          "created",  std::to_string(r.created),
+          "modified", std::to_string(r.modified),
+          "docCount", std::to_string(r.docCount)};
 }
 
 std::string hset(const std::string& hashKey, const std::vector<std::string>& fields) {
@@ -79,42 +84,87 @@ const std::vector<Workload>& workloads() {
   using Ipc::DB::SetCfgPart;
   using Ipc::DB::SetData;
   static const std::vector<Workload> table = {
-      {"ping", "keep-alive (answered by the transport)", false, 0, {}, {},
+      {"ping",
+       "keep-alive (answered by the transport)",
+       false,
+       0,
+       {},
+       {},
        [](const Params&, const std::string&) { return Cmds{std::make_shared<Ipc::PingPong>()}; }},
-      {"dbs", "list the databases", false, 0, {}, {},
+      {"dbs",
+       "list the databases",
+       false,
+       0,
+       {},
+       {},
        [](const Params&, const std::string&) { return Cmds{std::make_shared<Ipc::DB::DBNames>()}; }},
-      {"getcfg", "read a configuration part of --size bytes", true, 100, {},
+      {"getcfg",
+       "read a configuration part of --size bytes",
+       true,
+       100,
+       {},
        [](cvdb::Client& c, const Params& p, const std::string& key) { c.setCfg(key, cfgPart(p.size, 'x')); },
        [](const Params&, const std::string& key) { return Cmds{cmd<GetCfgPart>(key)}; }},
-      {"setcfg", "write a configuration part of --size bytes (durable)", true, 100, {}, {},
+      {"setcfg",
+       "write a configuration part of --size bytes (durable)",
+       true,
+       100,
+       {},
+       {},
        [](const Params& p, const std::string& key) {
          return Cmds{cmd<SetCfgPart>(key, cfgPart(p.size, 'x')), cmd<SetCfgPart>(key, cfgPart(p.size, 'y'))};
        }},
-      {"getdata", "read a data file of --size bytes", true, 4096, {},
+      {"getdata",
+       "read a data file of --size bytes",
+       true,
+       4096,
+       {},
        [](cvdb::Client& c, const Params& p, const std::string& key) { c.setData(key, "file", content(p.size, 'x')); },
        [](const Params&, const std::string& key) { return Cmds{cmd<GetData>(key, std::string("file"))}; }},
-      {"setdata", "write a data file of --size bytes (durable)", true, 4096, {}, {},
+      {"setdata",
+       "write a data file of --size bytes (durable)",
+       true,
+       4096,
+       {},
+       {},
        [](const Params& p, const std::string& key) {
          return Cmds{cmd<SetData>(key, std::string("file"), content(p.size, 'x')),
                      cmd<SetData>(key, std::string("file"), content(p.size, 'y'))};
        }},
-      {"savepack", "save a pack: a record of --record-size bytes and --size bytes of content (durable)", true, 10240,
-       {}, {},
+      {"savepack",
+       "save a pack: a record of --record-size bytes and --size bytes of content (durable)",
+       true,
+       10240,
+       {},
+       {},
        [](const Params& p, const std::string& key) {
          return Cmds{cmd<SavePack>(packRecord(key, kPackFolder, 0, p), content(p.size, 'x')),
                      cmd<SavePack>(packRecord(key, kPackFolder, 1, p), content(p.size, 'y'))};
        }},
-      {"getpack", "fetch a pack's record and content", true, 10240, {},
+      {"getpack",
+       "fetch a pack's record and content",
+       true,
+       10240,
+       {},
        [](cvdb::Client& c, const Params& p, const std::string& key) {
          c.savePack(packRecord(key, kPackFolder, 0, p), content(p.size, 'x'));
        },
        [](const Params&, const std::string& key) { return Cmds{cmd<GetPack>(Ipc::PackInfo(key))}; }},
-      {"getpackinfo", "read a pack's record", true, 10240, {},
+      {"getpackinfo",
+       "read a pack's record",
+       true,
+       10240,
+       {},
        [](cvdb::Client& c, const Params& p, const std::string& key) {
          c.savePack(packRecord(key, kPackFolder, 0, p), content(p.size, 'x'));
        },
        [](const Params&, const std::string& key) { return Cmds{cmd<GetPackInfo>(key)}; }},
-      {"getpackinfos", "list the records of a folder of --folder-packs packs", true, 0, fillListFolder, {},
+      {"getpackinfos",
+       "list the records of a folder of --folder-packs packs",
+       true,
+       0,
+       fillListFolder,
+       {},
        [](const Params&, const std::string&) { return Cmds{cmd<GetPackInfos>(std::string(kListFolder))}; }},
   };
   return table;
@@ -124,15 +174,25 @@ const std::vector<RedisWorkload>& redisWorkloads() {
   static const std::vector<RedisWorkload> table = {
       {"ping", "PING", 0, 1, {}, [](const Params&, const std::string&) { return std::vector{resp({"PING"})}; }},
       {"getcfg", "GET of a --size bytes value", 100, 1,
-       [](const Params& p, const std::string& key) { return std::vector{resp({"SET", key, value(p.size, 'x')})}; },
-       [](const Params&, const std::string& key) { return std::vector{resp({"GET", key})}; }},
-      {"setcfg", "SET of a --size bytes value", 100, 1, {},
+       [](const Params& p, const std::string& key) {
+         return std::vector{resp({"SET", key, value(p.size, 'x')})};
+       },
+       [](const Params&, const std::string& key) {
+         return std::vector{resp({"GET", key})};
+       }},
+      {"setcfg",
+       "SET of a --size bytes value",
+       100,
+       1,
+       {},
        [](const Params& p, const std::string& key) {
          return std::vector{resp({"SET", key, value(p.size, 'x')}), resp({"SET", key, value(p.size, 'y')})};
        }},
       {"getpackinfo", "HGETALL of a hash with a pack record's fields", 10240, 1,
        [](const Params& p, const std::string& key) { return std::vector{hset("pack:" + key, packFields(key, 0, p))}; },
-       [](const Params&, const std::string& key) { return std::vector{resp({"HGETALL", "pack:" + key})}; }},
+       [](const Params&, const std::string& key) {
+         return std::vector{resp({"HGETALL", "pack:" + key})};
+       }},
       {"getpack", "HGETALL of the record's hash and GET of --size bytes of content, sent together", 10240, 2,
        [](const Params& p, const std::string& key) {
          return std::vector{hset("pack:" + key, packFields(key, 0, p)),
@@ -141,7 +201,11 @@ const std::vector<RedisWorkload>& redisWorkloads() {
        [](const Params&, const std::string& key) {
          return std::vector{resp({"HGETALL", "pack:" + key}) + resp({"GET", "packdata:" + key})};
        }},
-      {"savepack", "MULTI, HSET of the record's fields, SET of --size bytes of content, EXEC", 10240, 4, {},
+      {"savepack",
+       "MULTI, HSET of the record's fields, SET of --size bytes of content, EXEC",
+       10240,
+       4,
+       {},
        [](const Params& p, const std::string& key) {
          std::vector<std::string> out;
          for (int v = 0; v < 2; ++v) {

@@ -24,9 +24,9 @@
 namespace loadgen {
 
 struct Params {
-  std::size_t size = 0;            // a value's, data file's or pack content's bytes
-  std::size_t recordSize = 1024;   // bytes of a pack record's stored text
-  std::size_t folderPacks = 10000; // packs in the folder that getpackinfos lists
+  std::size_t size = 0;             // a value's, data file's or pack content's bytes
+  std::size_t recordSize = 1024;    // bytes of a pack record's stored text
+  std::size_t folderPacks = 10000;  // packs in the folder that getpackinfos lists
 };
 
 // The folder that getpackinfos lists, and the folder of every other pack.

@@ -57,7 +57,8 @@ FrameSocket::Frame Client::next(std::uint8_t tag, std::chrono::milliseconds time
     close();
     throw ConnectionEnded(reason, true);
   }
-  if (f.tag != tag) protocolError("a frame of tag " + std::to_string(f.tag) + " in the answer to tag " + std::to_string(tag));
+  if (f.tag != tag)
+    protocolError("a frame of tag " + std::to_string(f.tag) + " in the answer to tag " + std::to_string(tag));
   if (f.kind == wire::FrameKind::Refused) {
     std::string text;
     try {

@@ -109,7 +109,8 @@ void FrameSocket::sendRaw(const void* data, std::size_t size, std::chrono::milli
       do {
         r = ::poll(&pfd, 1, pollTimeout(timeout));
       } while (r < 0 && errno == EINTR);
-      if (r == 0) throw ConnectionEnded("the server took no data for " + std::to_string(timeout.count()) + " ms", false);
+      if (r == 0)
+        throw ConnectionEnded("the server took no data for " + std::to_string(timeout.count()) + " ms", false);
       if (r < 0) throw ConnectionEnded(errnoText(errno), false);
     } else if (n < 0 && errno == EINTR) {
       continue;

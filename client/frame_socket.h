@@ -15,8 +15,8 @@
 #include <memory>
 #include <string>
 
-#include "framework/unique_fd.h"
 #include "framework/frame.h"
+#include "framework/unique_fd.h"
 #include "framework/wire.h"
 
 namespace cvdb {

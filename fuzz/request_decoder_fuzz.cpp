@@ -44,7 +44,7 @@ void check(std::uint8_t tag, const std::string& payload, bool request) {
   if (!first || !decode(*first, payload, request)) return;
   const std::string once = encode(*first, request);
   auto second = Ipc::DB::makeCommand(tag, nullptr);
-  if (!decode(*second, once, request)) __builtin_trap();  // we wrote what we cannot read
+  if (!decode(*second, once, request)) __builtin_trap();   // we wrote what we cannot read
   if (encode(*second, request) != once) __builtin_trap();  // a field changed on the way
 }
 

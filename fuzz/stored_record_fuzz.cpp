@@ -26,7 +26,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
 
   Ipc::PackInfoPartial fast;
-  if (Ipc::tryReadStoredPackInfo(text, Ipc::kUseLimitSeconds, kNow, fast) && (!janssonOk || !(fast == want))) std::abort();
+  if (Ipc::tryReadStoredPackInfo(text, Ipc::kUseLimitSeconds, kNow, fast) && (!janssonOk || !(fast == want)))
+    std::abort();
 
   try {
     const Ipc::PackInfoPartial got = Ipc::readStoredPackInfo(text, Ipc::kUseLimitSeconds, kNow);

@@ -24,10 +24,14 @@ std::string formatTime(std::int64_t t) {
 
 std::string stateName(Ipc::UseInfo::State s) {
   switch (s) {
-    case Ipc::UseInfo::OpenForEdit: return "OpenForEdit";
-    case Ipc::UseInfo::LockForUpload: return "LockForUpload";
-    case Ipc::UseInfo::CloseEdit: return "CloseEdit";
-    case Ipc::UseInfo::EndUpload: return "EndUpload";
+    case Ipc::UseInfo::OpenForEdit:
+      return "OpenForEdit";
+    case Ipc::UseInfo::LockForUpload:
+      return "LockForUpload";
+    case Ipc::UseInfo::CloseEdit:
+      return "CloseEdit";
+    case Ipc::UseInfo::EndUpload:
+      return "EndUpload";
   }
   return std::to_string(static_cast<std::int32_t>(s));
 }
@@ -81,8 +85,8 @@ void printPackTable(const Ipc::PackInfos& list) {
   const std::vector<std::string> head = {"ID", "FOLDER", "STATUS", "NAME", "OWNER", "DOCS", "MODIFIED", "USE"};
   std::vector<std::vector<std::string>> rows;
   for (const auto& p : list) {
-    rows.push_back({p.id(), orDash(p.folder()), orDash(p.status()), orDash(p.name), orDash(p.owner),
-                    orDash(p.docCount), formatTime(p.modified), usesSummary(p.uses)});
+    rows.push_back({p.id(), orDash(p.folder()), orDash(p.status()), orDash(p.name), orDash(p.owner), orDash(p.docCount),
+                    formatTime(p.modified), usesSummary(p.uses)});
   }
   std::vector<std::size_t> width(head.size());
   for (std::size_t c = 0; c < head.size(); ++c) {
@@ -139,9 +143,8 @@ ProgressFn progressPrinter(bool jsonLines) {
       std::fflush(stderr);
     };
   }
-  return [](std::uint32_t percent, const std::string& text) {
-    std::fprintf(stderr, "%3u%% %s\n", percent, text.c_str());
-  };
+  return
+      [](std::uint32_t percent, const std::string& text) { std::fprintf(stderr, "%3u%% %s\n", percent, text.c_str()); };
 }
 
 int runMaintenance(bool jsonLines, const std::function<void(const ProgressFn&)>& operation) {

@@ -1,8 +1,8 @@
 // The subcommands of cvdb, one per server command (and a few conveniences
 // on top of GetPack).
 
-#include <CLI/CLI.hpp>
 #include <jansson.h>
+#include <CLI/CLI.hpp>
 
 #include <chrono>
 #include <cstdio>
@@ -252,7 +252,8 @@ void addPackReads(CLI::App* pack, const Globals& g, Action& chosen, Args& a) {
               }};
   });
 
-  auto* get = pack->add_subcommand("get", "Fetch a pack's content, optionally opening, closing, locking or unlocking it");
+  auto* get =
+      pack->add_subcommand("get", "Fetch a pack's content, optionally opening, closing, locking or unlocking it");
   get->add_option("ID", a.id)->required();
   get->add_option("-o,--output", a.output, "Write the content here instead of standard output");
   auto* open = get->add_flag("--open-for-edit", a.openForEdit, "Register as an editor of the pack");
@@ -369,8 +370,8 @@ void addPackWrites(CLI::App* pack, const Globals& g, Action& chosen, Args& a) {
 
 void addMaintenance(CLI::App& app, const Globals& g, Action& chosen, Args& a) {
   for (const bool isBackup : {true, false}) {
-    auto* cmd = app.add_subcommand(isBackup ? "backup" : "restore",
-                                   isBackup ? "Back the database (or all databases) up" : "Restore from backup archives");
+    auto* cmd = app.add_subcommand(isBackup ? "backup" : "restore", isBackup ? "Back the database (or all databases) up"
+                                                                             : "Restore from backup archives");
     cmd->add_option("TARGET", a.target, "Archive file or folder on the server (default: its backup folder)");
     cmd->add_flag("--all", a.all, isBackup ? "Every database" : "Every archive of the folder");
     cmd->callback([&, isBackup] {

@@ -20,9 +20,9 @@ namespace cvdb::tool {
 
 // Exit statuses.
 inline constexpr int kOk = 0;
-inline constexpr int kFailed = 1;        // the server refused or failed the command, or ended the connection
-inline constexpr int kUsage = 2;         // bad command line or local input
-inline constexpr int kUnreachable = 3;   // no connection to the server
+inline constexpr int kFailed = 1;       // the server refused or failed the command, or ended the connection
+inline constexpr int kUsage = 2;        // bad command line or local input
+inline constexpr int kUnreachable = 3;  // no connection to the server
 
 // A failure of the tool's own (bad local input, unwritable file): exit
 // status kUsage with the message.

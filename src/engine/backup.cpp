@@ -50,10 +50,9 @@ class PartialCopy {
 ConnectionPtr openCopy(const fs::path& file, const std::source_location& where) {
   configureLibrary();
   sqlite3* raw = nullptr;
-  const int rc = sqlite3_open_v2(file.c_str(), &raw,
-                                 SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX |
-                                     SQLITE_OPEN_EXRESCODE,
-                                 nullptr);
+  const int rc = sqlite3_open_v2(
+      file.c_str(), &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
+      nullptr);
   ConnectionPtr db(raw);
   if (rc != SQLITE_OK) throwSqlite(db.get(), rc, where);
   execute(db.get(), "PRAGMA journal_mode=OFF; PRAGMA synchronous=OFF;", where);
@@ -65,9 +64,12 @@ ConnectionPtr openCopy(const fs::path& file, const std::source_location& where) 
 void backupInstance(Instance& instance, const fs::path& targetFolder, const StatusCallback& status, int pagesPerStep,
                     const std::source_location& where) {
   switch (instance.state()) {
-    case Instance::State::Initialised: break;
-    case Instance::State::Created: DB::throwEngineError(DB::err::kNotInitialized, where);
-    case Instance::State::Terminated: DB::throwEngineError(DB::err::kTermInProgress, where);
+    case Instance::State::Initialised:
+      break;
+    case Instance::State::Created:
+      DB::throwEngineError(DB::err::kNotInitialized, where);
+    case Instance::State::Terminated:
+      DB::throwEngineError(DB::err::kTermInProgress, where);
   }
   const auto source = instance.attachedDatabase();
   if (!source) DB::throwEngineError(DB::err::kDatabaseNotFound, where);

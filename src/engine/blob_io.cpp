@@ -37,8 +37,7 @@ BlobStream::BlobStream(Session& session, std::string_view table, std::string_vie
   checkIdentifiers(table, column, where);
   const std::string tableName(table);
   const std::string columnName(column);
-  const int rc = sqlite3_blob_open(db_, "main", tableName.c_str(), columnName.c_str(), rowid, writable ? 1 : 0,
-                                   &blob_);
+  const int rc = sqlite3_blob_open(db_, "main", tableName.c_str(), columnName.c_str(), rowid, writable ? 1 : 0, &blob_);
   if (rc != SQLITE_OK) {
     blob_ = nullptr;  // SQLite may leave a value behind on failure
     // A row that vanished is a record that is not found; the table and the

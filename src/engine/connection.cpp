@@ -87,8 +87,8 @@ ConnectionPtr openConnection(sys::Env& env, const std::filesystem::path& file, O
   if (mode == OpenMode::Existing) checkIdentity(db.get(), file, where);
   const auto journal = queryText(db.get(), "PRAGMA journal_mode=WAL", where);
   if (journal != "wal") {
-    Log::Lock(Log::Warning).logStreamLine() << "Engine: \"" << file.string()
-                                            << "\" refuses write-ahead logging (journal mode " << journal << ")";
+    Log::Lock(Log::Warning).logStreamLine()
+        << "Engine: \"" << file.string() << "\" refuses write-ahead logging (journal mode " << journal << ")";
     DB::throwEngineError(DB::err::kInvalidDatabase, where);
   }
   const std::string pragmas = "PRAGMA synchronous=FULL; PRAGMA cache_size=-" + std::to_string(kConnectionCacheKiB) +

@@ -42,13 +42,18 @@ void removeQuietly(sys::Env& env, const fs::path& file) noexcept {
 std::int32_t engineCodeOfErrno(int error) noexcept {
   switch (error) {
     case ENOSPC:
-    case EDQUOT: return DB::err::kDiskFull;
+    case EDQUOT:
+      return DB::err::kDiskFull;
     case EACCES:
     case EPERM:
-    case EROFS: return DB::err::kFileAccessDenied;
-    case ENOENT: return DB::err::kFileNotFound;
-    case ENOMEM: return DB::err::kOutOfMemory;
-    default: return DB::err::kDiskIO;
+    case EROFS:
+      return DB::err::kFileAccessDenied;
+    case ENOENT:
+      return DB::err::kFileNotFound;
+    case ENOMEM:
+      return DB::err::kOutOfMemory;
+    default:
+      return DB::err::kDiskIO;
   }
 }
 
@@ -56,15 +61,14 @@ void checkIdentity(sqlite3* db, const fs::path& file, const std::source_location
   const auto applicationId = queryInt(db, "PRAGMA application_id", where);
   const auto version = queryInt(db, "PRAGMA user_version", where);
   if (applicationId != kApplicationId || version < 1) {
-    Log::Lock(Log::Warning).logStreamLine() << "Engine: \"" << file.string()
-                                            << "\" is not a database of this server (application id "
-                                            << applicationId << ", version " << version << "); left untouched";
+    Log::Lock(Log::Warning).logStreamLine()
+        << "Engine: \"" << file.string() << "\" is not a database of this server (application id " << applicationId
+        << ", version " << version << "); left untouched";
     DB::throwEngineError(DB::err::kInvalidDatabase, where);
   }
   if (version > kFormatVersion) {
     Log::Lock(Log::Warning).logStreamLine() << "Engine: \"" << file.string() << "\" has format version " << version
-                                            << ", newer than this server's " << kFormatVersion
-                                            << "; left untouched";
+                                            << ", newer than this server's " << kFormatVersion << "; left untouched";
     DB::throwEngineError(DB::err::kInvalidDatabaseVersion, where);
   }
 }

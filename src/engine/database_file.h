@@ -19,8 +19,8 @@
 #include <cstdint>
 #include <filesystem>
 #include <optional>
-#include <system_error>
 #include <source_location>
+#include <system_error>
 
 #include "engine/db_exc.h"
 #include "framework/env.h"

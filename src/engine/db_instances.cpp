@@ -2,8 +2,8 @@
 
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
-#include "framework/open_files.h"
 #include "framework/log.h"
+#include "framework/open_files.h"
 #include "settings/config.h"
 
 namespace DB {
@@ -31,8 +31,8 @@ void logEngineStart(const PoolSettings& settings, const Paths& paths, const sys:
   if (files.after < needed) {
     Log::Lock(Log::Warning).logStreamLine()
         << "DBInstances: the open-file limit is " << files.after << " (hard limit " << files.hard << "), but "
-        << settings.maxActiveDBs << " databases with " << settings.maxClientsPerDB
-        << " clients each may need " << needed << " file descriptors";
+        << settings.maxActiveDBs << " databases with " << settings.maxClientsPerDB << " clients each may need "
+        << needed << " file descriptors";
   }
 }
 
@@ -88,8 +88,8 @@ std::shared_ptr<engine::Instance> DBInstances::createInstance(const std::string&
   settings.slots = slots_;
   auto instance = engine::Instance::create(std::move(settings));
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Instance I:" << instance->id() << " created for "
-                                          << paths_.databaseFolder(dbKey);
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DBInstances: Instance I:" << instance->id() << " created for " << paths_.databaseFolder(dbKey);
   }
   return instance;
 }
@@ -114,9 +114,9 @@ std::unique_ptr<engine::Session> DBInstances::beginSession(InstanceRec& record) 
   }
   ++record.sessions;
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: New session S:" << session->id() << " created for I:"
-                                          << record.instance->id() << ". " << record.sessions
-                                          << " instance session(s)";
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DBInstances: New session S:" << session->id() << " created for I:" << record.instance->id() << ". "
+        << record.sessions << " instance session(s)";
   }
   return session;
 }
@@ -133,8 +133,7 @@ std::unique_ptr<engine::Session> DBInstances::sessionOnOpen(sys::MutexLock& lock
   }
 }
 
-std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKey,
-                                                         const OnNewInstance& onNewInstance) {
+std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKey, const OnNewInstance& onNewInstance) {
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DBInstances: New database connection request for " << dbKey;
   }
@@ -218,16 +217,16 @@ void DBInstances::endSession(const std::string& dbKey, std::unique_ptr<engine::S
   if (stopped_) return;
   const auto found = records_.find(dbKey);
   if (found == records_.end() || found->second.instance != instance || found->second.sessions == 0) {
-    Log::Lock(Log::Error).logStreamLine() << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId
-                                          << " released for unknown instance!!!";
+    Log::Lock(Log::Error).logStreamLine()
+        << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId << " released for unknown instance!!!";
     return;
   }
   auto& record = found->second;
   --record.sessions;
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId
-                                          << " released for I:" << record.instance->id() << ". " << record.sessions
-                                          << " instance session(s) remaining";
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DBInstances: DB: " << dbKey << ", Session S:" << sessionId << " released for I:" << record.instance->id()
+        << ". " << record.sessions << " instance session(s) remaining";
   }
 }
 
@@ -246,8 +245,8 @@ void DBInstances::closeDormantInstances() noexcept {
   for (auto it = records_.begin(); it != records_.end();) {
     if (it->second.sessions == 0 && !it->second.maintenance) {
       if (g_LogVerbose && it->second.instance) {
-        Log::Lock(Log::Debug).logStreamLine() << "DBInstances: Closing dormant instance I:"
-                                              << it->second.instance->id();
+        Log::Lock(Log::Debug).logStreamLine()
+            << "DBInstances: Closing dormant instance I:" << it->second.instance->id();
       }
       closeInstance(it->second);
       it = records_.erase(it);

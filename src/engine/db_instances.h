@@ -38,16 +38,16 @@
 // onNewInstance must not call the pool, discardInstance excepted.
 // Failures: DB::DBExc (engine codes, or the texts documented per member).
 
-#include <condition_variable>
-#include <stop_token>
 #include <chrono>
+#include <condition_variable>
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
 #include <shared_mutex>
-#include <string_view>
+#include <stop_token>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 
 #include "engine/instance.h"
@@ -64,9 +64,9 @@ class InstanceForMaintenance;
 
 // The pool's limits and waits.
 struct PoolSettings {
-  std::uint64_t maxActiveDBs = 100;           // live instances; more fail with kTooManyInstances
-  std::uint64_t maxClientsPerDB = 100;        // sessions per instance; more fail with kOutOfSessions
-  std::int32_t maxWaitMaintenanceSecs = 10;   // ticks a maintenance hold waits
+  std::uint64_t maxActiveDBs = 100;          // live instances; more fail with kTooManyInstances
+  std::uint64_t maxClientsPerDB = 100;       // sessions per instance; more fail with kOutOfSessions
+  std::int32_t maxWaitMaintenanceSecs = 10;  // ticks a maintenance hold waits
   std::chrono::milliseconds maintenanceTick{1000};
   // How long a writer waits for a database's write lock.
   std::chrono::milliseconds busyTimeout{10000};

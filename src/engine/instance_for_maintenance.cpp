@@ -19,9 +19,10 @@ InstanceForMaintenance::InstanceForMaintenance(std::shared_ptr<DBInstances> pool
   for (std::int64_t n = 1; n <= maxWait; ++n) {
     if (!pool_->waitTick(stop)) throwEngineError(err::kTermInProgress);
     if (n < 10 || n % 5 == 0) {
-      const std::string text = std::string(exclusive_ ? "Waiting for all clients connected to the database to exit ("
-                                                      : "Waiting for another database maintenance operation to finish (") +
-                               std::to_string(n) + "/" + std::to_string(maxWait) + "seconds passed)";
+      const std::string text =
+          std::string(exclusive_ ? "Waiting for all clients connected to the database to exit ("
+                                 : "Waiting for another database maintenance operation to finish (") +
+          std::to_string(n) + "/" + std::to_string(maxWait) + "seconds passed)";
       if (progress != nullptr) progress->onProgress(0, text);
     }
     handle_ = acquire(true);
@@ -35,14 +36,13 @@ InstanceForMaintenance::~InstanceForMaintenance() {
   try {
     acquire(false);
   } catch (const std::exception& e) {
-    Log::Lock(Log::Error).logStreamLine() << "DBInstances: releasing the maintenance hold on " << dbKey_
-                                          << " failed: " << e.what();
+    Log::Lock(Log::Error).logStreamLine()
+        << "DBInstances: releasing the maintenance hold on " << dbKey_ << " failed: " << e.what();
   }
 }
 
 std::shared_ptr<engine::Instance> InstanceForMaintenance::acquire(bool set) {
   return exclusive_ ? pool_->acquireExclusive(dbKey_, set) : pool_->acquireShared(dbKey_, set);
 }
-
 
 }  // namespace DB

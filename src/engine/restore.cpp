@@ -100,8 +100,8 @@ class SetAside {
 };
 
 [[noreturn]] void refuse(const fs::path& backupFolder, const std::string& reason, const std::source_location& where) {
-  Log::Lock(Log::Warning).logStreamLine() << "Engine: restore from \"" << backupFolder.string()
-                                          << "\" refused: " << reason;
+  Log::Lock(Log::Warning).logStreamLine()
+      << "Engine: restore from \"" << backupFolder.string() << "\" refused: " << reason;
   DB::throwEngineError(DB::err::kBadBackupFormat, where);
 }
 
@@ -132,7 +132,8 @@ FileHeader checkHeader(sys::Env& env, const fs::path& backupFolder, const fs::pa
   const std::string name = "\"" + file.filename().string() + "\"";
   const auto header = readHeader(env, file);
   if (!header) refuse(backupFolder, name + " is not a database of this engine", where);
-  if (!isOurs(*header) || header->userVersion < 1) refuse(backupFolder, name + " is not a database of this server", where);
+  if (!isOurs(*header) || header->userVersion < 1)
+    refuse(backupFolder, name + " is not a database of this server", where);
   if (header->userVersion > kFormatVersion) {
     refuse(backupFolder,
            name + " has format version " + std::to_string(header->userVersion) + ", newer than this server's " +
@@ -196,8 +197,8 @@ void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& s
     sqlite3_finalize(raw);
     if (verdict != "ok") {
       refuse(backupFolder,
-             "the database fails the integrity check (" + (verdict.empty() ? std::string(sqlite3_errstr(rc)) : verdict) +
-                 ")",
+             "the database fails the integrity check (" +
+                 (verdict.empty() ? std::string(sqlite3_errstr(rc)) : verdict) + ")",
              where);
     }
   } catch (const DB::DBExc& e) {
@@ -206,7 +207,8 @@ void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& s
       case DB::err::kInvalidDatabaseVersion:
       case DB::err::kDatabaseCorrupted:
         refuse(backupFolder, "the database cannot be read (" + std::string(e.what()) + ")", where);
-      default: throw;
+      default:
+        throw;
     }
   }
   removeCompanions(env, staged, where);

@@ -16,8 +16,7 @@ std::atomic<std::uint64_t> g_nextSessionId{1};
 
 }  // namespace
 
-Session::Session(Token, std::shared_ptr<Instance> instance)
-    : id_(g_nextSessionId++), instance_(std::move(instance)) {}
+Session::Session(Token, std::shared_ptr<Instance> instance) : id_(g_nextSessionId++), instance_(std::move(instance)) {}
 
 Session::~Session() {
   if (writeLocked_) {
@@ -33,9 +32,12 @@ Session::~Session() {
 
 void Session::checkInstanceLive(const std::source_location& where) const {
   switch (instance_->state()) {
-    case Instance::State::Initialised: return;
-    case Instance::State::Created: DB::throwEngineError(DB::err::kNotInitialized, where);
-    case Instance::State::Terminated: DB::throwEngineError(DB::err::kTermInProgress, where);
+    case Instance::State::Initialised:
+      return;
+    case Instance::State::Created:
+      DB::throwEngineError(DB::err::kNotInitialized, where);
+    case Instance::State::Terminated:
+      DB::throwEngineError(DB::err::kTermInProgress, where);
   }
 }
 
@@ -111,8 +113,8 @@ Statement Session::prepare(std::string_view sql, const std::source_location& whe
   // its own, which the handle finalises; so does any text once the cache is
   // full, so that SQL built at run time cannot grow it without bound.
   const bool cache = found == statements_.end() && statements_.size() < kMaxCachedStatements;
-  const int rc = sqlite3_prepare_v3(db, sql.data(), static_cast<int>(sql.size()),
-                                    cache ? SQLITE_PREPARE_PERSISTENT : 0, &stmt, nullptr);
+  const int rc = sqlite3_prepare_v3(db, sql.data(), static_cast<int>(sql.size()), cache ? SQLITE_PREPARE_PERSISTENT : 0,
+                                    &stmt, nullptr);
   if (rc != SQLITE_OK) {
     sqlite3_finalize(stmt);
     throwSqlite(db, rc, where);

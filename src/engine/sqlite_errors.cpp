@@ -87,8 +87,8 @@ void throwSqlite(sqlite3* db, int rc, const std::source_location& where) {
   if (!expected || g_LogVerbose) {
     Log::Lock entry(expected ? Log::Debug : Log::Warning);
     entry.logStreamLine() << "Engine: SQLite result " << rc << " (" << sqlite3_errstr(rc) << ")"
-                          << (db != nullptr ? ": " : "") << (db != nullptr ? sqlite3_errmsg(db) : "")
-                          << " reported as " << code;
+                          << (db != nullptr ? ": " : "") << (db != nullptr ? sqlite3_errmsg(db) : "") << " reported as "
+                          << code;
   }
   throw DB::DBExc(code == err::kSuccess ? err::kInternalError : code, where);
 }

@@ -13,12 +13,19 @@ namespace {
 
 // Sorted, for the binary search.
 constexpr std::array<std::int32_t, 13> kRetryable = [] {
-  std::array<std::int32_t, 13> codes{
-      err::kWriteConflict,   err::kTransTooDeep,     err::kWriteConflictPrimaryIndex,
-      err::kRollbackRequired, err::kTableLocked,      err::kTableInUse,
-      err::kTooManyOpenTablesAndCleanupTimedOut,     err::kRecordNotFound,
-      err::kNoCurrentRecord, err::kRecordPrimaryChanged, err::kKeyDuplicate,
-      err::kAlreadyPrepared, err::kDataHasChanged};
+  std::array<std::int32_t, 13> codes{err::kWriteConflict,
+                                     err::kTransTooDeep,
+                                     err::kWriteConflictPrimaryIndex,
+                                     err::kRollbackRequired,
+                                     err::kTableLocked,
+                                     err::kTableInUse,
+                                     err::kTooManyOpenTablesAndCleanupTimedOut,
+                                     err::kRecordNotFound,
+                                     err::kNoCurrentRecord,
+                                     err::kRecordPrimaryChanged,
+                                     err::kKeyDuplicate,
+                                     err::kAlreadyPrepared,
+                                     err::kDataHasChanged};
   std::sort(codes.begin(), codes.end());
   return codes;
 }();
@@ -37,11 +44,11 @@ Transaction::~Transaction() {
   try {
     session_.rollback();
   } catch (const DBExc& e) {
-    Log::Lock(Log::Error).logStreamLine() << "Failed to rollback trasaction S:" << session_.id() << " error code "
-                                          << e.code();
+    Log::Lock(Log::Error).logStreamLine()
+        << "Failed to rollback trasaction S:" << session_.id() << " error code " << e.code();
   } catch (const std::exception& e) {
-    Log::Lock(Log::Error).logStreamLine() << "Failed to rollback trasaction S:" << session_.id() << " error code "
-                                          << e.what();
+    Log::Lock(Log::Error).logStreamLine()
+        << "Failed to rollback trasaction S:" << session_.id() << " error code " << e.what();
   }
 }
 
@@ -60,8 +67,10 @@ bool Transaction::isConflictCode(std::int32_t code) noexcept {
     case err::kWriteConflictPrimaryIndex:
     case err::kRollbackRequired:
     case err::kTableLocked:
-    case err::kTableInUse: return true;
-    default: return false;
+    case err::kTableInUse:
+      return true;
+    default:
+      return false;
   }
 }
 
@@ -112,8 +121,8 @@ void Transaction::countAttempt() {
     throw DBExc("Transaction made too many attmepts to gain access to a locked item");
   }
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "Transaction::retry" << " S:" << session_.id() << " " << attempts_
-                                          << " attempt(s) so far.";
+    Log::Lock(Log::Debug).logStreamLine() << "Transaction::retry"
+                                          << " S:" << session_.id() << " " << attempts_ << " attempt(s) so far.";
   }
 }
 

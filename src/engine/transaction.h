@@ -52,8 +52,7 @@ class Transaction {
   static constexpr RetryBegin kRetryBegin{};
 
   // Begins a write transaction; a failure is thrown, nothing is open then.
-  explicit Transaction(engine::Session& session,
-                       const std::source_location& where = std::source_location::current());
+  explicit Transaction(engine::Session& session, const std::source_location& where = std::source_location::current());
   // Begins a write transaction, retrying a conflict at the begin like a
   // failed attempt (used by runInTransaction).
   Transaction(engine::Session& session, RetryBegin);

@@ -4,9 +4,9 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <boost/asio/ip/v6_only.hpp>
 #include <boost/asio/post.hpp>
 #include <boost/asio/strand.hpp>
-#include <boost/asio/ip/v6_only.hpp>
 #include <stdexcept>
 
 #include "framework/log.h"

@@ -21,8 +21,8 @@
 #include <cstdint>
 #include <memory>
 
-#include "framework/unique_fd.h"
 #include "framework/connection.h"
+#include "framework/unique_fd.h"
 
 namespace Ipc::detail {
 

@@ -17,8 +17,7 @@ void ExportedUCharAlloc::operator()(unsigned char* p) const noexcept { std::free
 
 MemBuffer::MemBuffer(std::uint64_t size) : data_(ExportedUCharAlloc::alloc(size)), size_(size) {}
 
-MemBuffer::MemBuffer(unsigned char* data, std::uint64_t size) noexcept
-    : data_(data), size_(data ? size : 0) {}
+MemBuffer::MemBuffer(unsigned char* data, std::uint64_t size) noexcept : data_(data), size_(data ? size : 0) {}
 
 MemBuffer MemBuffer::copyOf(const void* data, std::uint64_t size) {
   MemBuffer b(size);

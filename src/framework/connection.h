@@ -110,9 +110,7 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   // the write queue (connection_write.cpp) have files of their own; the
   // rest, with ending and stalls, is in connection.cpp.
   bool partialFrame() const noexcept { return inBody_ || stageEnd_ > stageBegin_; }
-  bool mayTakeRequest() const noexcept {
-    return !busy_ && !closing_ && !finished_ && outBytes_ <= kOutHighWater;
-  }
+  bool mayTakeRequest() const noexcept { return !busy_ && !closing_ && !finished_ && outBytes_ <= kOutHighWater; }
   void endCommand();
   void goOn();
   void startRead();

@@ -73,8 +73,8 @@ void Connection::onRead(const boost::system::error_code& ec, std::size_t n) {
       return;
     }
     if (partialFrame()) {
-      core_->report(shared_from_this(), "Connection from " + peer_ + " broke in the middle of a frame (" +
-                                            ec.message() + ")");
+      core_->report(shared_from_this(),
+                    "Connection from " + peer_ + " broke in the middle of a frame (" + ec.message() + ")");
     }
     finish();
     return;
@@ -136,8 +136,7 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
   const std::string tag = std::to_string(r.tag);
   switch (r.outcome) {
     case Outcome::NotARequest:
-      fail("Malformed frame from " + peer_ + ": kind " + std::to_string(r.kind) +
-               " is not a request; connection ended",
+      fail("Malformed frame from " + peer_ + ": kind " + std::to_string(r.kind) + " is not a request; connection ended",
            "Malformed frame: not a request");
       return;
     case Outcome::FactoryFailed:
@@ -184,8 +183,7 @@ void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_
   // The command runs on this thread once the strand's handler has returned
   // (a deferred task is not handed to another thread), but outside the
   // strand: the connection's writes, timers and closing go on meanwhile.
-  asio::defer(core_->io.get_executor(),
-              [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
+  asio::defer(core_->io.get_executor(), [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
 }
 
 void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {

@@ -44,10 +44,9 @@ void Connection::startWrite() {
     if (ec == asio::error::would_block || ec == asio::error::try_again || (!ec && n == 0)) {
       writing_ = true;
       writeSince_ = Clock::now();
-      socket_.async_write_some(BufferSpan{gather_.data(), count},
-                               [self = shared_from_this()](const boost::system::error_code& e, std::size_t m) {
-                                 self->onWrite(e, m);
-                               });
+      socket_.async_write_some(
+          BufferSpan{gather_.data(), count},
+          [self = shared_from_this()](const boost::system::error_code& e, std::size_t m) { self->onWrite(e, m); });
       armStallTimer();
       return;
     }

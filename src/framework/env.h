@@ -84,9 +84,9 @@ struct DirEntry {
 };
 
 enum class OpenMode {
-  Read,            // an existing file, for reading
-  ReadWrite,       // an existing file, for reading and writing
-  CreateNew,       // a new file; fails with EEXIST when the name exists
+  Read,              // an existing file, for reading
+  ReadWrite,         // an existing file, for reading and writing
+  CreateNew,         // a new file; fails with EEXIST when the name exists
   CreateOrTruncate,  // a new or emptied file
 };
 

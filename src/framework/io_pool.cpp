@@ -8,11 +8,11 @@
 #include <sys/types.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
 #include <cstring>
-#include <algorithm>
 #include <list>
 #include <map>
 #include <system_error>
@@ -81,15 +81,15 @@ struct IoPool::State {
   std::atomic<bool> starved{false};
 
   sys::Mutex mutex;
-  std::condition_variable wake;                                      // the watcher's
-  std::weak_ptr<boost::asio::io_context> io GUARDED_BY(mutex);       // the threads own it
+  std::condition_variable wake;                                 // the watcher's
+  std::weak_ptr<boost::asio::io_context> io GUARDED_BY(mutex);  // the threads own it
   std::map<std::thread::id, std::thread> threads GUARDED_BY(mutex);
-  std::vector<std::thread> finished GUARDED_BY(mutex);               // retired spares to join
-  std::list<Slot> slots GUARDED_BY(mutex);                           // one per running thread
+  std::vector<std::thread> finished GUARDED_BY(mutex);  // retired spares to join
+  std::list<Slot> slots GUARDED_BY(mutex);              // one per running thread
   std::thread watcher GUARDED_BY(mutex);
-  std::condition_variable unpark;                                    // parked spares wait here
-  std::size_t parked GUARDED_BY(mutex) = 0;                          // spares parked, not woken
-  std::size_t wakeups GUARDED_BY(mutex) = 0;                         // wake-ups not yet taken
+  std::condition_variable unpark;             // parked spares wait here
+  std::size_t parked GUARDED_BY(mutex) = 0;   // spares parked, not woken
+  std::size_t wakeups GUARDED_BY(mutex) = 0;  // wake-ups not yet taken
   bool stopping GUARDED_BY(mutex) = false;
 
   // Threads that run the I/O context (not parked).
@@ -312,8 +312,8 @@ IoPool::Park IoPool::park(const std::shared_ptr<State>& s) {
   if (!mayStepAside(*s)) return Park::Stay;
   ++s->parked;
   s->countActive();
-  const bool woken =
-      s->unpark.wait_for(lock.native(), s->options.spareIdle, [&]() REQUIRES(s->mutex) { return s->stopping || s->wakeups > 0; });
+  const bool woken = s->unpark.wait_for(lock.native(), s->options.spareIdle,
+                                        [&]() REQUIRES(s->mutex) { return s->stopping || s->wakeups > 0; });
   if (s->stopping) return Park::End;
   if (woken) {
     --s->wakeups;  // the watcher counted this thread active again

@@ -71,14 +71,21 @@ Value::~Value() { json_decref(v_); }
 const char* Value::typeName() const noexcept {
   if (!v_) return "empty";
   switch (json_typeof(v_)) {
-    case JSON_OBJECT: return "object";
-    case JSON_ARRAY: return "array";
-    case JSON_STRING: return "string";
-    case JSON_INTEGER: return "integer";
-    case JSON_REAL: return "float";
+    case JSON_OBJECT:
+      return "object";
+    case JSON_ARRAY:
+      return "array";
+    case JSON_STRING:
+      return "string";
+    case JSON_INTEGER:
+      return "integer";
+    case JSON_REAL:
+      return "float";
     case JSON_TRUE:
-    case JSON_FALSE: return "boolean";
-    case JSON_NULL: return "null";
+    case JSON_FALSE:
+      return "boolean";
+    case JSON_NULL:
+      return "null";
   }
   return "unknown";
 }
@@ -128,9 +135,7 @@ Object::Object(const Value& v) : Value(v) { expect(isObject(), "object"); }
 
 std::size_t Object::size() const noexcept { return json_object_size(v_); }
 
-bool Object::has(std::string_view key) const {
-  return json_object_getn(v_, key.data(), key.size()) != nullptr;
-}
+bool Object::has(std::string_view key) const { return json_object_getn(v_, key.data(), key.size()) != nullptr; }
 
 Value Object::get(std::string_view key) const {
   json_t* m = json_object_getn(v_, key.data(), key.size());
@@ -144,9 +149,7 @@ void Object::set(std::string_view key, const Value& value) {
   }
 }
 
-bool Object::erase(std::string_view key) {
-  return json_object_deln(v_, key.data(), key.size()) == 0;
-}
+bool Object::erase(std::string_view key) { return json_object_deln(v_, key.data(), key.size()) == 0; }
 
 std::vector<std::string> Object::keys() const {
   std::vector<std::string> out;
@@ -168,21 +171,17 @@ Value parse(const char* data, std::size_t size, std::size_t flags) {
   json_error_t error;
   json_t* v = json_loadb(data, size, flags | JSON_ALLOW_NUL, &error);
   if (!v) {
-    throw Exc("JSON error: " + std::string(error.text) + " at line " + std::to_string(error.line) +
-              ", column " + std::to_string(error.column));
+    throw Exc("JSON error: " + std::string(error.text) + " at line " + std::to_string(error.line) + ", column " +
+              std::to_string(error.column));
   }
   return Value::steal(v);
 }
 
 }  // namespace
 
-Object strToObject(const char* data, std::size_t size) {
-  return Object(parse(data, size, 0));
-}
+Object strToObject(const char* data, std::size_t size) { return Object(parse(data, size, 0)); }
 
-Value strToValue(std::string_view text) {
-  return parse(text.data(), text.size(), JSON_DECODE_ANY);
-}
+Value strToValue(std::string_view text) { return parse(text.data(), text.size(), JSON_DECODE_ANY); }
 
 std::ostream& operator<<(std::ostream& out, const Value& v) { return out << v.dump(); }
 

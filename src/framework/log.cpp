@@ -34,20 +34,28 @@ State& state() {
 
 const char* priorityName(LogPriority p) {
   switch (p) {
-    case Error: return "error";
-    case Warning: return "warning";
-    case Notice: return "notice";
-    case Debug: return "debug";
+    case Error:
+      return "error";
+    case Warning:
+      return "warning";
+    case Notice:
+      return "notice";
+    case Debug:
+      return "debug";
   }
   return "other";
 }
 
 spdlog::level::level_enum levelOf(LogPriority p) {
   switch (p) {
-    case Error: return spdlog::level::err;
-    case Warning: return spdlog::level::warn;
-    case Notice: return spdlog::level::info;
-    case Debug: return spdlog::level::debug;
+    case Error:
+      return spdlog::level::err;
+    case Warning:
+      return spdlog::level::warn;
+    case Notice:
+      return spdlog::level::info;
+    case Debug:
+      return spdlog::level::debug;
   }
   return spdlog::level::info;
 }
@@ -58,8 +66,8 @@ std::shared_ptr<spdlog::logger> makeLogger(State& s) REQUIRES(s.mutex) {
   try {
     const auto dir = Platform::inst().logDir();
     std::filesystem::create_directories(dir);
-    sinks.push_back(std::make_shared<spdlog::sinks::rotating_file_sink_mt>(
-        (dir / kLogFileName).string(), kRecycleLogFileSize, kKeptLogFiles));
+    sinks.push_back(std::make_shared<spdlog::sinks::rotating_file_sink_mt>((dir / kLogFileName).string(),
+                                                                           kRecycleLogFileSize, kKeptLogFiles));
   } catch (const std::exception& e) {
     if (!s.reportedFailure) {
       s.reportedFailure = true;

@@ -36,11 +36,16 @@ FileType typeOf(mode_t mode) {
 
 FileType typeOf(std::filesystem::file_type type) {
   switch (type) {
-    case std::filesystem::file_type::regular: return FileType::Regular;
-    case std::filesystem::file_type::directory: return FileType::Folder;
-    case std::filesystem::file_type::symlink: return FileType::Link;
-    case std::filesystem::file_type::not_found: return FileType::Missing;
-    default: return FileType::Other;
+    case std::filesystem::file_type::regular:
+      return FileType::Regular;
+    case std::filesystem::file_type::directory:
+      return FileType::Folder;
+    case std::filesystem::file_type::symlink:
+      return FileType::Link;
+    case std::filesystem::file_type::not_found:
+      return FileType::Missing;
+    default:
+      return FileType::Other;
   }
 }
 
@@ -106,10 +111,18 @@ class PosixEnv final : public Env {
   std::unique_ptr<File> open(const Path& path, OpenMode mode) override {
     int flags = O_CLOEXEC;
     switch (mode) {
-      case OpenMode::Read: flags |= O_RDONLY; break;
-      case OpenMode::ReadWrite: flags |= O_RDWR; break;
-      case OpenMode::CreateNew: flags |= O_RDWR | O_CREAT | O_EXCL; break;
-      case OpenMode::CreateOrTruncate: flags |= O_RDWR | O_CREAT | O_TRUNC; break;
+      case OpenMode::Read:
+        flags |= O_RDONLY;
+        break;
+      case OpenMode::ReadWrite:
+        flags |= O_RDWR;
+        break;
+      case OpenMode::CreateNew:
+        flags |= O_RDWR | O_CREAT | O_EXCL;
+        break;
+      case OpenMode::CreateOrTruncate:
+        flags |= O_RDWR | O_CREAT | O_TRUNC;
+        break;
     }
     UniqueFd fd(::open(path.c_str(), flags, 0644));
     if (!fd.valid()) fail(errno, "open", path);

@@ -37,7 +37,6 @@ struct DecodedRequest {
 // body holds size bytes: tag, kind, payload. The payload reader shares
 // body, so byte strings reach the command without a copy. A payload must be
 // consumed exactly.
-DecodedRequest decodeRequest(const std::shared_ptr<unsigned char>& body, std::uint32_t size,
-                             const CmdFactory& factory);
+DecodedRequest decodeRequest(const std::shared_ptr<unsigned char>& body, std::uint32_t size, const CmdFactory& factory);
 
 }  // namespace Ipc

@@ -51,9 +51,12 @@ void raiseFileLimit() {
 
 const char* signalName(int sig) {
   switch (sig) {
-    case SIGTERM: return "SIGTERM";
-    case SIGINT: return "SIGINT";
-    default: return "a signal";
+    case SIGTERM:
+      return "SIGTERM";
+    case SIGINT:
+      return "SIGINT";
+    default:
+      return "a signal";
   }
 }
 

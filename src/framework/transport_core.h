@@ -16,8 +16,8 @@
 #include <unordered_map>
 #include <vector>
 
-#include "framework/svc_stub.h"
 #include "framework/io_pool.h"
+#include "framework/svc_stub.h"
 #include "framework/thread_annotations.h"
 
 namespace Ipc::detail {

@@ -64,8 +64,7 @@ class Writer {
 
 class Reader {
  public:
-  Reader(const void* data, std::size_t size)
-      : p_(static_cast<const unsigned char*>(data)), left_(size) {}
+  Reader(const void* data, std::size_t size) : p_(static_cast<const unsigned char*>(data)), left_(size) {}
   // A reader over bytes that owner keeps alive: sharedBytes() then shares
   // them instead of copying.
   Reader(std::shared_ptr<unsigned char> owner, std::size_t size)

@@ -8,10 +8,10 @@
 #include <system_error>
 #include <vector>
 
-#include "ipc/listener.h"
 #include "engine/db_instances.h"
-#include "store/catalog.h"
+#include "ipc/listener.h"
 #include "settings/names.h"
+#include "store/catalog.h"
 #include "store/db_local.h"
 
 namespace Ipc::DB {
@@ -44,14 +44,17 @@ void Listener::process(Connect& cmd) {
   }
   ::DB::DBLocal& db = static_cast<ConnDB&>(*slot).db;
   switch (cmd.openMode()) {
-    case 0: db.exists(false); break;
+    case 0:
+      db.exists(false);
+      break;
     case 1:
       if (!db.exists(true)) {
         cmd.setResp("Database " + dbName + " does not exist");
         return;
       }
       break;
-    default: break;  // bound without opening
+    default:
+      break;  // bound without opening
   }
   cmd.setResp();
 }

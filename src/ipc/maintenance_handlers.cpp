@@ -96,9 +96,10 @@ void Listener::process(Restore& cmd) {
 }
 
 void Listener::process(Cleanup& cmd) {
-  runAsync(cmd, "Starting Database Cleanup...",
-           [usedIds = cmd.usedIds()](::DB::DBLocal& db, std::unique_ptr<::DB::DBProgressCallback> callback,
-                                     std::stop_token stop) { db.cleanUp(usedIds, std::move(callback), std::move(stop)); });
+  runAsync(
+      cmd, "Starting Database Cleanup...",
+      [usedIds = cmd.usedIds()](::DB::DBLocal& db, std::unique_ptr<::DB::DBProgressCallback> callback,
+                                std::stop_token stop) { db.cleanUp(usedIds, std::move(callback), std::move(stop)); });
 }
 
 }  // namespace Ipc::DB

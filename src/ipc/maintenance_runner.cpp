@@ -67,8 +67,8 @@ bool MaintenanceRunner::stopAll(std::chrono::milliseconds limit) {
   lock.unlock();
   detachSelf(ended);
   if (!allEnded) {
-    Log::Lock(Log::Warning).logStreamLine() << "Maintenance operations still running after "
-                                            << limit.count() << " ms are left to end by themselves";
+    Log::Lock(Log::Warning).logStreamLine()
+        << "Maintenance operations still running after " << limit.count() << " ms are left to end by themselves";
   }
   return allEnded;  // ended threads are joined as the list goes
 }

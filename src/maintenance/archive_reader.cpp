@@ -70,7 +70,10 @@ void ArchiveReader::readDirectory() {
   if (tailSize < zip::kEndSize) decompressionError(zip::kBadZipFile, "\"" + path_.string() + "\" is not a ZIP archive");
   std::vector<unsigned char> tail(tailSize);
   const std::uint64_t tailStart = fileSize - tailSize;
-  envStep([&] { readExactly(*file_, tailStart, tail.data(), tail.size()); return 0; });
+  envStep([&] {
+    readExactly(*file_, tailStart, tail.data(), tail.size());
+    return 0;
+  });
   std::size_t end = tailSize - zip::kEndSize + 1;
   do {
     --end;
@@ -85,12 +88,18 @@ void ArchiveReader::readDirectory() {
   const std::uint64_t endAt = tailStart + end;
   if (endAt >= zip::kEnd64LocatorSize) {
     unsigned char loc[zip::kEnd64LocatorSize];
-    envStep([&] { readExactly(*file_, endAt - zip::kEnd64LocatorSize, loc, sizeof loc); return 0; });
+    envStep([&] {
+      readExactly(*file_, endAt - zip::kEnd64LocatorSize, loc, sizeof loc);
+      return 0;
+    });
     if (zip::get32(loc) == zip::kEnd64LocatorSig) {
       const std::uint64_t end64At = zip::get64(loc + 8);
       unsigned char rec[zip::kEnd64Size];
       if (end64At > fileSize - zip::kEnd64Size) decompressionError(zip::kBadZipFile, "ZIP64 end record out of range");
-      envStep([&] { readExactly(*file_, end64At, rec, sizeof rec); return 0; });
+      envStep([&] {
+        readExactly(*file_, end64At, rec, sizeof rec);
+        return 0;
+      });
       if (zip::get32(rec) != zip::kEnd64Sig) decompressionError(zip::kBadZipFile, "ZIP64 end record missing");
       count = zip::get64(rec + 32);
       cdSize = zip::get64(rec + 40);
@@ -101,7 +110,10 @@ void ArchiveReader::readDirectory() {
     decompressionError(zip::kBadZipFile, "central directory out of range");
   }
   std::vector<unsigned char> cd(static_cast<std::size_t>(cdSize));
-  envStep([&] { readExactly(*file_, cdOffset, cd.data(), cd.size()); return 0; });
+  envStep([&] {
+    readExactly(*file_, cdOffset, cd.data(), cd.size());
+    return 0;
+  });
   std::size_t at = 0;
   entries_.reserve(static_cast<std::size_t>(count));
   for (std::uint64_t i = 0; i < count; ++i) {
@@ -201,8 +213,9 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
       if (missing || checked.count(at) != 0) continue;
       const sys::FileType type = envStep([&] { return env_.stat(at).type; });
       if (type == sys::FileType::Link || type == sys::FileType::Other) {
-        decompressionError(zip::kBadZipFile,
-                           "entry \"" + e.name + "\" would be written through the link or special file \"" + at.string() + '"');
+        decompressionError(
+            zip::kBadZipFile,
+            "entry \"" + e.name + "\" would be written through the link or special file \"" + at.string() + '"');
       }
       if (type == sys::FileType::Missing) missing = true;
       if (!leaf) checked.insert(at);
@@ -231,8 +244,8 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
   // 3. The entries, inflated by the workers in index order.
   std::mutex mutex;
   std::condition_variable changed;
-  std::size_t done = 0;         // guarded by mutex
-  std::exception_ptr failure;   // guarded by mutex
+  std::size_t done = 0;        // guarded by mutex
+  std::exception_ptr failure;  // guarded by mutex
   std::atomic<std::size_t> next{0};
   std::atomic<bool> failed{false};
 
@@ -242,8 +255,12 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
     const sys::Path& target = targets[index];
     if (target.empty()) return;
     unsigned char local[zip::kLocalHeaderSize];
-    envStep([&] { readExactly(archive, e.offset, local, sizeof local); return 0; });
-    if (zip::get32(local) != zip::kLocalHeaderSig) decompressionError(zip::kBadZipFile, "local header of \"" + e.name + "\" missing");
+    envStep([&] {
+      readExactly(archive, e.offset, local, sizeof local);
+      return 0;
+    });
+    if (zip::get32(local) != zip::kLocalHeaderSig)
+      decompressionError(zip::kBadZipFile, "local header of \"" + e.name + "\" missing");
     std::uint64_t dataAt = e.offset + zip::kLocalHeaderSize + zip::get16(local + 26) + zip::get16(local + 28);
     std::unique_ptr<sys::File> outFile;
     try {
@@ -261,13 +278,19 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
       crc = static_cast<std::uint32_t>(crc32_z(crc, data, size));
       written += size;
       if (written > e.size) decompressionError(zip::kCrcError, "\"" + e.name + "\" is longer than recorded");
-      envStep([&] { outFile->write(data, size); return 0; });
+      envStep([&] {
+        outFile->write(data, size);
+        return 0;
+      });
     };
     while (left > 0) {
       if (stop.stop_requested()) throw OperationStopped("Unpacking \"" + path_.string() + "\" was stopped");
       if (failed.load()) return;
       const std::size_t n = static_cast<std::size_t>(std::min<std::uint64_t>(left, in.size()));
-      envStep([&] { readExactly(archive, dataAt, in.data(), n); return 0; });
+      envStep([&] {
+        readExactly(archive, dataAt, in.data(), n);
+        return 0;
+      });
       dataAt += n;
       left -= n;
       if (e.method == zip::kMethodStored) {
@@ -294,8 +317,10 @@ void ArchiveReader::unpackTo(const sys::Path& folder, const Progress& progress, 
       zs.avail_out = static_cast<uInt>(out.size());
       const int rc = inflate(&zs, Z_NO_FLUSH);
       emit(out.data(), out.size() - zs.avail_out);
-      if (rc == Z_STREAM_END) ended = true;
-      else if (zs.avail_out == out.size()) decompressionError(Z_DATA_ERROR, "\"" + e.name + "\" is cut short");
+      if (rc == Z_STREAM_END)
+        ended = true;
+      else if (zs.avail_out == out.size())
+        decompressionError(Z_DATA_ERROR, "\"" + e.name + "\" is cut short");
     }
     if (written != e.size || crc != e.crc) decompressionError(zip::kCrcError, "checksum mismatch in \"" + e.name + '"');
     envStep([&] {
@@ -393,7 +418,9 @@ void ArchiveReader::runAll(const std::vector<std::function<void()>>& jobs, std::
         jobs[i]();
       } catch (const std::system_error& e) {
         std::lock_guard lock(mutex);
-        if (!failure) failure = std::make_exception_ptr(ArchiveError("Decompression error: " + std::to_string(zip::kErrno) + " (" + e.what() + ")"));
+        if (!failure)
+          failure = std::make_exception_ptr(
+              ArchiveError("Decompression error: " + std::to_string(zip::kErrno) + " (" + e.what() + ")"));
         next = jobs.size();
       } catch (...) {
         std::lock_guard lock(mutex);

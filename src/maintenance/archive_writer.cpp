@@ -33,9 +33,7 @@ constexpr std::size_t kWindow = 32768;
 constexpr std::size_t kWriteBuffer = 1 << 20;
 constexpr std::uint32_t kUnknown32 = 0xffffffffu;
 
-std::uint32_t size32(std::uint64_t size) {
-  return size >= kUnknown32 ? kUnknown32 : static_cast<std::uint32_t>(size);
-}
+std::uint32_t size32(std::uint64_t size) { return size >= kUnknown32 ? kUnknown32 : static_cast<std::uint32_t>(size); }
 
 std::string compressionError(int code, const std::string& what) {
   return "Compression error: " + std::to_string(code) + " (" + what + ")";
@@ -47,15 +45,15 @@ struct Chunk {
   bool first = false;
   bool last = false;
   bool skipped = false;
-  std::string reason;                 // why the entry was skipped
-  std::uint32_t dosTime = 0;          // first chunk of an entry
+  std::string reason;         // why the entry was skipped
+  std::uint32_t dosTime = 0;  // first chunk of an entry
   std::vector<unsigned char> input;
   std::vector<unsigned char> window;  // up to 32 KiB of input before this chunk
   std::vector<unsigned char> output;  // raw deflate
   std::uint32_t crc = 0;
-  int error = 0;                      // compression library's code; 0: fine
+  int error = 0;  // compression library's code; 0: fine
   std::string errorText;
-  bool done = false;                  // guarded by Pipeline::mutex_
+  bool done = false;  // guarded by Pipeline::mutex_
 };
 
 // Per worker: the two encoders, reused from chunk to chunk.
@@ -152,7 +150,8 @@ class ArchiveWriter::Pipeline {
 
  private:
   void checkStop() {
-    if (stop_.stop_requested()) throw OperationStopped("Writing the archive \"" + w_.destination_.string() + "\" was stopped");
+    if (stop_.stop_requested())
+      throw OperationStopped("Writing the archive \"" + w_.destination_.string() + "\" was stopped");
   }
 
   void readEntry(std::size_t index) {
@@ -253,7 +252,8 @@ class ArchiveWriter::Pipeline {
       report(entry, c->entry, true, c->reason);
       return;
     }
-    if (c->error != 0) throw ArchiveError(compressionError(c->error, c->errorText + " of \"" + entry.file.string() + '"'));
+    if (c->error != 0)
+      throw ArchiveError(compressionError(c->error, c->errorText + " of \"" + entry.file.string() + '"'));
     try {
       if (c->first) {
         entry.dosTime = c->dosTime;
@@ -318,8 +318,8 @@ class ArchiveWriter::Pipeline {
   std::stop_token stop_;
   std::size_t maxInFlight_ = 0;
   std::mutex mutex_;
-  std::condition_variable wake_;      // work queued or quit
-  std::condition_variable finished_;  // a chunk is done
+  std::condition_variable wake_;                 // work queued or quit
+  std::condition_variable finished_;             // a chunk is done
   std::deque<std::unique_ptr<Chunk>> inFlight_;  // in archive order; guarded by mutex_
   std::deque<Chunk*> todo_;                      // guarded by mutex_
   bool quit_ = false;                            // guarded by mutex_
@@ -344,8 +344,8 @@ ArchiveWriter::~ArchiveWriter() { discard(); }
 void ArchiveWriter::add(sys::Path file, std::string entryName) {
   if (spent_) throw std::logic_error("ArchiveWriter::add after commit");
   if (entryName.empty() || entryName.size() > 0xffff) {
-    throw ArchiveError("Compression error: " + std::to_string(zip::kInternalError) + " (an entry name must have 1 to 65535 bytes: \"" +
-                       entryName.substr(0, 64) + "\")");
+    throw ArchiveError("Compression error: " + std::to_string(zip::kInternalError) +
+                       " (an entry name must have 1 to 65535 bytes: \"" + entryName.substr(0, 64) + "\")");
   }
   entries_.push_back(Entry{std::move(file), std::move(entryName)});
 }
@@ -358,7 +358,8 @@ void ArchiveWriter::commit(std::stop_token stop) {
       Pipeline pipeline(*this, stop);
       pipeline.run();
     }
-    if (stop.stop_requested()) throw OperationStopped("Writing the archive \"" + destination_.string() + "\" was stopped");
+    if (stop.stop_requested())
+      throw OperationStopped("Writing the archive \"" + destination_.string() + "\" was stopped");
     try {
       writeCentralDirectory();
       flush();
@@ -528,7 +529,8 @@ void ArchiveWriter::discard() noexcept {
     env_.remove(temp_);
   } catch (const std::exception& e) {
     try {
-      Log::Lock(Log::Error).logStreamLine() << "Failed to clean up file(s) at \"" << temp_.string() << "\": " << e.what();
+      Log::Lock(Log::Error).logStreamLine()
+          << "Failed to clean up file(s) at \"" << temp_.string() << "\": " << e.what();
     } catch (...) {
     }
   }

@@ -73,12 +73,12 @@ struct ArchiveWriterOptions {
 class ArchiveWriter {
  public:
   struct EntryReport {
-    std::size_t index;         // in add order, from 0
+    std::size_t index;  // in add order, from 0
     const sys::Path& file;
     const std::string& name;
-    bool skipped;              // the file could not be opened: not in the archive
-    std::string reason;        // why it was skipped
-    std::uint64_t size;        // bytes read from the file
+    bool skipped;        // the file could not be opened: not in the archive
+    std::string reason;  // why it was skipped
+    std::uint64_t size;  // bytes read from the file
   };
   using EntryCallback = std::function<void(const EntryReport&)>;
 

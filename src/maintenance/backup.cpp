@@ -41,8 +41,8 @@ class PackProgress {
     if (percent < reported_ + 5) return;
     reported_ = percent;
     progress_.onProgress(static_cast<std::uint32_t>(percent), prefix_ + std::to_string(percent) + "% complete (" +
-                                                                  std::to_string(done_) + "/" +
-                                                                  std::to_string(total_) + ")");
+                                                                  std::to_string(done_) + "/" + std::to_string(total_) +
+                                                                  ")");
   }
 
  private:
@@ -57,8 +57,12 @@ engine::StatusCallback engineStatus(DB::DBProgressCallback& progress) {
   return [&progress](const engine::StatusNotification& n) {
     const std::string word = n.operation == engine::SnapshotOperation::Backup ? "backup" : "restore";
     switch (n.kind) {
-      case engine::StatusKind::Begin: progress.onProgress(0, "Metadata " + word + " started..."); break;
-      case engine::StatusKind::Complete: progress.onProgress(100, "Metadata " + word + " finished"); break;
+      case engine::StatusKind::Begin:
+        progress.onProgress(0, "Metadata " + word + " started...");
+        break;
+      case engine::StatusKind::Complete:
+        progress.onProgress(100, "Metadata " + word + " finished");
+        break;
       case engine::StatusKind::Progress:
         if (n.done && n.total) {
           const std::uint32_t percent =
@@ -110,9 +114,8 @@ std::string archivePath(const DB::Paths& paths, sys::Env& env, const std::string
   return t;
 }
 
-std::string backupOne(const std::shared_ptr<DB::DBInstances>& pool, const std::string& dbKey,
-                      const std::string& target, const std::string& requesterDbFile, DB::DBProgressCallback& progress,
-                      std::stop_token stop) {
+std::string backupOne(const std::shared_ptr<DB::DBInstances>& pool, const std::string& dbKey, const std::string& target,
+                      const std::string& requesterDbFile, DB::DBProgressCallback& progress, std::stop_token stop) {
   sys::Env& env = pool->env();
   const DB::Paths& paths = pool->paths();
   const std::string archive = archivePath(paths, env, target, dbKey);

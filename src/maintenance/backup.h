@@ -53,9 +53,8 @@ std::string archivePath(const DB::Paths& paths, sys::Env& env, const std::string
 // Backs the database up into archivePath(target); requesterDbFile is the
 // database file of the connection that asked (the origin file's first line).
 // Returns the archive's path.
-std::string backupOne(const std::shared_ptr<DB::DBInstances>& pool, const std::string& dbKey,
-                      const std::string& target, const std::string& requesterDbFile, DB::DBProgressCallback& progress,
-                      std::stop_token stop = {});
+std::string backupOne(const std::shared_ptr<DB::DBInstances>& pool, const std::string& dbKey, const std::string& target,
+                      const std::string& requesterDbFile, DB::DBProgressCallback& progress, std::stop_token stop = {});
 
 // A path for a log line: in double quotes, every '"' and '&' inside
 // preceded by '&'.

@@ -62,10 +62,10 @@ void cleanUp(const std::shared_ptr<DB::DBInstances>& pool, const std::string& db
     // pass 100; the protocol promises 0 to 100.
     const auto percent = static_cast<std::int64_t>(std::min<std::uint64_t>(processed * 100 / total, 100));
     if (percent >= reported + 5) {
-      progress.onProgress(static_cast<std::uint32_t>(percent),
-                          "Removing data chunks " + std::to_string(percent) + "% complete (" +
-                              std::to_string(processed) + "/" + std::to_string(total) + "), " +
-                              std::to_string(erased) + " erased");
+      progress.onProgress(static_cast<std::uint32_t>(percent), "Removing data chunks " + std::to_string(percent) +
+                                                                   "% complete (" + std::to_string(processed) + "/" +
+                                                                   std::to_string(total) + "), " +
+                                                                   std::to_string(erased) + " erased");
       reported = percent;
     }
   }

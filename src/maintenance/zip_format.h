@@ -48,9 +48,7 @@ inline void put64(std::string& out, std::uint64_t v) {
   put32(out, static_cast<std::uint32_t>(v & 0xffffffffu));
   put32(out, static_cast<std::uint32_t>(v >> 32));
 }
-inline std::uint16_t get16(const unsigned char* p) {
-  return static_cast<std::uint16_t>(p[0] | (p[1] << 8));
-}
+inline std::uint16_t get16(const unsigned char* p) { return static_cast<std::uint16_t>(p[0] | (p[1] << 8)); }
 inline std::uint32_t get32(const unsigned char* p) {
   return static_cast<std::uint32_t>(get16(p)) | (static_cast<std::uint32_t>(get16(p + 2)) << 16);
 }

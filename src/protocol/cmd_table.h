@@ -44,10 +44,10 @@ CVDB_DB_COMMANDS(CVDB_DECLARE_CMD)
 // Tag and name of a command class, from the table.
 template <class C>
 struct CmdTraits;
-#define CVDB_CMD_TRAITS(t, Class)                    \
-  template <>                                        \
-  struct CmdTraits<Class> {                          \
-    static constexpr std::uint8_t kTag = t;          \
+#define CVDB_CMD_TRAITS(t, Class)                     \
+  template <>                                         \
+  struct CmdTraits<Class> {                           \
+    static constexpr std::uint8_t kTag = t;           \
     static constexpr std::string_view kName = #Class; \
   };
 CVDB_DB_COMMANDS(CVDB_CMD_TRAITS)

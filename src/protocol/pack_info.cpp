@@ -5,10 +5,8 @@
 #include <cstring>
 #include <initializer_list>
 
-
 namespace Ipc {
 namespace {
-
 
 constexpr const char* kEntriesKey = "entries";
 constexpr const char* kName = "name";
@@ -150,7 +148,8 @@ static void keepOtherKeys(json_t* from, json_t* to, std::initializer_list<const 
 }
 
 void UseInfos::serialize(json::Object& out) const {
-  if (storedList_.isObject()) keepOtherKeys(storedList_.get(), static_cast<const json::Value&>(out).get(), {kEntriesKey});
+  if (storedList_.isObject())
+    keepOtherKeys(storedList_.get(), static_cast<const json::Value&>(out).get(), {kEntriesKey});
   if (entries_.empty()) return;
   json::Value list = json::Value::steal(json_array());
   if (list.empty()) throw std::bad_alloc();

@@ -63,8 +63,8 @@ class UseInfo {
 
   State state = OpenForEdit;
   std::string host;
-  std::string user;        // may be empty
-  std::uint32_t process = 0;  // may be 0
+  std::string user;                  // may be empty
+  std::uint32_t process = 0;         // may be 0
   std::int64_t time = TIME_INVALID;  // seconds since the epoch
 
   bool operator==(const UseInfo&) const = default;
@@ -134,8 +134,8 @@ class PackInfoPartial {
   // The fields of a stored object with a use list of the caller's.
   PackInfoPartial(const json::Object& stored, UseInfos useList);
 
-  std::string name = STR_INVALID;   // display name
-  std::string owner = STR_INVALID;  // who created the pack
+  std::string name = STR_INVALID;        // display name
+  std::string owner = STR_INVALID;       // who created the pack
   std::int64_t created = TIME_INVALID;   // seconds since the epoch
   std::int64_t modified = TIME_INVALID;  // seconds since the epoch
   std::int32_t docCount = LONG_INVALID;  // number of documents

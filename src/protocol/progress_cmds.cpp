@@ -29,9 +29,7 @@ void ProgressCmdsBase::sendProgress(std::uint32_t percent, const std::string& te
 
 void ProgressCmdsBase::firstProgressMsg(const std::string& text) { sendProgress(0, text); }
 
-void ProgressCmdsBase::sendMoreProgress(std::uint32_t percent, const std::string& text) {
-  sendProgress(percent, text);
-}
+void ProgressCmdsBase::sendMoreProgress(std::uint32_t percent, const std::string& text) { sendProgress(percent, text); }
 
 void ProgressCmdsBase::sendNoMoreProgress() {
   sys::MutexLock lock(mutex_);

@@ -15,19 +15,22 @@ constexpr std::uint64_t kMinPackSize = 4 + 1 + 4;
 // an absent field; it is refused as malformed instead.
 std::string presentString(wire::Reader& in, const char* what) {
   std::string s = in.str();
-  if (s == PackInfoPartial::STR_INVALID) throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
+  if (s == PackInfoPartial::STR_INVALID)
+    throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
   return s;
 }
 
 std::int32_t presentLong(wire::Reader& in, const char* what) {
   const std::int32_t v = in.i32();
-  if (v == PackInfoPartial::LONG_INVALID) throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
+  if (v == PackInfoPartial::LONG_INVALID)
+    throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
   return v;
 }
 
 std::int64_t presentTime(wire::Reader& in, const char* what) {
   const std::int64_t v = in.i64();
-  if (v == PackInfoPartial::TIME_INVALID) throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
+  if (v == PackInfoPartial::TIME_INVALID)
+    throw wire::DecodeError(std::string(what) + " holds the reserved absent marker");
   return v;
 }
 
@@ -95,7 +98,8 @@ void writePackInfo(wire::Writer& out, const PackInfo& p) {
   if (bits & kCreated) out.i64(p.created);
   if (bits & kModified) out.i64(p.modified);
   if (bits & kDocCount) out.i32(p.docCount);
-  if (p.uses.size() > std::numeric_limits<std::uint32_t>::max()) throw std::length_error("use list too long for the wire");
+  if (p.uses.size() > std::numeric_limits<std::uint32_t>::max())
+    throw std::length_error("use list too long for the wire");
   out.u32(static_cast<std::uint32_t>(p.uses.size()));
   for (const UseInfo& u : p.uses) writeUse(out, u);
 }
@@ -130,7 +134,8 @@ PackInfoPtr readOptPackInfo(wire::Reader& in) {
 }
 
 void writePackInfos(wire::Writer& out, const PackInfos& list) {
-  if (list.size() > std::numeric_limits<std::uint32_t>::max()) throw std::length_error("pack list too long for the wire");
+  if (list.size() > std::numeric_limits<std::uint32_t>::max())
+    throw std::length_error("pack list too long for the wire");
   // A listing runs to megabytes: sized once, the answer is not copied over
   // and over as it grows.
   std::size_t size = 4;

@@ -22,7 +22,6 @@ namespace Ipc::wirefmt {
 void writeJson(wire::Writer& out, const json::Value& v);
 json::Value readJson(wire::Reader& in);
 
-
 // Use entry: i32 state, str host, str user, u32 process, i64 time.
 void writeUse(wire::Writer& out, const UseInfo& u);
 UseInfo readUse(wire::Reader& in);

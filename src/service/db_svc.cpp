@@ -38,8 +38,7 @@ void DBSvc::runSvc() {
     // Everything below the service gets its settings, paths and Env from
     // here, through the pool; nothing below reads the process-wide record.
     const auto pool = DB::DBInstances::create(DB::PoolSettings::from(config), DB::Paths(config), sys::Env::posix());
-    std::shared_ptr<Ipc::DB::Listener> created =
-        Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
+    std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
       sys::MutexLock lock(mutex_);

@@ -100,9 +100,7 @@ std::string normaliseFolder(std::string text) {
   return text;
 }
 
-std::string DBConfig::defaultRoot() {
-  return (Platform::inst().corvinaSystemConfigDir() / "db").string() + "/";
-}
+std::string DBConfig::defaultRoot() { return (Platform::inst().corvinaSystemConfigDir() / "db").string() + "/"; }
 
 const DBConfig& DBConfig::inst() {
   if (const DBConfig* o = g_override.load(std::memory_order_acquire)) return *o;

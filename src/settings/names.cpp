@@ -100,10 +100,17 @@ std::string backupFileName(std::string_view key) {
   out.reserve(key.size() + 16);
   for (const char c : key) {
     switch (c) {
-      case '-': out += "--"; break;
-      case '_': out += "-_"; break;
-      case '\\': out += '_'; break;
-      default: out += c;
+      case '-':
+        out += "--";
+        break;
+      case '_':
+        out += "-_";
+        break;
+      case '\\':
+        out += '_';
+        break;
+      default:
+        out += c;
     }
   }
   out += kBackupExtension;

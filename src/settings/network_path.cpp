@@ -29,15 +29,14 @@ namespace {
 // their storage is local to the node and their locking is sound.
 constexpr std::uint64_t kLustreSuperMagic = 0x0BD00BD0;
 constexpr std::array<std::uint64_t, 11> kNetworkMagics = {
-    NFS_SUPER_MAGIC,  SMB_SUPER_MAGIC, CIFS_SUPER_MAGIC, SMB2_SUPER_MAGIC,
-    AFS_SUPER_MAGIC,  AFS_FS_MAGIC,    CODA_SUPER_MAGIC, NCP_SUPER_MAGIC,
-    V9FS_MAGIC,       CEPH_SUPER_MAGIC, kLustreSuperMagic};
+    NFS_SUPER_MAGIC,  SMB_SUPER_MAGIC, CIFS_SUPER_MAGIC, SMB2_SUPER_MAGIC, AFS_SUPER_MAGIC,  AFS_FS_MAGIC,
+    CODA_SUPER_MAGIC, NCP_SUPER_MAGIC, V9FS_MAGIC,       CEPH_SUPER_MAGIC, kLustreSuperMagic};
 
 // FUSE serves local disks (ntfs-3g, exfat) as well as remote ones, so a FUSE
 // mount counts as remote only when its type names a known network client.
-constexpr std::array<std::string_view, 8> kNetworkFuseTypes = {
-    "fuse.sshfs",     "fuse.rclone",  "fuse.s3fs",     "fuse.glusterfs", "fuse.ceph-fuse",
-    "fuse.curlftpfs", "fuse.smbnetfs", "fuse.gcsfuse"};
+constexpr std::array<std::string_view, 8> kNetworkFuseTypes = {"fuse.sshfs",     "fuse.rclone",    "fuse.s3fs",
+                                                               "fuse.glusterfs", "fuse.ceph-fuse", "fuse.curlftpfs",
+                                                               "fuse.smbnetfs",  "fuse.gcsfuse"};
 
 // The mount type of the device, from /proc/self/mountinfo; "" if not found.
 // A line reads: id parent major:minor root mountpoint options... - type source

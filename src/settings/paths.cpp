@@ -5,8 +5,7 @@
 
 namespace DB {
 
-Paths::Paths(const DBConfig& config)
-    : Paths(config.DBRoot, config.DBLogRoot, config.BackupFolder, config.DBFileName) {}
+Paths::Paths(const DBConfig& config) : Paths(config.DBRoot, config.DBLogRoot, config.BackupFolder, config.DBFileName) {}
 
 Paths::Paths(std::string root, std::string logRoot, std::string backupFolder, std::string dbFileName)
     : root_(std::move(root)),

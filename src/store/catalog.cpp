@@ -24,8 +24,8 @@ void walk(sys::Env& env, const Paths& paths, const std::string& relative, std::v
   }
   for (const auto& e : entries) {
     if (e.type != sys::FileType::Folder) continue;
-    if (relative.empty() && !isDBFolderName(e.name)) continue;       // the server's own folders
-    if (isDatabase && e.name + '/' == kDataSubfolder) continue;      // its data files
+    if (relative.empty() && !isDBFolderName(e.name)) continue;   // the server's own folders
+    if (isDatabase && e.name + '/' == kDataSubfolder) continue;  // its data files
     walk(env, paths, relative + e.name + '/', keys);
   }
 }

@@ -165,8 +165,8 @@ MemBuffer DBLocal::loadDataBlob(const std::string& id, const std::string& file) 
   }
   if (!in) {
     if (g_LogVerbose) {
-      Log::Lock(Log::Debug).logStreamLine() << "DB:loadDataBlob S:" << sessionId() << " Can not find file \"" << id
-                                            << '/' << file << '"';
+      Log::Lock(Log::Debug).logStreamLine()
+          << "DB:loadDataBlob S:" << sessionId() << " Can not find file \"" << id << '/' << file << '"';
     }
     return {};
   }
@@ -175,8 +175,9 @@ MemBuffer DBLocal::loadDataBlob(const std::string& id, const std::string& file) 
     content = MemBuffer(in->size());
     std::uint64_t done = 0;
     while (done < content.size()) {
-      const std::size_t n = in->read(content.data() + done,
-                                     static_cast<std::size_t>(std::min<std::uint64_t>(content.size() - done, kMaxWriteBytes)));
+      const std::size_t n =
+          in->read(content.data() + done,
+                   static_cast<std::size_t>(std::min<std::uint64_t>(content.size() - done, kMaxWriteBytes)));
       // Writes replace files by renaming, so a file never shrinks under a
       // reader; a short read is a failure of the disk or of somebody else.
       if (n == 0) throw std::system_error(EIO, std::generic_category(), "short read");
@@ -237,8 +238,8 @@ void DBLocal::copyDataFolder(const std::string& source, const std::string& targe
   } catch (const std::system_error& e) {
     // What used to be the shell's error code is the failing step and the
     // system's text here.
-    Log::Lock(Log::Error).logStreamLine() << "Failed to rename (copy) data folder for " << source << " to " << target
-                                          << ". Failed to " << e.what();
+    Log::Lock(Log::Error).logStreamLine()
+        << "Failed to rename (copy) data folder for " << source << " to " << target << ". Failed to " << e.what();
     throw DBExc("Error renaming data folder " + source + " to " + target);
   }
 }

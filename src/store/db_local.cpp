@@ -12,12 +12,12 @@
 #include "engine/db_instances.h"
 #include "engine/engine_errors.h"
 #include "engine/transaction.h"
+#include "framework/log.h"
 #include "maintenance/backup.h"
 #include "maintenance/cleanup.h"
 #include "settings/config.h"
-#include "store/catalog.h"
-#include "framework/log.h"
 #include "settings/names.h"
+#include "store/catalog.h"
 #include "store/schema.h"
 #include "store/store_exc.h"
 
@@ -102,9 +102,8 @@ bool DBLocal::exists(bool mustExist) {
   disconnect();
   const bool found = fileAccessible();
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << (found ? "DB:exists Found existing database in "
-                                                    : "DB:exists No database found in ")
-                                          << name_;
+    Log::Lock(Log::Debug).logStreamLine()
+        << (found ? "DB:exists Found existing database in " : "DB:exists No database found in ") << name_;
   }
   if (mustExist && !found) return false;
 
@@ -120,8 +119,8 @@ bool DBLocal::exists(bool mustExist) {
   }
   bool creationFailed = false;
   try {
-    session_ = pool_->newSession(
-        name_, [&](engine::Session& fresh) { attachOrCreate(*pool_, fresh, found, creationFailed); });
+    session_ =
+        pool_->newSession(name_, [&](engine::Session& fresh) { attachOrCreate(*pool_, fresh, found, creationFailed); });
   } catch (...) {
     // Whatever failed (the creation, or the instance's folders already: a
     // name too long for the file system), the folders this attempt made

@@ -30,8 +30,8 @@
 #include <memory>
 #include <optional>
 #include <set>
-#include <stop_token>
 #include <source_location>
+#include <stop_token>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -201,7 +201,6 @@ class DBLocal {
   std::optional<Ipc::UseInfos> updateUseInfo(json::Object& stored, const Ipc::PackInfo& request, bool useUpdate);
   // The debug line of one use-list transition; callers test g_LogVerbose.
   void logUseChange(const std::string& id, std::string_view transition, const Ipc::UseInfo& entry) const;
-
 
   // ---- Helpers shared by the table operations, the pack code included --
   // The open session; throws kInvalidDatabaseId when the store is closed.

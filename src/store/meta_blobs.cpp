@@ -98,8 +98,8 @@ MemBuffer DBLocal::loadMetaBlob(const std::string& key) {
 void DBLocal::saveMetaBlob(const void* data, std::uint64_t length, const std::string& key) {
   runInTransaction(session(), [&] { putMeta(key, data, length); });
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:saveMetaBlob S:" << sessionId() << " Stored metadata for key "
-                                          << key << " size: " << length;
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DB:saveMetaBlob S:" << sessionId() << " Stored metadata for key " << key << " size: " << length;
   }
 }
 

@@ -7,9 +7,9 @@
 #include "engine/db_exc.h"
 #include "engine/transaction.h"
 #include "framework/log.h"
-#include "store/stored_record_reader.h"
 #include "store/db_local.h"
 #include "store/pack_sql.h"
+#include "store/stored_record_reader.h"
 
 namespace DB {
 namespace {
@@ -51,8 +51,8 @@ Ipc::PackInfosPtr DBLocal::infos(const std::string& folder) {
   // One statement: the whole listing comes from one snapshot.
   while (rows.step()) list->push_back(readInfo(rows));
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:infos S:" << s.id() << " Returning " << list->size()
-                                          << " item(s) for folder \"" << folder << '"';
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DB:infos S:" << s.id() << " Returning " << list->size() << " item(s) for folder \"" << folder << '"';
   }
   return list;
 }
@@ -137,8 +137,8 @@ void DBLocal::savePackMeta(const Ipc::PackInfo& request, const void* content, st
     return true;
   });
   if (stored && g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:savePackMeta S:" << sessionId() << " Stored pack metadata for "
-                                          << request.id();
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DB:savePackMeta S:" << sessionId() << " Stored pack metadata for " << request.id();
   }
 }
 
@@ -158,8 +158,8 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
     }
     if (g_LogVerbose) {
       logInfoFor(sessionId(), id, found.info);
-      Log::Lock(Log::Debug).logStreamLine() << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for "
-                                            << id;
+      Log::Lock(Log::Debug).logStreamLine()
+          << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for " << id;
     }
     return found;
   }
@@ -172,8 +172,8 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
     return m;
   });
   if (g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for "
-                                          << id << ". Pack use updated";
+    Log::Lock(Log::Debug).logStreamLine()
+        << "DB:packMetadata S:" << sessionId() << " Returning pack metadata for " << id << ". Pack use updated";
   }
   return changed;
 }

@@ -8,8 +8,9 @@ const std::string& sql::selectMetaValue() {
   // One statement gives the row's rowid and length and, for a short
   // value, the value itself: the common read costs one lookup. A long
   // value is left out here and streamed.
-  static const std::string text = "SELECT rowid, length(blob), CASE WHEN length(blob) <= " +
-                                  std::to_string(DBLocal::kInlineValueBytes) + " THEN blob END FROM meta WHERE id = ?1";
+  static const std::string text =
+      "SELECT rowid, length(blob), CASE WHEN length(blob) <= " + std::to_string(DBLocal::kInlineValueBytes) +
+      " THEN blob END FROM meta WHERE id = ?1";
   return text;
 }
 

@@ -34,7 +34,21 @@ enum class Type : std::uint8_t { Absent, Int, Str, Other };
 enum class Scope : std::uint8_t { Root, Uses, Entries, Entry, Skipped };
 
 // The key whose value comes next, when it is one the record reads.
-enum class Field : std::uint8_t { Other, Name, Owner, Created, Modified, DocCount, Uses, Entries, State, Host, User, Process, Time };
+enum class Field : std::uint8_t {
+  Other,
+  Name,
+  Owner,
+  Created,
+  Modified,
+  DocCount,
+  Uses,
+  Entries,
+  State,
+  Host,
+  User,
+  Process,
+  Time
+};
 
 Field classify(Scope scope, std::string_view k) {
   switch (scope) {
@@ -154,12 +168,28 @@ struct EntryDraft {
 
   void set(Field k, const Scalar& v) {
     switch (k) {
-      case Field::State: state = v.type; stateN = v.n; break;
-      case Field::Process: process = v.type; processN = v.n; break;
-      case Field::Time: time = v.type; timeN = v.n; break;
-      case Field::Host: host = v.type; if (v.type == Type::Str) hostS.assign(v.s); break;
-      case Field::User: user = v.type; if (v.type == Type::Str) userS.assign(v.s); break;
-      default: break;
+      case Field::State:
+        state = v.type;
+        stateN = v.n;
+        break;
+      case Field::Process:
+        process = v.type;
+        processN = v.n;
+        break;
+      case Field::Time:
+        time = v.type;
+        timeN = v.n;
+        break;
+      case Field::Host:
+        host = v.type;
+        if (v.type == Type::Str) hostS.assign(v.s);
+        break;
+      case Field::User:
+        user = v.type;
+        if (v.type == Type::Str) userS.assign(v.s);
+        break;
+      default:
+        break;
     }
   }
 };
@@ -230,26 +260,40 @@ class RecordHandler {
     switch (scope(depth_)) {
       case Scope::Root:
         switch (key_) {
-          case Field::Name: setString(out_.name, v); break;
-          case Field::Owner: setString(out_.owner, v); break;
-          case Field::Created: out_.created = v.type == Type::Int ? v.n : PackInfoPartial::TIME_INVALID; break;
-          case Field::Modified: out_.modified = v.type == Type::Int ? v.n : PackInfoPartial::TIME_INVALID; break;
+          case Field::Name:
+            setString(out_.name, v);
+            break;
+          case Field::Owner:
+            setString(out_.owner, v);
+            break;
+          case Field::Created:
+            out_.created = v.type == Type::Int ? v.n : PackInfoPartial::TIME_INVALID;
+            break;
+          case Field::Modified:
+            out_.modified = v.type == Type::Int ? v.n : PackInfoPartial::TIME_INVALID;
+            break;
           case Field::DocCount:
             out_.docCount = v.type == Type::Int && v.n > std::numeric_limits<std::int32_t>::min() &&
                                     v.n <= std::numeric_limits<std::int32_t>::max()
                                 ? static_cast<std::int32_t>(v.n)
                                 : PackInfoPartial::LONG_INVALID;
             break;
-          case Field::Uses: out_.uses = UseInfos(); break;  // not an object: no list
-          default: break;
+          case Field::Uses:
+            out_.uses = UseInfos();
+            break;  // not an object: no list
+          default:
+            break;
         }
         break;
       case Scope::Uses:
         if (key_ == Field::Entries) out_.uses = UseInfos();  // not an array: no list
         break;
-      case Scope::Entry: draft_.set(key_, v); break;
+      case Scope::Entry:
+        draft_.set(key_, v);
+        break;
       case Scope::Entries:  // an element that is not an object: dropped
-      case Scope::Skipped: break;
+      case Scope::Skipped:
+        break;
     }
   }
 

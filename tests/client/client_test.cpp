@@ -33,12 +33,12 @@ class WithListener : public ::testing::Test {
  protected:
   LogCapture log;
   testing_support::TempDir dir;
-  std::shared_ptr<Ipc::DB::Listener> listener = Ipc::DB::createListener(
-      0, true,
-      DB::DBInstances::create(DB::PoolSettings{},
-                              DB::Paths(dir.path().string() + "/", dir.path().string() + "/",
-                                        dir.path().string() + "/db.backup/", "cvdb.edb"),
-                              sys::Env::posix()));
+  std::shared_ptr<Ipc::DB::Listener> listener =
+      Ipc::DB::createListener(0, true,
+                              DB::DBInstances::create(DB::PoolSettings{},
+                                                      DB::Paths(dir.path().string() + "/", dir.path().string() + "/",
+                                                                dir.path().string() + "/db.backup/", "cvdb.edb"),
+                                                      sys::Env::posix()));
   std::uint16_t port = Ipc::DB::serverOf(*listener).port();
 
   ~WithListener() override {
@@ -174,8 +174,8 @@ class WithScript : public ::testing::Test {
 
   WithScript() {
     processor->release = releaseSilent.get_future().share();
-    server = std::make_unique<Ipc::SvcStub>(
-        0, true, [p = processor](std::uint8_t tag) { return Ipc::DB::makeCommand(tag, p); });
+    server = std::make_unique<Ipc::SvcStub>(0, true,
+                                            [p = processor](std::uint8_t tag) { return Ipc::DB::makeCommand(tag, p); });
     processor->server = server.get();
   }
   ~WithScript() override {

@@ -113,14 +113,15 @@ TEST(CvdbTool, CleanupRemovesOldUnusedDataWithProgress) {
   for (const char* id : {"old", "kept-by-option", "kept-by-file"}) std::filesystem::last_write_time(data / id, old);
   writeFile(dir / "used.txt", "kept-by-file\n");
 
-  const std::string out =
-      ok(cvdb({"cleanup", "--used", "kept-by-option", "--used-file", (dir / "used.txt").string()}));
+  const std::string out = ok(cvdb({"cleanup", "--used", "kept-by-option", "--used-file", (dir / "used.txt").string()}));
   EXPECT_TRUE(has(out, "Starting Database Cleanup...")) << out;
   EXPECT_TRUE(has(out, "Erasing unused data...")) << out;
   EXPECT_TRUE(has(out, "Removing data chunks 100% complete (4/4), 1 erased")) << out;
   EXPECT_FALSE(std::filesystem::exists(data / "old"));
-  for (const char* id : {"kept-by-option", "kept-by-file", "young"}) EXPECT_TRUE(std::filesystem::exists(data / id)) << id;
-  EXPECT_TRUE(server.waitForLogLine("Database \"docs\" cleaned. 1 unused ids deleted, 1 unused ids too recent to clean"));
+  for (const char* id : {"kept-by-option", "kept-by-file", "young"})
+    EXPECT_TRUE(std::filesystem::exists(data / id)) << id;
+  EXPECT_TRUE(
+      server.waitForLogLine("Database \"docs\" cleaned. 1 unused ids deleted, 1 unused ids too recent to clean"));
   EXPECT_TRUE(has(ok(cvdb({"--json", "cleanup"})), "{\"percent\":0,\"text\":\"Erasing unused data...\"}"));
 
   auto unbound = clientOf(server);
@@ -129,8 +130,9 @@ TEST(CvdbTool, CleanupRemovesOldUnusedDataWithProgress) {
     unbound->cleanup({}, [&](std::uint32_t, const std::string& text) { seen.push_back(text); });
     ADD_FAILURE() << "a cleanup without a database succeeded";
   } catch (const cvdb::OperationFailed& e) {
-    EXPECT_EQ(e.reason(),
-              "DB operation failed with error: No database associated with current connection. Connect command failed?");
+    EXPECT_EQ(
+        e.reason(),
+        "DB operation failed with error: No database associated with current connection. Connect command failed?");
   }
   EXPECT_EQ(seen.front(), "Starting Database Cleanup...");
   EXPECT_TRUE(server.waitForLogLine("Async command Cleanup failed with No database associated"));

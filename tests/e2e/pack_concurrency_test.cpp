@@ -204,9 +204,8 @@ TEST(PackConcurrency, ConcurrentSavesUpdatesAndClosesLoseNothingAndReadersSeeWho
   std::sort(closeSizes.begin(), closeSizes.end());
   for (std::size_t i = 0; i < closeSizes.size(); ++i) ASSERT_EQ(closeSizes[i], i);
   // No use key is left in the stored object, and the record is intact.
-  const json::Object stored = json::strToObject(
-      *testing_support::RawDb(server.home() / "db" / "busy" / "cvdb.edb")
-           .value("SELECT blob FROM info WHERE id = CAST('P' AS BLOB)"));
+  const json::Object stored = json::strToObject(*testing_support::RawDb(server.home() / "db" / "busy" / "cvdb.edb")
+                                                     .value("SELECT blob FROM info WHERE id = CAST('P' AS BLOB)"));
   EXPECT_FALSE(stored.has("uses")) << stored.dump();
   EXPECT_EQ(stored.get("name"), json::Value::string(final.info->name));
 

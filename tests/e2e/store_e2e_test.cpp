@@ -62,7 +62,7 @@ TEST(StoreEndToEnd, DatabaseNamesThatWouldLeaveTheRootAreRefusedAndMakeNothing) 
   // A name the file system refuses (a component too long) fails the
   // creation, which takes back every folder it made.
   EXPECT_EQ(endedBy([&] { c->connect("abc\\" + std::string(300, 'x')); }), kTerminating);
-  EXPECT_EQ(std::distance(fs::directory_iterator(server.home()), fs::directory_iterator()), 1);  // db/
+  EXPECT_EQ(std::distance(fs::directory_iterator(server.home()), fs::directory_iterator()), 1);   // db/
   EXPECT_EQ(std::distance(fs::directory_iterator(dbRoot(server)), fs::directory_iterator()), 1);  // config.json
 }
 

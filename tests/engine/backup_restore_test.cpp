@@ -158,8 +158,9 @@ TEST_F(BackupRestore, RestorePlacesTheBackupUnderAnyNameAndDropsAStaleLog) {
   held->term();
   // Two files with our identity: neither is taken.
   fs::copy_file(backup / "old-name.db", backup / "other.db");
-  EXPECT_EQ(codeOf([&] { engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder,
-                                                 nullptr); }),
+  EXPECT_EQ(codeOf([&] {
+              engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr);
+            }),
             err::kBadBackupFormat);
 
   RawDb db(file);
@@ -196,9 +197,7 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
       {"missing", [](const fs::path&) {}},
       {"not SQLite", [](const fs::path& f) { writeFile(f, std::string(4096, 'E')); }},
       {"another application",
-       [](const fs::path& f) {
-         RawDb(f, true).exec("CREATE TABLE t(x); INSERT INTO t VALUES(1);");
-       }},
+       [](const fs::path& f) { RawDb(f, true).exec("CREATE TABLE t(x); INSERT INTO t VALUES(1);"); }},
       {"newer format",
        [&](const fs::path& f) {
          writeFile(f, goodBytes);
@@ -206,8 +205,10 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
        }},
       {"truncated", [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, goodBytes.size() / 2)); }},
       // A page size the copy would divide by, and one that is no power of two.
-      {"page size 0", [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + std::string(2, '\0') + goodBytes.substr(18)); }},
-      {"page size 1000", [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x03\xe8" + goodBytes.substr(18)); }},
+      {"page size 0",
+       [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + std::string(2, '\0') + goodBytes.substr(18)); }},
+      {"page size 1000",
+       [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x03\xe8" + goodBytes.substr(18)); }},
       {"damaged",
        [&](const fs::path& f) {
          std::string bytes = goodBytes;
@@ -323,8 +324,8 @@ TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
           EXPECT_EQ(RawDb(dest + "cvdb.edb").number("SELECT value FROM counter WHERE id = 1"), 1000);
         } else {
           EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBytes) << "write-ahead log lost";
-          EXPECT_EQ(names, (std::vector<std::string>{"cvdb.edb", "cvdb.edb-wal", "cvdb.edb-wal.keep",
-                                                     "cvdb.edb.keep"}));
+          EXPECT_EQ(names,
+                    (std::vector<std::string>{"cvdb.edb", "cvdb.edb-wal", "cvdb.edb-wal.keep", "cvdb.edb.keep"}));
         }
       });
 }

@@ -60,9 +60,7 @@ class Pool : public EngineTest {
   }
 
   std::unique_ptr<engine::Session> open(const std::string& key) { return pool()->newSession(key, opener()); }
-  void close(const std::string& key, std::unique_ptr<engine::Session> s) {
-    pool()->endSession(key, std::move(s));
-  }
+  void close(const std::string& key, std::unique_ptr<engine::Session> s) { pool()->endSession(key, std::move(s)); }
   std::optional<DBInstances::RecordView> record(const std::string& key) { return pool()->record(key); }
 
   std::atomic<int> opened_{0};
@@ -219,7 +217,8 @@ TEST_F(Pool, ExclusiveHoldWaitsForTheLastClientRefusesSessionsAtOnceAndLeavesFor
 
 TEST_F(Pool, SharedHoldNeedsAnOpenInstanceWaitsWithItsMessagesAndLeavesTheInstanceOpen) {
   auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(failureOf([&] { InstanceForMaintenance hold(pool(), "nowhere", nullptr, false); }), "No instance exist for nowhere");
+  EXPECT_EQ(failureOf([&] { InstanceForMaintenance hold(pool(), "nowhere", nullptr, false); }),
+            "No instance exist for nowhere");
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
 
   // With no wait at all, a busy database fails at once and says nothing.
@@ -239,7 +238,8 @@ TEST_F(Pool, SharedHoldNeedsAnOpenInstanceWaitsWithItsMessagesAndLeavesTheInstan
     InstanceForMaintenance first(pool(), "busy", nullptr, false);
     EXPECT_TRUE(record("busy")->maintenance);
     Recorder progress;
-    EXPECT_EQ(failureOf([&] { InstanceForMaintenance second(pool(), "busy", &progress, false); }), "Operation timeout!");
+    EXPECT_EQ(failureOf([&] { InstanceForMaintenance second(pool(), "busy", &progress, false); }),
+              "Operation timeout!");
     ASSERT_EQ(progress.texts.size(), 10u);  // ticks 1 to 9, then 10
     EXPECT_EQ(progress.texts[0], "Waiting for another database maintenance operation to finish (1/12seconds passed)");
     EXPECT_EQ(progress.texts[9], "Waiting for another database maintenance operation to finish (10/12seconds passed)");
@@ -270,10 +270,9 @@ TEST_F(Pool, MaintenanceHoldsExcludeEachOther) {
 
 TEST_F(Pool, FailedFirstSessionOrExclusiveHoldLeavesNothingCounted) {
   const auto live = pool()->liveInstances();
-  EXPECT_EQ(failureOf([&] {
-              pool()->newSession("f", [](engine::Session&) { throw std::runtime_error("attach failed"); });
-            }),
-            "attach failed");
+  EXPECT_EQ(
+      failureOf([&] { pool()->newSession("f", [](engine::Session&) { throw std::runtime_error("attach failed"); }); }),
+      "attach failed");
   EXPECT_FALSE(record("f"));
   EXPECT_EQ(pool()->liveInstances(), live);
 
@@ -311,8 +310,8 @@ TEST_F(Pool, SessionsOfAnInstanceThePoolForgotAreEndedAndReported) {
   auto fresh = open("gone");
   EXPECT_EQ(codeOf([&] { old->newSession("other", opener()); }), err::kTermInProgress);
   pool()->endSession("gone", std::move(s));
-  EXPECT_EQ(log.count(Log::Error, "DBInstances: DB: gone, Session S:" + std::to_string(id) +
-                                      " released for unknown instance!!!"),
+  EXPECT_EQ(log.count(Log::Error,
+                      "DBInstances: DB: gone, Session S:" + std::to_string(id) + " released for unknown instance!!!"),
             1u);
   EXPECT_EQ(record("gone")->sessions, 1u);
 }

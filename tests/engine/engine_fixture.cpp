@@ -1,6 +1,5 @@
 #include "engine_fixture.h"
 
-
 namespace engine_testing {
 
 int codeOf(const std::function<void()>& action) {

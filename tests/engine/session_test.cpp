@@ -22,13 +22,12 @@ using testing_support::writeFile;
 // Writes a SQLite file with the given identity, in rollback-journal mode.
 void writeSqliteFile(const fs::path& file, int applicationId, int version) {
   fs::create_directories(file.parent_path());
-  testing_support::RawDb(file, true).exec("PRAGMA application_id=" + std::to_string(applicationId) +
-                                          "; PRAGMA user_version=" + std::to_string(version) +
-                                          "; CREATE TABLE t(x); INSERT INTO t VALUES(42);");
+  testing_support::RawDb(file, true)
+      .exec("PRAGMA application_id=" + std::to_string(applicationId) +
+            "; PRAGMA user_version=" + std::to_string(version) + "; CREATE TABLE t(x); INSERT INTO t VALUES(42);");
 }
 
 using Sessions = EngineTest;
-
 
 TEST_F(Sessions, CreatedDatabaseIsDurableAndAttachedByTheNextInstance) {
   const fs::path file = root() + "a/cvdb.edb";
@@ -90,7 +89,8 @@ TEST_F(Sessions, ForeignFilesAreRefusedUntouched) {
       {"text", [](const fs::path& f) { writeFile(f, std::string(8192, 'x')); }, err::kInvalidDatabase},
       {"empty", [](const fs::path& f) { writeFile(f, ""); }, err::kInvalidDatabase},
       {"other application", [](const fs::path& f) { writeSqliteFile(f, 0, 3); }, err::kInvalidDatabase},
-      {"newer format", [](const fs::path& f) { writeSqliteFile(f, engine::kApplicationId, engine::kFormatVersion + 1); },
+      {"newer format",
+       [](const fs::path& f) { writeSqliteFile(f, engine::kApplicationId, engine::kFormatVersion + 1); },
        err::kInvalidDatabaseVersion},
   };
   for (const auto& c : cases) {
@@ -188,15 +188,12 @@ TEST_F(Sessions, LongValuesGoThroughBlobIoInChunks) {
 
   std::vector<std::byte> wrongSize(5);
   EXPECT_EQ(codeOf([&] { engine::readBlob(*reader, "blobs", "blob", rowid, wrongSize); }), err::kInvalidParameter);
-  EXPECT_EQ(codeOf([&] { engine::readBlob(*reader, "blobs", "blob", rowid + 100, wrongSize); }),
-            err::kRecordNotFound);
-  EXPECT_EQ(codeOf([&] { engine::findRowid(*reader, "blobs; DROP TABLE blobs", "id", "x"); }),
-            err::kInvalidParameter);
+  EXPECT_EQ(codeOf([&] { engine::readBlob(*reader, "blobs", "blob", rowid + 100, wrongSize); }), err::kRecordNotFound);
+  EXPECT_EQ(codeOf([&] { engine::findRowid(*reader, "blobs; DROP TABLE blobs", "id", "x"); }), err::kInvalidParameter);
   // Longer than SQLite stores in a row.
-  EXPECT_EQ(codeOf([&] {
-              session->prepare("INSERT INTO blobs(id, blob) VALUES(x'01', ?)").bindZeroBlob(1, 1'000'000'001);
-            }),
-            err::kColumnTooBig);
+  EXPECT_EQ(
+      codeOf([&] { session->prepare("INSERT INTO blobs(id, blob) VALUES(x'01', ?)").bindZeroBlob(1, 1'000'000'001); }),
+      err::kColumnTooBig);
 }
 
 }  // namespace

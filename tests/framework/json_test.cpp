@@ -6,11 +6,14 @@ namespace {
 
 // The type names appear in the texts of type errors, which reach the log.
 TEST(Json, WrongTypeTextsNameBothTypes) {
-  const std::vector<std::pair<json::Value, const char*>> values = {
-      {json::Value(), "empty"},           {json::Object(), "object"},
-      {json::strToValue("[1]"), "array"}, {json::Value::string("x"), "string"},
-      {json::Value::integer(1), "integer"}, {json::Value::real(1.5), "float"},
-      {json::Value::boolean(false), "boolean"}, {json::Value::null(), "null"}};
+  const std::vector<std::pair<json::Value, const char*>> values = {{json::Value(), "empty"},
+                                                                   {json::Object(), "object"},
+                                                                   {json::strToValue("[1]"), "array"},
+                                                                   {json::Value::string("x"), "string"},
+                                                                   {json::Value::integer(1), "integer"},
+                                                                   {json::Value::real(1.5), "float"},
+                                                                   {json::Value::boolean(false), "boolean"},
+                                                                   {json::Value::null(), "null"}};
   for (const auto& [value, name] : values) {
     EXPECT_STREQ(value.typeName(), name);
     if (value.isString()) continue;

@@ -98,7 +98,8 @@ void RawClient::send(std::string_view bytes) {
 bool RawClient::fill(std::size_t want, std::chrono::steady_clock::time_point deadline) {
   char buf[65536];
   while (in_.size() < want) {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
     if (left.count() <= 0) throw std::runtime_error("timed out waiting for the server");
     pollfd p{fd_, POLLIN, 0};
     const int r = ::poll(&p, 1, static_cast<int>(left.count()));
@@ -130,7 +131,8 @@ std::optional<Frame> RawClient::readUntilClosed(std::chrono::milliseconds timeou
   const auto deadline = std::chrono::steady_clock::now() + timeout;
   std::optional<Frame> last;
   for (;;) {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
     auto f = read(left);
     if (!f) return last;
     last = std::move(f);

@@ -65,9 +65,15 @@ class Counter {
   }
 
   // Faults the analysis must report.
-  int readUnlocked() { return value_; }  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
-  void writeUnlocked() { value_ = 1; }   // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
-  void callUnlocked() { addLocked(); }   // expected-warning {{calling function 'addLocked' requires holding mutex 'mutex_' exclusively}}
+  int readUnlocked() {
+    return value_;
+  }  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
+  void writeUnlocked() {
+    value_ = 1;
+  }  // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
+  void callUnlocked() {
+    addLocked();
+  }  // expected-warning {{calling function 'addLocked' requires holding mutex 'mutex_' exclusively}}
   void callWhileHeld() {
     sys::MutexLock lock(mutex_);
     add();  // expected-warning {{cannot call function 'add' while mutex 'mutex_' is held}}
@@ -79,12 +85,12 @@ class Counter {
   }
   void lockTwice() {
     sys::MutexLock lock(mutex_);  // expected-note {{mutex acquired here}}
-    mutex_.lock();  // expected-warning {{acquiring mutex 'mutex_' that is already held}}
+    mutex_.lock();                // expected-warning {{acquiring mutex 'mutex_' that is already held}}
     mutex_.unlock();
   }
   void keepLocked() {
     mutex_.lock();  // expected-note {{mutex acquired here}}
-  }  // expected-warning {{mutex 'mutex_' is still held at the end of function}}
+  }                 // expected-warning {{mutex 'mutex_' is still held at the end of function}}
   void addOnFailedTry() {
     if (mutex_.try_lock()) {
       mutex_.unlock();
@@ -92,10 +98,14 @@ class Counter {
     }
     ++value_;  // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
   }
-  int pointeeUnlocked() { return *shared_; }  // expected-warning {{reading the value pointed to by 'shared_' requires holding mutex 'mutex_'}}
+  int pointeeUnlocked() {
+    return *shared_;
+  }  // expected-warning {{reading the value pointed to by 'shared_' requires holding mutex 'mutex_'}}
   void predicateUnannotated() {
     sys::MutexLock lock(mutex_);
-    changed_.wait(lock.native(), [this] { return value_ > 0; });  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
+    changed_.wait(lock.native(), [this] {
+      return value_ > 0;
+    });  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
   }
 
  private:

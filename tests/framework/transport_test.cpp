@@ -215,9 +215,9 @@ TEST_F(TransportTest, BytesArrivingAfterAConnectionEndedWithinAFrameLandNowhere)
   };
   RawClient bystander(port());
   const std::vector<std::pair<std::string, std::string>> stalls{
-      {large.substr(0, 2), "header"},       // inside the length field
-      {large.substr(0, 3000), "stage"},     // a frame larger than the stage, started
-      {large.substr(0, 150000), "body"},    // deep into its own buffer
+      {large.substr(0, 2), "header"},     // inside the length field
+      {large.substr(0, 3000), "stage"},   // a frame larger than the stage, started
+      {large.substr(0, 150000), "body"},  // deep into its own buffer
   };
   for (const auto& [bytes, where] : stalls) {
     SCOPED_TRACE(where);

@@ -35,7 +35,14 @@ TEST(Wire, MalformedMessagesAreRefusedBeforeAnythingIsAllocated) {
   // Readers do not own their bytes: keep the messages alive. A string that
   // claims 4 GiB, a byte string that claims 2^63 bytes and a list that
   // claims 2^32-1 entries, each in a message of a few bytes.
-  const std::string bigString("\xff\xff\xff\xff" "ab", 6), bigBytes("\0\0\0\0\0\0\0\x80" "ab", 10),
+  const std::string bigString(
+      "\xff\xff\xff\xff"
+      "ab",
+      6),
+      bigBytes(
+          "\0\0\0\0\0\0\0\x80"
+          "ab",
+          10),
       bigList("\xff\xff\xff\xff", 4), shortInt("\x01\x02\x03", 3), badBool("\x02", 1), trailing("\x01\x02", 2);
   EXPECT_THROW(wire::Reader(bigString).str(), wire::DecodeError);
   EXPECT_THROW(wire::Reader(bigBytes).bytes(), wire::DecodeError);

@@ -7,8 +7,8 @@
 
 #include <algorithm>
 
-#include "protocol/fake_socket.h"
 #include "engine/db_instances.h"
+#include "protocol/fake_socket.h"
 #include "support/log_capture.h"
 #include "support/temp_dir.h"
 
@@ -100,8 +100,8 @@ TEST_F(ListenerTest, AFailureWhileAnsweringEndsTheConnectionAndOtherExceptionsPr
   // A handler that succeeds (DBNames over an empty root) but whose answer
   // cannot be handed on.
   const auto pool = poolAt(dir / "none");
-  auto failing = Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw std::runtime_error("send"); },
-                                          pool);
+  auto failing =
+      Listener::createDetached([](const std::shared_ptr<Ipc::CmdI>&) { throw std::runtime_error("send"); }, pool);
   auto cmd = failing->makeCmd(DBNames::kTag);
   cmd->attachSocket(socket);
   failing->processCmd(cmd);
@@ -136,9 +136,9 @@ TEST_F(ListenerTest, DBNamesListsEveryDatabaseBelowTheRootButNothingElse) {
   db("other/deep/er");
   db("db.backup/old");
   db("db.temp/work");
-  db("plant/d/x");            // a data file named like the database file
+  db("plant/d/x");  // a data file named like the database file
   db("plant/d/x/d/y");
-  db("docs/d/cvdb.edb/z");    // below a data folder of a folder that is no database
+  db("docs/d/cvdb.edb/z");  // below a data folder of a folder that is no database
   std::filesystem::create_directory_symlink(root / "plant", root / "link");
   testing_support::writeFile(root / "notes" / "cvdb.edb.bak", "x");
   testing_support::writeFile(root / "cvdb.edb", "x");  // not inside a folder below the root

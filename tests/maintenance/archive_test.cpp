@@ -38,7 +38,8 @@ std::string randomBytes(std::size_t n, unsigned seed) {
 
 std::string text(std::size_t n) {
   std::string s;
-  for (int i = 0; s.size() < n; ++i) s += "line " + std::to_string(i) + ": the quick brown fox, pack " + std::to_string(i % 97) + '\n';
+  for (int i = 0; s.size() < n; ++i)
+    s += "line " + std::to_string(i) + ": the quick brown fox, pack " + std::to_string(i % 97) + '\n';
   s.resize(n);
   return s;
 }
@@ -299,7 +300,8 @@ TEST(ArchiveReader, RefusesNamesThatLeaveTheFolderBeforeWritingAnything) {
   TempDir dir;
   writeFile(dir / "f", "payload");
   fs::create_directories(dir / "outside");
-  for (const std::string bad : {"..\\evil", "a/../../evil", "a\\..\\b", "C:\\evil", "link\\evil", "d\\7\\link2\\evil"}) {
+  for (const std::string bad :
+       {"..\\evil", "a/../../evil", "a\\..\\b", "C:\\evil", "link\\evil", "d\\7\\link2\\evil"}) {
     const auto archive = dir / "bad.cvbak";
     {
       ArchiveWriter writer(sys::Env::posix(), archive);
@@ -352,7 +354,8 @@ TEST(ArchiveReader, AStopEndsTheUnpacking) {
   one.threads = 1;
   ArchiveReader reader(sys::Env::posix(), dir / "a.cvbak", one);
   // The stop is seen between entries or, at the latest, before the syncs.
-  EXPECT_THROW(reader.unpackTo(dir / "into", [&](std::size_t, std::size_t) { stop.request_stop(); }, stop.get_token()),
+  EXPECT_THROW(reader.unpackTo(
+                   dir / "into", [&](std::size_t, std::size_t) { stop.request_stop(); }, stop.get_token()),
                maint::OperationStopped);
 }
 
@@ -368,7 +371,9 @@ TEST(ArchiveReader, DamageIsReportedClearly) {
     ArchiveReader reader(sys::Env::posix(), dir / "missing.cvbak");
     ADD_FAILURE();
   } catch (const ArchiveError& e) {
-    EXPECT_EQ(std::string(e.what()).rfind("Failed to open for decompression file \"" + (dir / "missing.cvbak").string() + '"', 0), 0u);
+    EXPECT_EQ(std::string(e.what()).rfind(
+                  "Failed to open for decompression file \"" + (dir / "missing.cvbak").string() + '"', 0),
+              0u);
   }
   for (std::size_t cut : {std::size_t{0}, std::size_t{10}, good.size() / 2, good.size() - 1}) {
     writeFile(dir / "cut.cvbak", good.substr(0, cut));
@@ -415,7 +420,8 @@ TEST(ArchiveReader, AFailureAtAnyStepOfUnpackingIsReported) {
       ADD_FAILURE() << "call " << n << " failed silently";
     } catch (const ArchiveError& e) {
       const std::string what = e.what();
-      EXPECT_TRUE(what.rfind("Decompression error: ", 0) == 0 || what.rfind("Decompression failed to create file", 0) == 0 ||
+      EXPECT_TRUE(what.rfind("Decompression error: ", 0) == 0 ||
+                  what.rfind("Decompression failed to create file", 0) == 0 ||
                   what.rfind("Failed to open for decompression file", 0) == 0)
           << what;
       EXPECT_NE(what.find("injected"), std::string::npos) << what;

@@ -28,9 +28,12 @@ std::map<std::string, std::string> tree(const fs::path& root) {
   if (!fs::exists(root)) return out;
   for (const auto& e : fs::recursive_directory_iterator(root)) {
     const std::string rel = fs::relative(e.path(), root).string();
-    if (e.is_symlink()) out[rel] = "-> " + fs::read_symlink(e.path()).string();
-    else if (e.is_regular_file()) out[rel] = readFile(e.path());
-    else if (fs::is_empty(e.path())) out[rel + "/"] = "";
+    if (e.is_symlink())
+      out[rel] = "-> " + fs::read_symlink(e.path()).string();
+    else if (e.is_regular_file())
+      out[rel] = readFile(e.path());
+    else if (fs::is_empty(e.path()))
+      out[rel + "/"] = "";
   }
   return out;
 }
@@ -57,8 +60,8 @@ TEST(FileReplacer, MovesFilesAndTheKeptSubfolderAsideAndRollsTheNewContentBack) 
     maint::FileReplacer replacer(sys::Env::posix(), target, holding, "d");
     EXPECT_EQ(replacer.moved().size(), 3u);
     // Only the other subfolder and the link stay behind.
-    EXPECT_EQ(tree(target), (std::map<std::string, std::string>{
-                                {"link", "-> db.sqlite"}, {"other/keep.txt", "untouched"}}));
+    EXPECT_EQ(tree(target),
+              (std::map<std::string, std::string>{{"link", "-> db.sqlite"}, {"other/keep.txt", "untouched"}}));
     EXPECT_EQ(readFile(holding / "d/1/a.bin"), "old data");
     // The failed operation's new content, including a new file name.
     writeFile(target / "db.sqlite", "new database");
@@ -165,8 +168,8 @@ TEST(FileReplacer, FailedRollbackIsLoggedAndDoesNotThrow) {
     maint::FileReplacer replacer(env, target, dir / "hold", "d");
     env.failNth(FaultEnv::Op::Rename, 2);
   }
-  EXPECT_EQ(log.count(Log::Error, std::string(kCritical) + target.string() +
-                                      "\"! Database may be left in unpredictable state."),
+  EXPECT_EQ(log.count(Log::Error,
+                      std::string(kCritical) + target.string() + "\"! Database may be left in unpredictable state."),
             1u);
   // One entry came back, the failed one and the rest stayed aside.
   EXPECT_EQ(fs::exists(target / "db.sqlite") + fs::exists(target / "db.sqlite-wal") + fs::exists(target / "d"), 1);

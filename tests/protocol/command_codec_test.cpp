@@ -212,7 +212,9 @@ std::vector<std::shared_ptr<Ipc::CmdI>> sampleRequests() {
       made<ErasePack>([](ErasePack& c) { c.setRequest("p"); }),
       made<Backup>([](Backup& c) { c.setRequest("t", true); }),
       made<Restore>([](Restore& c) { c.setRequest("t", false); }),
-      made<Cleanup>([](Cleanup& c) { c.setRequest({"x", "", "y"}); }),
+      made<Cleanup>([](Cleanup& c) {
+        c.setRequest({"x", "", "y"});
+      }),
       made<DBNames>(none),
   };
 }
@@ -260,15 +262,18 @@ TEST(CommandCodec, EveryAnswerRoundTripsAndEveryTruncatedOrExtendedOneIsRefused)
   const auto info = [] { return std::make_shared<PackInfo>(fullRecord("a")); };
   for (const std::shared_ptr<Ipc::CmdI>& answer : std::vector<std::shared_ptr<Ipc::CmdI>>{
            made<Connect>([](Connect& c) { c.setResp("no"); }),
-           made<GetCfgPart>([](GetCfgPart& c) { c.setResp(json::strToObject(kCfgText)); }),
-           made<CfgIds>([](CfgIds& c) { c.setResp({"ab", "", "abc"}); }),
+           made<GetCfgPart>([](GetCfgPart& c) { c.setResp(json::strToObject(kCfgText)); }), made<CfgIds>([](CfgIds& c) {
+             c.setResp({"ab", "", "abc"});
+           }),
            made<GetData>([](GetData& c) { c.setResp(MemBuffer::copyOf("data")); }),
            made<GetPackInfos>([](GetPackInfos& c) {
              c.setResp(std::make_shared<Ipc::PackInfos>(Ipc::PackInfos{fullRecord("a"), PackInfo("b")}));
            }),
            made<GetPackInfo>([&](GetPackInfo& c) { c.setResp(info()); }),
            made<GetPack>([&](GetPack& c) { c.setResp(info(), SharedMemBuffer(MemBuffer::copyOf("c"))); }),
-           made<DBNames>([](DBNames& c) { c.setResp({"root.db", "a\\b"}); })}) {
+           made<DBNames>([](DBNames& c) {
+             c.setResp({"root.db", "a\\b"});
+           })}) {
     const std::string payload = payloadOf(answer->answerFrame());
     auto fresh = makeCommand(answer->tag(), nullptr);
     for (std::size_t cut = 0; cut < payload.size(); ++cut) {
@@ -317,12 +322,30 @@ TEST(CommandCodec, MalformedFieldsAreRefused) {
     });
   };
   UpdatePackInfo up;
-  EXPECT_FALSE(refused(up, pack(0, [](wire::Writer&) {}, 0), true));
-  EXPECT_TRUE(refused(up, pack(0x80, [](wire::Writer&) {}, 0), true));
-  EXPECT_TRUE(refused(up, pack(Ipc::wirefmt::kFolder, [](wire::Writer& w) { w.str(PackInfoPartial::STR_INVALID); }, 0), true));
-  EXPECT_TRUE(refused(up, pack(Ipc::wirefmt::kStatus, [](wire::Writer& w) { w.i32(PackInfoPartial::LONG_INVALID); }, 0), true));
-  EXPECT_TRUE(refused(up, pack(Ipc::wirefmt::kCreated, [](wire::Writer& w) { w.i64(PackInfoPartial::TIME_INVALID); }, 0), true));
-  EXPECT_TRUE(refused(up, pack(0, [](wire::Writer&) {}, 0xFFFFFFFFu), true));
+  EXPECT_FALSE(refused(up,
+                       pack(
+                           0, [](wire::Writer&) {}, 0),
+                       true));
+  EXPECT_TRUE(refused(up,
+                      pack(
+                          0x80, [](wire::Writer&) {}, 0),
+                      true));
+  EXPECT_TRUE(refused(up,
+                      pack(
+                          Ipc::wirefmt::kFolder, [](wire::Writer& w) { w.str(PackInfoPartial::STR_INVALID); }, 0),
+                      true));
+  EXPECT_TRUE(refused(up,
+                      pack(
+                          Ipc::wirefmt::kStatus, [](wire::Writer& w) { w.i32(PackInfoPartial::LONG_INVALID); }, 0),
+                      true));
+  EXPECT_TRUE(refused(up,
+                      pack(
+                          Ipc::wirefmt::kCreated, [](wire::Writer& w) { w.i64(PackInfoPartial::TIME_INVALID); }, 0),
+                      true));
+  EXPECT_TRUE(refused(up,
+                      pack(
+                          0, [](wire::Writer&) {}, 0xFFFFFFFFu),
+                      true));
 
   // Lists whose count the message cannot hold are refused before anything
   // is reserved.

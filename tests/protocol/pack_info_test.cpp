@@ -29,9 +29,9 @@ TEST(PackInfo, ValuesOfTheWrongTypeReadAsAbsentAndSurviveUpdates) {
 
 TEST(UseInfos, ReadingDropsEntriesOlderThanTheLimit) {
   UseInfos list;
-  list.append(UseInfo(UseInfo::OpenForEdit, "h", "u", 1, kNow - 25200));      // exactly at the limit
-  list.append(UseInfo(UseInfo::LockForUpload, "h", "u", 2, kNow - 25201));    // one second too old
-  list.append(UseInfo(UseInfo::OpenForEdit, "h", "u", 3, kNow + 60));         // clock skew: kept
+  list.append(UseInfo(UseInfo::OpenForEdit, "h", "u", 1, kNow - 25200));    // exactly at the limit
+  list.append(UseInfo(UseInfo::LockForUpload, "h", "u", 2, kNow - 25201));  // one second too old
+  list.append(UseInfo(UseInfo::OpenForEdit, "h", "u", 3, kNow + 60));       // clock skew: kept
   json::Object obj;
   list.serialize(obj);
 

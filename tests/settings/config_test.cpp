@@ -46,11 +46,17 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
   const ConfigFile file(nullptr);
   file.load();
   const std::string& r = file.root();
-  const std::string expected = std::string("Starting with:\n") +
-                               "\tversion: " + CVDB_VERSION + "\n"
-                               "\tdb root folder: \"" + r + "\"\n"
-                               "\tdb log root folder: \"" + r + "\"\n"
-                               "\tdb backup folder: \"" + r + "db.backup/\"\n"
+  const std::string expected = std::string("Starting with:\n") + "\tversion: " + CVDB_VERSION +
+                               "\n"
+                               "\tdb root folder: \"" +
+                               r +
+                               "\"\n"
+                               "\tdb log root folder: \"" +
+                               r +
+                               "\"\n"
+                               "\tdb backup folder: \"" +
+                               r +
+                               "db.backup/\"\n"
                                "\tTCP listening port: 45678\n"
                                "\tmaximum active dbs: 100\n"
                                "\tmaximum active clients per db: 100\n"
@@ -99,8 +105,9 @@ TEST(Config, WrongTypeStopsReadingInKeyOrderNotFileOrder) {
   EXPECT_EQ(c.ServerPort, 45678);
   EXPECT_EQ(c.MaxActiveDBs, 100u);
   EXPECT_EQ(c.MaxActiveClients, 512u);
-  EXPECT_EQ(log.count(Log::Error, "Configuration initialization error: JSON error: Wrong type: string. "
-                                  "Expected type: integer"),
+  EXPECT_EQ(log.count(Log::Error,
+                      "Configuration initialization error: JSON error: Wrong type: string. "
+                      "Expected type: integer"),
             1u);
 
   log.clear();

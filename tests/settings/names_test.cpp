@@ -47,13 +47,12 @@ TEST(FolderName, NamesBecomeLowerCaseKeysWithDataFoldersEscaped) {
 }
 
 TEST(ValidName, RefusesNamesThatLeaveTheRootOrAliasAnotherKey) {
-  for (const std::string name : {"", "\\", "/", "Sales", "a\\b", "a/b", "sales\\", "x\\d", "..x",
-                                 "a.b", "root.db", "...", "x\\db.temp", "DB.temp2"}) {
+  for (const std::string name : {"", "\\", "/", "Sales", "a\\b", "a/b", "sales\\", "x\\d", "..x", "a.b", "root.db",
+                                 "...", "x\\db.temp", "DB.temp2"}) {
     EXPECT_TRUE(DB::isValidDatabaseName(name)) << name;
   }
-  for (const std::string name :
-       {"..", ".", "a\\..\\b", "a/../b", "./a", "a\\.", "A/..", "\\sales", "/sales", "a\\\\b",
-        "a//b", "sales\\\\", "db.temp\\x", "DB.Backup", ".config/x", "db.backup"}) {
+  for (const std::string name : {"..", ".", "a\\..\\b", "a/../b", "./a", "a\\.", "A/..", "\\sales", "/sales", "a\\\\b",
+                                 "a//b", "sales\\\\", "db.temp\\x", "DB.Backup", ".config/x", "db.backup"}) {
     std::string why;
     EXPECT_FALSE(DB::isValidDatabaseName(name, &why)) << name;
     EXPECT_FALSE(why.empty()) << name;
@@ -79,7 +78,8 @@ TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRootsAndNeverLeaveThem) {
   EXPECT_EQ(paths_.tempFolder("a\\\\b"), "/srv/root/db.temp/a/b/");
   // The server's own folders below the root are no databases.
   for (const char* name : {"db.backup", "db.temp", ".config"}) EXPECT_FALSE(DB::isDBFolderName(name)) << name;
-  for (const char* name : {"DB.backup", "db.backup2", "sales", ".configx"}) EXPECT_TRUE(DB::isDBFolderName(name)) << name;
+  for (const char* name : {"DB.backup", "db.backup2", "sales", ".configx"})
+    EXPECT_TRUE(DB::isDBFolderName(name)) << name;
 }
 
 // For any name a client may use, the database's folder lies below DBRoot,
@@ -114,9 +114,8 @@ TEST_F(Names, ValidNamesStayInsideTheirOwnFolder) {
 
 TEST(BackupFileName, EscapesWithTheHyphenAndReadsBackForAnyKey) {
   const std::vector<std::pair<std::string, std::string>> cases = {
-      {"sales", "sales.cvbak"}, {"a-b", "a--b.cvbak"},      {"a_b", "a-_b.cvbak"},
-      {"a\\b", "a_b.cvbak"},    {"a-\\b", "a--_b.cvbak"},   {"a_\\b", "a-__b.cvbak"},
-      {"x\\d_", "x_d-_.cvbak"}, {"root.db", "root.db.cvbak"},
+      {"sales", "sales.cvbak"}, {"a-b", "a--b.cvbak"},    {"a_b", "a-_b.cvbak"},    {"a\\b", "a_b.cvbak"},
+      {"a-\\b", "a--_b.cvbak"}, {"a_\\b", "a-__b.cvbak"}, {"x\\d_", "x_d-_.cvbak"}, {"root.db", "root.db.cvbak"},
   };
   LogCapture log;
   for (const auto& [key, file] : cases) {

@@ -68,8 +68,8 @@ TEST_F(Backup, TheArchiveHoldsTheDatabaseItsOriginAndItsDataFiles) {
   auto listed = names(archive);
   ASSERT_EQ(listed.size(), 5u);
   std::sort(listed.begin(), listed.begin() + 2);  // the working folder's files in its listing order, first
-  EXPECT_EQ(listed, (std::vector<std::string>{"cvdb.edb", "originDB.txt", "d\\doc\\one", "d\\doc\\two",
-                                               "d\\doc\\three"}));
+  EXPECT_EQ(listed,
+            (std::vector<std::string>{"cvdb.edb", "originDB.txt", "d\\doc\\one", "d\\doc\\two", "d\\doc\\three"}));
   // Read back: the database file is whole and holds the part; the origin
   // names the requester's file and the database.
   maint::ArchiveReader(env_, archive).unpackTo(dir_ / "unpacked");
@@ -82,9 +82,10 @@ TEST_F(Backup, TheArchiveHoldsTheDatabaseItsOriginAndItsDataFiles) {
 
   const auto has = [&](const std::string& t) { return std::find(texts.begin(), texts.end(), t) != texts.end(); };
   EXPECT_EQ(texts.front(), "Starting backup for \"sales\" ...");
-  for (const char* t : {"Metadata backup started...", "Metadata backup finished", "Compressing metadata 50% complete (1/2)",
-                        "Compressing metadata 100% complete (2/2)", "Compressing binaries 33% complete (1/3)",
-                        "Compressing binaries 66% complete (2/3)", "Compressing binaries 100% complete (3/3)"}) {
+  for (const char* t :
+       {"Metadata backup started...", "Metadata backup finished", "Compressing metadata 50% complete (1/2)",
+        "Compressing metadata 100% complete (2/2)", "Compressing binaries 33% complete (1/3)",
+        "Compressing binaries 66% complete (2/3)", "Compressing binaries 100% complete (3/3)"}) {
     EXPECT_TRUE(has(t)) << t;
   }
 }

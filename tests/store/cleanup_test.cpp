@@ -84,8 +84,8 @@ TEST_F(Cleanup, OldUnusedEntriesGoAndEverythingElseStays) {
   const auto reports = run({"used", "ghost"});
   EXPECT_EQ(entries(root() + "c/d"), (std::vector<std::string>{"used", "young"}));
   EXPECT_EQ(readFile(dir_ / "outside"), "never touched");
-  EXPECT_TRUE(log.contains(Log::Notice,
-                           "Database \"c\" cleaned. 3 unused ids deleted, 1 unused ids too recent to clean"));
+  EXPECT_TRUE(
+      log.contains(Log::Notice, "Database \"c\" cleaned. 3 unused ids deleted, 1 unused ids too recent to clean"));
   ASSERT_GE(reports.size(), 2u);
   for (const auto& r : reports) EXPECT_LE(r.percent, 100u) << r.text;
   EXPECT_EQ(reports.back().percent, 100u);

@@ -50,11 +50,13 @@ TEST_F(Lifecycle, ANewDatabaseGetsItsFileAndTablesWhoseLimitsTheEngineEnforces) 
   const auto hex = [](std::size_t bytes) { return "x'" + std::string(2 * bytes, '6') + "'"; };
   EXPECT_EQ(raw.exec("INSERT INTO info VALUES(" + hex(50) + ", x'66', -2147483648, zeroblob(10485760))"), SQLITE_OK);
   for (const std::string& refused :
-       {"INSERT INTO info VALUES(" + hex(51) + ", x'66', 1, NULL)", "INSERT INTO info VALUES(x'01', " + hex(51) + ", 1, NULL)",
+       {"INSERT INTO info VALUES(" + hex(51) + ", x'66', 1, NULL)",
+        "INSERT INTO info VALUES(x'01', " + hex(51) + ", 1, NULL)",
         std::string("INSERT INTO info VALUES(x'02', x'66', 2147483648, NULL)"),
         std::string("INSERT INTO info VALUES(x'03', x'66', 0, zeroblob(10485761))"),
-        std::string("INSERT INTO info VALUES('text', x'66', 0, NULL)"), std::string("INSERT INTO meta VALUES('text', x'00')"),
-        std::string("INSERT INTO meta VALUES(NULL, x'00')"), "INSERT INTO meta VALUES(" + hex(256) + ", x'00')"}) {
+        std::string("INSERT INTO info VALUES('text', x'66', 0, NULL)"),
+        std::string("INSERT INTO meta VALUES('text', x'00')"), std::string("INSERT INTO meta VALUES(NULL, x'00')"),
+        "INSERT INTO meta VALUES(" + hex(256) + ", x'00')"}) {
     EXPECT_EQ(raw.exec(refused), SQLITE_CONSTRAINT) << refused;
   }
   // Lookups and listings search a key and never sort, even once statistics

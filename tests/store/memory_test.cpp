@@ -19,15 +19,16 @@ namespace {
 // millisecond from /proc.
 class PeakRss {
  public:
-  PeakRss() : peak_(current()), thread_([this] {
-    while (!stop_) {
-      std::int64_t now = current();
-      std::int64_t seen = peak_.load();
-      while (now > seen && !peak_.compare_exchange_weak(seen, now)) {
-      }
-      std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    }
-  }) {}
+  PeakRss()
+      : peak_(current()), thread_([this] {
+          while (!stop_) {
+            std::int64_t now = current();
+            std::int64_t seen = peak_.load();
+            while (now > seen && !peak_.compare_exchange_weak(seen, now)) {
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+          }
+        }) {}
   ~PeakRss() { stop(); }
   std::int64_t stop() {
     stop_ = true;

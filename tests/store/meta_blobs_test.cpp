@@ -58,8 +58,23 @@ TEST_F(MetaBlobs, ValuesAreReplacedWholeAcrossTheStreamingLimit) {
 
 TEST_F(MetaBlobs, KeysAreBytesAndPrefixesMatchExactly) {
   auto db = open("m");
-  const Keys stored = {std::string("\0", 1), std::string("\0\0", 2), "%", "%x", "A", "_", "_y", "a", "ab",
-                       "abc", "abd", "a\xff", "a\xff\x01", "a\xff\xff", "b", "\xff", "\xff\xff"};
+  const Keys stored = {std::string("\0", 1),
+                       std::string("\0\0", 2),
+                       "%",
+                       "%x",
+                       "A",
+                       "_",
+                       "_y",
+                       "a",
+                       "ab",
+                       "abc",
+                       "abd",
+                       "a\xff",
+                       "a\xff\x01",
+                       "a\xff\xff",
+                       "b",
+                       "\xff",
+                       "\xff\xff"};
   for (const auto& k : stored) save(*db, k, "v:" + k);
 
   EXPECT_EQ(db->metaBlobsWithPrefix(""), stored);  // byte order: NUL first, 0xFF last, case apart

@@ -20,8 +20,8 @@ using store_testing::complete;
 using store_testing::storedRecord;
 using store_testing::StoreTest;
 using store_testing::useRequest;
-using testing_support::RawDb;
 using testing_support::LogCapture;
+using testing_support::RawDb;
 using testing_support::VerboseLog;
 
 std::string contentOf(DB::DBLocal& db, const std::string& id) {
@@ -91,7 +91,7 @@ TEST_F(PackRecords, KeysTheStoredObjectDoesNotKnowSurviveUpdatesAndUseChanges) {
   db->updateInfo(complete("P1", "f", 1));
   RawDb raw(db->dbFile());
   json::Object stored = storedRecord(raw, "P1");
-  stored.set("reviewer", json::Value::string("bo"));  // written by a later version
+  stored.set("reviewer", json::Value::string("bo"));        // written by a later version
   stored.set("created", json::Value::string("yesterday"));  // of the wrong type
   raw.value("UPDATE info SET blob = ?2 WHERE id = ?1", {"P1", stored.dump()});
 
@@ -149,8 +149,8 @@ TEST_F(PackRecords, ListingsComeInFolderStatusIdOrderAndAFolderIsExact) {
   // folder (bytes above 0x7f sort last), the empty folder, negative
   // statuses.
   const std::vector<std::tuple<std::string, std::string, std::int32_t>> rows = {
-      {"c", "A", 2},  {"a", "AB", 0}, {"b", "A", -5}, {"e", "\xC3\xA4", 1}, {"d", "A", 2},
-      {"f", "", 7},   {"g", "B", 3},  {"h", "A", 1},  {"i", "Ab", 0},
+      {"c", "A", 2}, {"a", "AB", 0}, {"b", "A", -5}, {"e", "\xC3\xA4", 1}, {"d", "A", 2},
+      {"f", "", 7},  {"g", "B", 3},  {"h", "A", 1},  {"i", "Ab", 0},
   };
   for (const auto& [id, folder, status] : rows) db->updateInfo(complete(id, folder, status));
 
@@ -213,8 +213,9 @@ TEST_F(PackRecords, AWriteTheEngineRefusesLeavesRecordAndContentAsTheyWere) {
   // The content is written after the record: a refused content must take
   // the record's new fields back with it.
   RawDb raw(db->dbFile());
-  raw.exec("CREATE TRIGGER no_update BEFORE UPDATE ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END;"
-           "CREATE TRIGGER no_insert BEFORE INSERT ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END");
+  raw.exec(
+      "CREATE TRIGGER no_update BEFORE UPDATE ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END;"
+      "CREATE TRIGGER no_insert BEFORE INSERT ON meta BEGIN SELECT RAISE(ABORT, 'refused'); END");
   EXPECT_THROW(save(*db, changed, "second"), DB::DBExc);
   raw.exec("DROP TRIGGER no_update; DROP TRIGGER no_insert");
   EXPECT_EQ(*db->infoFor("P1"), first);

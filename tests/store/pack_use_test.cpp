@@ -17,8 +17,8 @@ using store_testing::storedRecord;
 using store_testing::storedText;
 using store_testing::StoreTest;
 using store_testing::useRequest;
-using testing_support::RawDb;
 using testing_support::LogCapture;
+using testing_support::RawDb;
 using testing_support::VerboseLog;
 
 constexpr const char* kLocked = "Attept to lock for upload a pack which is already locked from another host.";
@@ -92,8 +92,11 @@ TEST_F(PackUse, UnknownKeysOfTheListAndOfItsEntriesAreKept) {
   const std::string t = std::to_string(kT0);
   ASSERT_EQ(raw.exec("UPDATE info SET blob = CAST('{\"name\":\"name\",\"owner\":\"o\",\"created\":1,\"modified\":2,"
                      "\"docCount\":3,\"uses\":{\"v\":2,\"entries\":[{\"state\":0,\"host\":\"a\",\"user\":\"u\","
-                     "\"process\":1,\"time\":" + t + ",\"seat\":\"x1\"},{\"state\":0,\"host\":\"b\",\"user\":\"u\","
-                     "\"process\":2,\"time\":" + t + ",\"seat\":\"x2\"}]}}' AS BLOB) WHERE id = CAST('P' AS BLOB)"),
+                     "\"process\":1,\"time\":" +
+                     t +
+                     ",\"seat\":\"x1\"},{\"state\":0,\"host\":\"b\",\"user\":\"u\","
+                     "\"process\":2,\"time\":" +
+                     t + ",\"seat\":\"x2\"}]}}' AS BLOB) WHERE id = CAST('P' AS BLOB)"),
             0);
   fetch(UseInfo::OpenForEdit, "c", 3);
   fetch(UseInfo::CloseEdit, "a", 1);
@@ -248,7 +251,8 @@ TEST_F(PackUse, OperationsAndEveryUseTransitionAreLoggedWhenVerbose) {
     seen.push_back(e.text.substr(e.text.find("DB:updateUseInfo")));
   }
   EXPECT_EQ(seen, expected);
-  EXPECT_TRUE(log.contains(Log::Debug, "DB:packMetadata" + session + " Returning pack metadata for P. Pack use updated"));
+  EXPECT_TRUE(
+      log.contains(Log::Debug, "DB:packMetadata" + session + " Returning pack metadata for P. Pack use updated"));
 }
 
 }  // namespace

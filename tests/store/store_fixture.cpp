@@ -36,8 +36,7 @@ std::vector<std::string> entries(const std::filesystem::path& folder) {
   return names;
 }
 
-Ipc::PackInfo complete(const std::string& id, const std::string& folder, std::int32_t status,
-                       const std::string& name) {
+Ipc::PackInfo complete(const std::string& id, const std::string& folder, std::int32_t status, const std::string& name) {
   Ipc::PackInfoPartial p;
   p.name = name;
   p.owner = "anna";

@@ -11,9 +11,9 @@
 #include <string>
 #include <vector>
 
+#include "engine/db_instances.h"
 #include "framework/json.h"
 #include "protocol/pack_info.h"
-#include "engine/db_instances.h"
 #include "store/db_local.h"
 #include "support/fault_env.h"
 #include "support/raw_db.h"

@@ -95,10 +95,12 @@ std::vector<std::string> validRecords() {
   return {
       R"({"name":"P \"1\" \\ \/ \b\f\n\r\t","owner":"\u00e9\u4E2D\ud83d\ude00","created":-9223372036854775808,)"
       R"("modified":9223372036854775807,"docCount":2147483647,"uses":{"entries":[{"state":0,"host":"h","user":"u",)"
-      R"("process":4294967295,"time":)" + now + R"(},{"state":2,"host":"x","time":)" + old + "}]}}",
+      R"("process":4294967295,"time":)" +
+          now + R"(},{"state":2,"host":"x","time":)" + old + "}]}}",
       " {\n\t\"n\\u0061me\" : \"caf\xC3\xA9 \xE2\x82\xAC \xF0\x9F\x98\x80\" ,\r\n\"extra\":[1,-0,1.5e3,true,false,null,"
       "{\"a\":[[]],\"\":{}}],\"docCount\":-2147483648,\"docCount\":3, \"uses\" : {\"other\":1,\"entries\":["
-      "{\"time\":" + now + ",\"host\":\"a\\u0000b\",\"state\":101,\"state\":100,\"user\":\"\",\"process\":0}]}} ",
+      "{\"time\":" +
+          now + ",\"host\":\"a\\u0000b\",\"state\":101,\"state\":100,\"user\":\"\",\"process\":0}]}} ",
       R"({"created":5,"modified":-1,"owner":"","uses":{"entries":[]},"name":"x","unknown":"\u0041","name":"y"})",
   };
 }
@@ -120,34 +122,34 @@ TEST_F(StoredRecordReader, MatchesJanssonOnEveryTruncationAndByte) {
 
 TEST_F(StoredRecordReader, CasesThatTellTheParsersApart) {
   const std::string now = std::to_string(kNow);
-  for (const std::string& text : {
-           // The last duplicate wins, also when it has the wrong type.
-           std::string(R"({"name":"a","name":"b","docCount":1,"docCount":"x"})"),
-           std::string(R"({"uses":{"entries":[{"state":0,"host":"h","time":)" + now + R"(}]},"uses":7})"),
-           std::string(R"({"uses":{"entries":[{"state":0,"host":"h","time":)" + now + R"(,"host":1}]}})"),
-           // Keys spelt with escapes are the same keys.
-           std::string(R"({"n\u0061me":"x","\u006fwner":"y"})"),
-           // NUL is allowed in a string but not in a key.
-           std::string(R"({"name":"a\u0000b"})"), std::string(R"({"na\u0000me":"a"})"),
-           // Surrogates: a pair is one character; a lone one is refused.
-           std::string(R"({"name":"\ud83d\ude00"})"), std::string(R"({"name":"\udc00"})"),
-           std::string(R"({"x":"\ud800\u0041"})"), std::string("{\"name\":\"\xed\xa0\x80\"}"),
-           // Raw control characters in a string; jansson skips a NUL after a number.
-           std::string("{\"name\":\"0123456789abcdef0123456789\x1c\"}"), std::string("{\"docCount\":4\0}", 15),
-           // Integers beyond 64 bits are refused; reals are not integers.
-           std::string(R"({"x":9223372036854775808})"), std::string(R"({"created":-9223372036854775808})"),
-           std::string(R"({"created":5.0,"modified":1e3})"), std::string(R"({"x":1.8e308})"),
-           // The limits of docCount, state and process.
-           std::string(R"({"docCount":-2147483648})"), std::string(R"({"docCount":2147483647})"),
-           std::string(R"({"uses":{"entries":[{"state":2147483648,"host":"h","time":)" + now + "}]}}"),
-           std::string(R"({"uses":{"entries":[{"state":0,"host":"h","process":4294967295,"time":)" + now + "}]}}"),
-           std::string(R"({"uses":{"entries":[{"state":0,"host":"h","process":-1,"time":)" + now + "}]}}"),
-           // Entries at the age limit and one second past it.
-           std::string(R"({"uses":{"entries":[{"state":0,"host":"a","time":)" + std::to_string(kNow - kLimit) +
-                       R"(},{"state":0,"host":"b","time":)" + std::to_string(kNow - kLimit - 1) + "}]}}"),
-           // Not one object.
-           std::string("[]"), std::string("\"x\""), std::string("{} {}"), std::string("{}x"), std::string(""),
-           std::string(" \n{}\t"), std::string("{}\0", 3), std::string("\xEF\xBB\xBF{}")}) {
+  for (const std::string& text :
+       {// The last duplicate wins, also when it has the wrong type.
+        std::string(R"({"name":"a","name":"b","docCount":1,"docCount":"x"})"),
+        std::string(R"({"uses":{"entries":[{"state":0,"host":"h","time":)" + now + R"(}]},"uses":7})"),
+        std::string(R"({"uses":{"entries":[{"state":0,"host":"h","time":)" + now + R"(,"host":1}]}})"),
+        // Keys spelt with escapes are the same keys.
+        std::string(R"({"n\u0061me":"x","\u006fwner":"y"})"),
+        // NUL is allowed in a string but not in a key.
+        std::string(R"({"name":"a\u0000b"})"), std::string(R"({"na\u0000me":"a"})"),
+        // Surrogates: a pair is one character; a lone one is refused.
+        std::string(R"({"name":"\ud83d\ude00"})"), std::string(R"({"name":"\udc00"})"),
+        std::string(R"({"x":"\ud800\u0041"})"), std::string("{\"name\":\"\xed\xa0\x80\"}"),
+        // Raw control characters in a string; jansson skips a NUL after a number.
+        std::string("{\"name\":\"0123456789abcdef0123456789\x1c\"}"), std::string("{\"docCount\":4\0}", 15),
+        // Integers beyond 64 bits are refused; reals are not integers.
+        std::string(R"({"x":9223372036854775808})"), std::string(R"({"created":-9223372036854775808})"),
+        std::string(R"({"created":5.0,"modified":1e3})"), std::string(R"({"x":1.8e308})"),
+        // The limits of docCount, state and process.
+        std::string(R"({"docCount":-2147483648})"), std::string(R"({"docCount":2147483647})"),
+        std::string(R"({"uses":{"entries":[{"state":2147483648,"host":"h","time":)" + now + "}]}}"),
+        std::string(R"({"uses":{"entries":[{"state":0,"host":"h","process":4294967295,"time":)" + now + "}]}}"),
+        std::string(R"({"uses":{"entries":[{"state":0,"host":"h","process":-1,"time":)" + now + "}]}}"),
+        // Entries at the age limit and one second past it.
+        std::string(R"({"uses":{"entries":[{"state":0,"host":"a","time":)" + std::to_string(kNow - kLimit) +
+                    R"(},{"state":0,"host":"b","time":)" + std::to_string(kNow - kLimit - 1) + "}]}}"),
+        // Not one object.
+        std::string("[]"), std::string("\"x\""), std::string("{} {}"), std::string("{}x"), std::string(""),
+        std::string(" \n{}\t"), std::string("{}\0", 3), std::string("\xEF\xBB\xBF{}")}) {
     expectSame(text);
   }
 }
@@ -163,12 +165,13 @@ TEST_F(StoredRecordReader, NestingLimitIsJanssons) {
 }
 
 TEST_F(StoredRecordReader, RealsAtTheEdgeOfTheDoubleRangeMayBeLeftToJansson) {
-  for (const char* real : {"1.7976931348623157e308", "1.7976931348623158e308", "1.7976931348623159e308", "0e400",
-                           "-0.0e999", "1e-99999", "179769313486231570000000000000000000000000000000000000000000000"
-                                                   "0000000000000000000000000000000000000000000000000000000000000000"
-                                                   "0000000000000000000000000000000000000000000000000000000000000000"
-                                                   "0000000000000000000000000000000000000000000000000000000000000000"
-                                                   "0000000000000000000000000000000000000000000000000000.0"}) {
+  for (const char* real :
+       {"1.7976931348623157e308", "1.7976931348623158e308", "1.7976931348623159e308", "0e400", "-0.0e999", "1e-99999",
+        "179769313486231570000000000000000000000000000000000000000000000"
+        "0000000000000000000000000000000000000000000000000000000000000000"
+        "0000000000000000000000000000000000000000000000000000000000000000"
+        "0000000000000000000000000000000000000000000000000000000000000000"
+        "0000000000000000000000000000000000000000000000000000.0"}) {
     expectSame(std::string(R"({"name":"n","x":)") + real + "}", true);
   }
 }

@@ -10,10 +10,24 @@ namespace {
 
 using sys::Path;
 
-constexpr const char* kOpNames[] = {"open",   "create a file in", "read",         "write",       "flush",
-                                    "close",  "flush folder",     "rename",       "link",        "remove",
-                                    "remove", "create folder",    "list",         "look at",     "set the time of",
-                                    "look at the file system of", "access", "any"};
+constexpr const char* kOpNames[] = {"open",
+                                    "create a file in",
+                                    "read",
+                                    "write",
+                                    "flush",
+                                    "close",
+                                    "flush folder",
+                                    "rename",
+                                    "link",
+                                    "remove",
+                                    "remove",
+                                    "create folder",
+                                    "list",
+                                    "look at",
+                                    "set the time of",
+                                    "look at the file system of",
+                                    "access",
+                                    "any"};
 
 Path normal(const Path& p) {
   Path n = p.lexically_normal();

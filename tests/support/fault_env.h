@@ -37,8 +37,24 @@ namespace testing_support {
 class FaultEnv final : public sys::Env {
  public:
   enum class Op {
-    Open, CreateTemp, Read, Write, Sync, Close, SyncFolder, Rename, Link, Remove, RemoveAll,
-    CreateFolders, List, Stat, SetModified, FreeSpace, Access, kCount
+    Open,
+    CreateTemp,
+    Read,
+    Write,
+    Sync,
+    Close,
+    SyncFolder,
+    Rename,
+    Link,
+    Remove,
+    RemoveAll,
+    CreateFolders,
+    List,
+    Stat,
+    SetModified,
+    FreeSpace,
+    Access,
+    kCount
   };
   // Counts every kind (for failNth).
   static constexpr Op kAny = Op::kCount;
@@ -99,8 +115,8 @@ class FaultEnv final : public sys::Env {
  private:
   struct Change {
     enum Kind { Created, Renamed } kind;
-    sys::Path path;  // created, or renamed to
-    sys::Path from;  // renamed from
+    sys::Path path;                     // created, or renamed to
+    sys::Path from;                     // renamed from
     std::optional<sys::Path> replaced;  // a link to the file the rename replaced
   };
   void pending(const sys::Path& folder, Change change) EXCLUDES(mutex_);

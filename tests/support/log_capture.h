@@ -26,9 +26,7 @@ class LogCapture {
   std::vector<Entry> entries() const;
   // Number of entries of that priority whose text contains the fragment.
   std::size_t count(Log::LogPriority priority, const std::string& fragment) const;
-  bool contains(Log::LogPriority priority, const std::string& fragment) const {
-    return count(priority, fragment) > 0;
-  }
+  bool contains(Log::LogPriority priority, const std::string& fragment) const { return count(priority, fragment) > 0; }
   // Number of entries of any priority whose text contains the fragment.
   std::size_t count(const std::string& fragment) const;
   void clear();
