@@ -59,7 +59,7 @@ struct Chunk {
 // Per worker: the two encoders, reused from chunk to chunk.
 class Encoder {
  public:
-  explicit Encoder(int level) : level_(level), whole_(libdeflate_alloc_compressor(level)) {
+  explicit Encoder(int level) : whole_(libdeflate_alloc_compressor(level)) {
     stream_.zalloc = Z_NULL;
     stream_.zfree = Z_NULL;
     stream_.opaque = Z_NULL;
@@ -115,7 +115,6 @@ class Encoder {
     c.errorText = what;
   }
 
-  int level_;
   libdeflate_compressor* whole_;
   z_stream stream_{};
   bool streamReady_ = false;
