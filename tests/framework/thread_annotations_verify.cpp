@@ -64,16 +64,13 @@ class Counter {
     return *shared_;
   }
 
-  // Faults the analysis must report.
-  int readUnlocked() {
-    return value_;
-  }  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
-  void writeUnlocked() {
-    value_ = 1;
-  }  // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
-  void callUnlocked() {
-    addLocked();
-  }  // expected-warning {{calling function 'addLocked' requires holding mutex 'mutex_' exclusively}}
+  // Faults the analysis must report. Each expected warning sits on the line
+  // of its fault, so the formatter must keep these lines as they are.
+  // clang-format off
+  int readUnlocked() { return value_; }  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
+  void writeUnlocked() { value_ = 1; }  // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
+  void callUnlocked() { addLocked(); }  // expected-warning {{calling function 'addLocked' requires holding mutex 'mutex_' exclusively}}
+  // clang-format on
   void callWhileHeld() {
     sys::MutexLock lock(mutex_);
     add();  // expected-warning {{cannot call function 'add' while mutex 'mutex_' is held}}
@@ -98,15 +95,13 @@ class Counter {
     }
     ++value_;  // expected-warning {{writing variable 'value_' requires holding mutex 'mutex_' exclusively}}
   }
-  int pointeeUnlocked() {
-    return *shared_;
-  }  // expected-warning {{reading the value pointed to by 'shared_' requires holding mutex 'mutex_'}}
+  // clang-format off
+  int pointeeUnlocked() { return *shared_; }  // expected-warning {{reading the value pointed to by 'shared_' requires holding mutex 'mutex_'}}
   void predicateUnannotated() {
     sys::MutexLock lock(mutex_);
-    changed_.wait(lock.native(), [this] {
-      return value_ > 0;
-    });  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
+    changed_.wait(lock.native(), [this] { return value_ > 0; });  // expected-warning {{reading variable 'value_' requires holding mutex 'mutex_'}}
   }
+  // clang-format on
 
  private:
   void addLocked() REQUIRES(mutex_) { ++value_; }
