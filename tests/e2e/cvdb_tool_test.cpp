@@ -138,6 +138,32 @@ TEST(CvdbTool, CleanupRemovesOldUnusedDataWithProgress) {
   EXPECT_TRUE(server.waitForLogLine("Async command Cleanup failed with No database associated"));
 }
 
+// Backup end to end: the archive of one database, and of every database,
+// in the backup folder, readable by a standard tool.
+TEST(CvdbTool, BackupWritesArchivesThatStandardToolsRead) {
+  ServerProcess server(kServer);
+  const Tool cvdb = toolOf(server, {"--db", "Plant\\Line 2"});
+  testing_support::TempDir dir;
+  writeFile(dir / "page", "scanned page");
+  ok(cvdb({"cfg", "set", "layout", R"({"a": 1})"}));
+  ok(cvdb({"data", "put", "doc-1", "page", (dir / "page").string()}));
+  ok(toolOf(server, {"--db", "other"})({"cfg", "set", "x", "{}"}));
+
+  const std::string out = ok(cvdb({"backup"}));
+  EXPECT_TRUE(has(out, "Starting Database Backup...")) << out;
+  EXPECT_TRUE(has(out, "Compressing binaries 100% complete (1/1)")) << out;
+  const auto folder = server.home() / "db" / "db.backup";
+  const auto archive = folder / "plant_line 2.cvbak";
+  ASSERT_TRUE(std::filesystem::exists(archive)) << out;
+  const auto test = ServerProcess::run("/usr/bin/unzip", {"-t", archive.string()});
+  EXPECT_EQ(test.status, 0) << test.output;
+  EXPECT_TRUE(has(test.output, "d\\doc-1\\page")) << test.output;
+
+  ok(cvdb({"backup", (dir / "all").string(), "--all"}));
+  EXPECT_TRUE(std::filesystem::exists(dir / "all" / "plant_line 2.cvbak"));
+  EXPECT_TRUE(std::filesystem::exists(dir / "all" / "other.cvbak"));
+}
+
 TEST(CvdbTool, RefusalsLocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
   std::uint16_t port;
   {
