@@ -217,7 +217,7 @@ void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& s
 }  // namespace
 
 void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs::path& destinationFolder,
-                     const StatusCallback& status, const std::source_location& where) {
+                     const StatusCallback& status, const SchemaCheck&, const std::source_location& where) {
   if (instance.state() != Instance::State::Created) DB::throwEngineError(DB::err::kAfterInitialization, where);
   sys::Env& env = *instance.settings().env;
   const auto& fileName = instance.settings().databaseFileName;

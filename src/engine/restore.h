@@ -26,7 +26,11 @@
 // transactions a log may hold.
 
 #include <filesystem>
+#include <functional>
 #include <source_location>
+#include <string>
+
+#include <sqlite3.h>
 
 #include "engine/progress.h"
 
@@ -36,8 +40,10 @@ class Instance;
 
 // Reports Begin, Progress (pages copied, pages in all) and Complete, with
 // operation Restore.
+using SchemaCheck = std::function<std::string(sqlite3* db)>;
 void restoreInstance(Instance& instance, const std::filesystem::path& backupFolder,
                      const std::filesystem::path& destinationFolder, const StatusCallback& status,
+                     const SchemaCheck& schemaCheck = {},
                      const std::source_location& where = std::source_location::current());
 
 }  // namespace engine

@@ -90,8 +90,9 @@ void Listener::process(Backup& cmd) {
 
 void Listener::process(Restore& cmd) {
   runAsync(cmd, "Starting Database Restore...",
-           [](::DB::DBLocal&, std::unique_ptr<::DB::DBProgressCallback>, std::stop_token) {
-             throw std::runtime_error("Restore is not available in this build yet");
+           [target = cmd.pth(), all = cmd.all()](::DB::DBLocal& db, std::unique_ptr<::DB::DBProgressCallback> callback,
+                                                 std::stop_token stop) {
+             db.restore(target, all, std::move(callback), std::move(stop));
            });
 }
 

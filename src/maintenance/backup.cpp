@@ -8,6 +8,7 @@
 #include "engine/instance_for_maintenance.h"
 #include "framework/log.h"
 #include "maintenance/archive_writer.h"
+#include "maintenance/engine_status.h"
 #include "maintenance/temp_folder.h"
 #include "settings/config.h"
 #include "settings/names.h"
@@ -52,30 +53,6 @@ class PackProgress {
   std::uint64_t done_ = 0;
   std::int64_t reported_ = -100;
 };
-
-engine::StatusCallback engineStatus(DB::DBProgressCallback& progress) {
-  return [&progress](const engine::StatusNotification& n) {
-    const std::string word = n.operation == engine::SnapshotOperation::Backup ? "backup" : "restore";
-    switch (n.kind) {
-      case engine::StatusKind::Begin:
-        progress.onProgress(0, "Metadata " + word + " started...");
-        break;
-      case engine::StatusKind::Complete:
-        progress.onProgress(100, "Metadata " + word + " finished");
-        break;
-      case engine::StatusKind::Progress:
-        if (n.done && n.total) {
-          const std::uint32_t percent =
-              *n.done < *n.total ? static_cast<std::uint32_t>(std::uint64_t{*n.done} * 100 / *n.total) : 100;
-          progress.onProgress(percent, "Metadata " + word + ": " + std::to_string(percent) + "% completed (" +
-                                           std::to_string(*n.done) + "/" + std::to_string(*n.total) + ")");
-        } else {
-          progress.onProgress(0, "Metadata " + word + " in progress...");
-        }
-        break;
-    }
-  };
-}
 
 // Whether folder is (or lies inside) a database's folder: a folder that
 // holds the database file, or one below it.

@@ -1,8 +1,13 @@
 #include "service/db_svc.h"
 
+#include <memory>
+#include <vector>
+
 #include "engine/db_instances.h"
+#include "engine/instance_for_maintenance.h"
 #include "framework/log.h"
 #include "ipc/listener.h"
+#include "maintenance/restore_journal.h"
 #include "settings/config.h"
 
 namespace DBServer {
@@ -38,6 +43,13 @@ void DBSvc::runSvc() {
     // Everything below the service gets its settings, paths and Env from
     // here, through the pool; nothing below reads the process-wide record.
     const auto pool = DB::DBInstances::create(DB::PoolSettings::from(config), DB::Paths(config), sys::Env::posix());
+    // Restores that a crash cut short are undone (or finished) before any
+    // database opens; a database whose recovery failed stays held, so no
+    // client opens it half restored, until a later start recovers it.
+    std::vector<std::unique_ptr<DB::InstanceForMaintenance>> unrecovered;
+    for (const std::string& key : maint::recoverRestores(pool->env(), pool->paths())) {
+      unrecovered.push_back(std::make_unique<DB::InstanceForMaintenance>(pool, key, nullptr, true));
+    }
     std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
@@ -57,6 +69,7 @@ void DBSvc::runSvc() {
     // The Listener and its server go with the last command that holds them.
     created.reset();
 
+    unrecovered.clear();
     pool->stop();
     debugLine("Svc stopped");
   } catch (const std::exception& e) {

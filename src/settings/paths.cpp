@@ -17,7 +17,15 @@ std::string Paths::databaseFolder(std::string_view key) const { return root_ + k
 
 std::string Paths::logFolder(std::string_view key) const { return logRoot_ + keyPath(key); }
 
-std::string Paths::tempFolder(std::string_view key) const { return root_ + kTempSubfolder + keyPath(key); }
+std::string Paths::tempFolder(std::string_view key) const {
+  // One flat level: the backup file's stem is unique per key and has no
+  // separator, so no working folder lies inside another database's (a key
+  // path would put "a\\b"'s below "a"'s, where removing "a"'s would take the
+  // files a restore of "a\\b" has set aside).
+  std::string stem = backupFileName(key);
+  stem.resize(stem.size() - std::string_view(kBackupExtension).size());
+  return root_ + kTempSubfolder + stem + "/";
+}
 
 std::string Paths::mainFile(std::string_view key) const { return databaseFolder(key) + dbFileName_; }
 

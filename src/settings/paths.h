@@ -27,10 +27,13 @@ class Paths {
 
   std::string databaseFolder(std::string_view key) const;  // root + key + "/"
   std::string logFolder(std::string_view key) const;       // logRoot + key + "/"
-  std::string tempFolder(std::string_view key) const;      // root + "db.temp/" + key + "/"
-  std::string mainFile(std::string_view key) const;        // databaseFolder + dbFileName
-  std::string dataFolder(std::string_view key) const;      // databaseFolder + "d/"
-  std::string backupFile(std::string_view key) const;      // backupFolder + backupFileName
+  // root + "db.temp/" + the backup file name of the key without its
+  // extension ("team\\sales" -> "team_sales") + "/": one level, so that no
+  // database's working folder holds another's.
+  std::string tempFolder(std::string_view key) const;
+  std::string mainFile(std::string_view key) const;    // databaseFolder + dbFileName
+  std::string dataFolder(std::string_view key) const;  // databaseFolder + "d/"
+  std::string backupFile(std::string_view key) const;  // backupFolder + backupFileName
 
  private:
   std::string root_;

@@ -15,6 +15,7 @@
 #include "framework/log.h"
 #include "maintenance/backup.h"
 #include "maintenance/cleanup.h"
+#include "maintenance/restore.h"
 #include "settings/config.h"
 #include "settings/names.h"
 #include "store/catalog.h"
@@ -232,6 +233,21 @@ void DBLocal::backup(const std::string& target, bool all, std::unique_ptr<DBProg
     if (key != name_ && !other.exists(true)) continue;
     maint::backupOne(pool_, key, folder, dbFile_, *callback, stop);
   }
+}
+
+void DBLocal::restore(const std::string& target, bool all, std::unique_ptr<DBProgressCallback> callback,
+                      std::stop_token stop) {
+  // The restore waits for every session of the database to end: this
+  // connection's own goes first.
+  const bool wasOpen = disconnect();
+  maint::RestoreOptions options;
+  if (all) {
+    maint::restoreFolder(pool_, target, *callback, options, stop);
+  } else {
+    maint::restoreOne(pool_, target, name_, true, *callback, options, stop);
+  }
+  // After a failure the connection stays without a session.
+  if (wasOpen) exists(false);
 }
 
 }  // namespace DB

@@ -181,6 +181,15 @@ class DBLocal {
   // file). The first failure ends it; archives already written stay.
   void backup(const std::string& target, bool all, std::unique_ptr<DBProgressCallback> callback,
               std::stop_token stop = {});
+  // Gives up this store's session, then restores this database from the
+  // archive target names (empty: its default backup file), or with all
+  // every archive of the folder target (empty: the backup folder) into the
+  // database each one names (maint::restoreOne and restoreFolder have the
+  // rules). After success the session is opened again if there was one;
+  // after a failure the store stays closed. The first failure ends a folder
+  // restore; databases restored before stay restored.
+  void restore(const std::string& target, bool all, std::unique_ptr<DBProgressCallback> callback,
+               std::stop_token stop = {});
 
  private:
   // The record of a row of the pack statements (columns id, folder,

@@ -65,7 +65,7 @@ TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRootsAndNeverLeaveThem) {
   const std::string key = DB::folderName("Team\\Sales");
   EXPECT_EQ(paths_.databaseFolder(key), "/srv/root/team/sales/");
   EXPECT_EQ(paths_.logFolder(key), "/srv/logs/team/sales/");
-  EXPECT_EQ(paths_.tempFolder(key), "/srv/root/db.temp/team/sales/");
+  EXPECT_EQ(paths_.tempFolder(key), "/srv/root/db.temp/team_sales/");
   EXPECT_EQ(paths_.mainFile(key), "/srv/root/team/sales/main.edb");
   EXPECT_EQ(paths_.dataFolder(key), "/srv/root/team/sales/d/");
   EXPECT_EQ(paths_.backupFile(key), "/srv/bak/team_sales.cvbak");
@@ -75,7 +75,8 @@ TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRootsAndNeverLeaveThem) {
   // must never turn absolute or gain "//" on the way.
   EXPECT_EQ(paths_.databaseFolder("\\sales"), "/srv/root/sales/");
   EXPECT_EQ(paths_.databaseFolder("sales\\"), "/srv/root/sales/");
-  EXPECT_EQ(paths_.tempFolder("a\\\\b"), "/srv/root/db.temp/a/b/");
+  EXPECT_EQ(paths_.tempFolder("a\\\\b"), "/srv/root/db.temp/a__b/");
+  EXPECT_EQ(paths_.tempFolder("a_b"), "/srv/root/db.temp/a-_b/");
   // The server's own folders below the root are no databases.
   for (const char* name : {"db.backup", "db.temp", ".config"}) EXPECT_FALSE(DB::isDBFolderName(name)) << name;
   for (const char* name : {"DB.backup", "db.backup2", "sales", ".configx"})

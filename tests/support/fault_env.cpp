@@ -278,8 +278,17 @@ void FaultEnv::setModified(const Path& path, sys::WallClock::time_point when) {
   base_.setModified(path, when);
 }
 
+void FaultEnv::setFreeSpace(std::optional<std::uint64_t> bytes) {
+  sys::MutexLock lock(mutex_);
+  freeSpace_ = bytes;
+}
+
 std::uint64_t FaultEnv::freeSpace(const Path& path) {
   check(Op::FreeSpace, path);
+  {
+    sys::MutexLock lock(mutex_);
+    if (freeSpace_) return *freeSpace_;
+  }
   return base_.freeSpace(path);
 }
 

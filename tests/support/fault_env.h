@@ -86,6 +86,8 @@ class FaultEnv final : public sys::Env {
   // From now on every sleepFor calls hook with its duration instead of
   // sleeping (the manual clock, when used, still advances).
   void setSleepHook(std::function<void(std::chrono::milliseconds)> hook);
+  // From now on freeSpace() answers bytes (none: the real file system's).
+  void setFreeSpace(std::optional<std::uint64_t> bytes);
   // From now on hook runs at the start of every call, on the caller's
   // thread and before any failure is injected (to interleave another
   // thread's work with a chosen call).
@@ -144,6 +146,7 @@ class FaultEnv final : public sys::Env {
   std::optional<sys::WallClock::time_point> clock_ GUARDED_BY(mutex_);
   std::function<void(std::chrono::milliseconds)> sleepHook_ GUARDED_BY(mutex_);
   std::function<void(Op, const sys::Path&)> callHook_ GUARDED_BY(mutex_);
+  std::optional<std::uint64_t> freeSpace_ GUARDED_BY(mutex_);
 };
 
 }  // namespace testing_support
