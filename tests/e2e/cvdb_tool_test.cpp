@@ -164,6 +164,61 @@ TEST(CvdbTool, BackupWritesArchivesThatStandardToolsRead) {
   EXPECT_TRUE(std::filesystem::exists(dir / "all" / "other.cvbak"));
 }
 
+// Restore end to end: one database from its default archive, every
+// archive of a folder into the database each names, and a Connect to a
+// database while it is being restored.
+TEST(CvdbTool, RestoreBringsBackWhatTheArchivesHold) {
+  ServerProcess server(kServer);
+  const Tool cvdb = toolOf(server, {"--db", "Plant\\Line 2"});
+  const Tool other = toolOf(server, {"--db", "other"});
+  testing_support::TempDir dir;
+  writeFile(dir / "page", "scanned page");
+  writeFile(dir / "changed", "changed page");
+  ok(cvdb({"cfg", "set", "layout", R"({"a": 1})"}));
+  ok(cvdb({"data", "put", "doc-1", "page", (dir / "page").string()}));
+  ok(other({"cfg", "set", "x", R"({"v": 1})"}));
+  ok(cvdb({"backup"}));
+  ok(cvdb({"backup", (dir / "all").string(), "--all"}));
+
+  ok(cvdb({"cfg", "set", "layout", R"({"a": 2})"}));
+  ok(cvdb({"data", "put", "doc-1", "page", (dir / "changed").string()}));
+  ok(other({"cfg", "set", "x", R"({"v": 2})"}));
+
+  const std::string out = ok(cvdb({"restore"}));
+  EXPECT_TRUE(has(out, "Starting Database Restore...")) << out;
+  EXPECT_TRUE(has(out, "Replacing binaries...")) << out;
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "get", "layout"})), "{\"a\":1}\n");
+  ok(cvdb({"data", "get", "doc-1", "page", "-o", (dir / "back").string()}));
+  EXPECT_EQ(readFile(dir / "back"), "scanned page");
+  EXPECT_EQ(ok(other({"--json", "cfg", "get", "x"})), "{\"v\":2}\n");  // untouched
+
+  ok(cvdb({"cfg", "set", "layout", R"({"a": 3})"}));
+  ok(cvdb({"restore", (dir / "all").string(), "--all"}));
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "get", "layout"})), "{\"a\":1}\n");
+  EXPECT_EQ(ok(other({"--json", "cfg", "get", "x"})), "{\"v\":1}\n");
+  EXPECT_TRUE(server.waitForLogLine("Database restored for \"other\""));
+
+  // A restore long enough to be caught in the act: a Connect to the
+  // database meanwhile ends that connection, and the restore goes on.
+  std::string big(8 << 20, '\0');
+  std::uint32_t x = 1;
+  for (char& c : big) c = static_cast<char>((x = x * 1103515245 + 12345) >> 24);
+  writeFile(dir / "big", big);
+  for (int i = 0; i < 6; ++i) ok(cvdb({"data", "put", "big", "f" + std::to_string(i), (dir / "big").string()}));
+  ok(cvdb({"backup"}));
+  auto restorer = clientOf(server, "Plant\\Line 2");
+  std::string reason;
+  restorer->restore("", false, [&](std::uint32_t, const std::string& text) {
+    if (text == "Starting decompression ..." && reason.empty()) {
+      auto late = clientOf(server);
+      reason = endedBy([&] { late->connect("Plant\\Line 2"); });
+    }
+  });
+  EXPECT_EQ(reason, kTerminating);
+  EXPECT_TRUE(server.waitForLogLine("Database not accessible! Possible restore operation in progress."));
+  EXPECT_EQ(ok(cvdb({"--json", "cfg", "get", "layout"})), "{\"a\":1}\n");
+}
+
 TEST(CvdbTool, RefusalsLocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
   std::uint16_t port;
   {
