@@ -106,6 +106,10 @@ inline Object strToObject(std::string_view text) { return strToObject(text.data(
 // Parses one JSON value of any type.
 Value strToValue(std::string_view text);
 
+// Whether text is well-formed UTF-8 (no overlong forms, no surrogates,
+// nothing above U+10FFFF): what a JSON string may hold.
+bool isUtf8(std::string_view text) noexcept;
+
 // Writes the compact text of the value (nothing for an empty value).
 std::ostream& operator<<(std::ostream& out, const Value& v);
 // Reads the rest of the stream as one JSON object.

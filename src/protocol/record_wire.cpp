@@ -20,6 +20,13 @@ std::string presentString(wire::Reader& in, const char* what) {
   return s;
 }
 
+// Texts that the server keeps inside a JSON record must be UTF-8; anything
+// else is refused as malformed, naming the field, before a command runs.
+std::string utf8(std::string s, const char* what) {
+  if (!json::isUtf8(s)) throw wire::DecodeError(std::string(what) + " is not valid UTF-8");
+  return s;
+}
+
 std::int32_t presentLong(wire::Reader& in, const char* what) {
   const std::int32_t v = in.i32();
   if (v == PackInfoPartial::LONG_INVALID)
@@ -72,8 +79,8 @@ void writeUse(wire::Writer& out, const UseInfo& u) {
 UseInfo readUse(wire::Reader& in) {
   UseInfo u;
   u.state = static_cast<UseInfo::State>(in.i32());
-  u.host = in.str();
-  u.user = in.str();
+  u.host = utf8(in.str(), "use entry host");
+  u.user = utf8(in.str(), "use entry user");
   u.process = in.u32();
   u.time = in.i64();
   return u;
@@ -110,8 +117,8 @@ PackInfo readPackInfo(wire::Reader& in) {
   if (bits & ~kKnownPackFields) throw wire::DecodeError("pack record has unknown field bits " + std::to_string(bits));
   if (bits & kFolder) p.setFolder(presentString(in, "pack folder"));
   if (bits & kStatus) p.setStatus(presentLong(in, "pack status"));
-  if (bits & kName) p.name = presentString(in, "pack name");
-  if (bits & kOwner) p.owner = presentString(in, "pack owner");
+  if (bits & kName) p.name = utf8(presentString(in, "pack name"), "pack name");
+  if (bits & kOwner) p.owner = utf8(presentString(in, "pack owner"), "pack owner");
   if (bits & kCreated) p.created = presentTime(in, "pack creation time");
   if (bits & kModified) p.modified = presentTime(in, "pack modification time");
   if (bits & kDocCount) p.docCount = presentLong(in, "pack document count");

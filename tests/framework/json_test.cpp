@@ -42,4 +42,17 @@ TEST(Json, ParsesExactlyTheGivenBytesAndKeepsEmbeddedNul) {
   EXPECT_THROW(json::Value::string("\xff"), json::Exc);
 }
 
+// Exactly the well-formed UTF-8 that a JSON string may hold.
+TEST(Json, Utf8CheckRefusesEveryIllFormedSequence) {
+  for (const char* good : {"", "plain", "caf\xC3\xA9", "\xE2\x82\xAC", "\xED\x9F\xBF", "\xEE\x80\x80",
+                           "\xF0\x90\x80\x80", "\xF4\x8F\xBF\xBF"}) {
+    EXPECT_TRUE(json::isUtf8(good)) << good;
+  }
+  for (const char* bad : {"\x80", "\xC0\x80", "\xC1\xBF", "\xE0\x9F\xBF", "\xED\xA0\x80", "\xF4\x90\x80\x80",
+                          "\xF5\x80\x80\x80", "\xFF", "\xC3", "\xE2\x82", "\xC3\x28", "ok\xF0\x9F\x93"}) {
+    EXPECT_FALSE(json::isUtf8(bad)) << bad;
+  }
+  EXPECT_TRUE(json::isUtf8(std::string_view("a\0b", 3)));
+}
+
 }  // namespace

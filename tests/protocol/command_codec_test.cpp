@@ -346,6 +346,29 @@ TEST(CommandCodec, MalformedFieldsAreRefused) {
                       pack(
                           0, [](wire::Writer&) {}, 0xFFFFFFFFu),
                       true));
+  // Texts kept inside the stored JSON record must be UTF-8; the refusal
+  // names the field.
+  try {
+    const std::string latin1 = pack(Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xE9"); }, 0);
+    wire::Reader in(latin1);
+    up.readRequest(in);
+    ADD_FAILURE() << "a name in Latin-1 was accepted";
+  } catch (const wire::DecodeError& e) {
+    EXPECT_STREQ(e.what(), "pack name is not valid UTF-8");
+  }
+  EXPECT_FALSE(refused(up, pack(Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xC3\xA9 \xF0\x9F\x93\xA6"); }, 0),
+                       true));
+  EXPECT_TRUE(refused(up, bytesOf([](wire::Writer& w) {
+                        w.str("id");
+                        w.u8(0);
+                        w.u32(1);
+                        w.i32(1);
+                        w.str("host\xFF");
+                        w.str("user");
+                        w.u32(1);
+                        w.i64(0);
+                      }),
+                      true));
 
   // Lists whose count the message cannot hold are refused before anything
   // is reserved.
