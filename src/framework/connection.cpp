@@ -134,7 +134,19 @@ void Connection::endCommand() {
   if (!busy_) return;
   busy_ = false;
   inFlight_ = nullptr;
+  if (closing_ || finished_) releaseSlot();
   goOn();
+}
+
+void Connection::releaseSlot() {
+  if (busy_ || !connInf()) return;
+  // As in the destructor: the release may wait for the engine's lock.
+  if (core_->threads.runningInThisThread()) {
+    const IoPool::Busy busy(core_->threads);
+    connInf().reset();
+  } else {
+    connInf().reset();
+  }
 }
 
 // Takes the next request if the connection may, reading more when needed.
@@ -175,6 +187,8 @@ void Connection::beginClose(const std::string& reason) {
   closeTimer_.async_wait([self = shared_from_this()](const boost::system::error_code& ec) {
     if (!ec) self->finish();
   });
+  // Before the Bye: a client that has read it finds the session gone.
+  releaseSlot();
   wire::OutFrame bye = textFrame(0, wire::FrameKind::Bye, reason);
   outBytes_ += bye.size();
   out_.push_back(std::move(bye));

@@ -128,6 +128,12 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   std::size_t gather();
   void consumeWritten(std::uint64_t n);
   void byeWritten();
+  // Once the connection is ending and no command runs (before its Bye is
+  // queued, or when the last command ends after it), gives up what its slot
+  // holds (a database session) rather than when the last reference to the
+  // connection goes: a client that reconnects right after a Bye finds its
+  // place free.
+  void releaseSlot();
   void onWrite(const boost::system::error_code& ec, std::size_t n);
 
   void beginClose(const std::string& reason);

@@ -4,7 +4,12 @@
 // frames, vanishing clients, commands before Connect).
 
 #include <gtest/gtest.h>
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <signal.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
@@ -93,6 +98,44 @@ TEST(ServerRequests, ARefusalKeepsTheConnectionAndAMalformedRequestEndsOnlyItsOw
   EXPECT_TRUE(endedBy([&] { malformed->awaitEnd(); }).starts_with("Malformed request GetData"));
   EXPECT_TRUE(server.waitForLogLine("Ipc Malformed request GetData from 127.0.0.1:"));
   bystander->ping();
+}
+
+// The session of a connection that the server ends is given back when the
+// Bye goes out, not when the client gets round to closing its socket: at
+// the limit of one client per database, a second client connects at once.
+TEST(ServerRequests, AnEndedConnectionsSessionIsFreeAtOnce) {
+  testing_support::ServerOptions options;
+  options.configJson = R"({"ServerPort": 0, "MaxActiveClientsPerDB": 1})";
+  ServerProcess server(kServer, options);
+  for (int round = 0; round < 3; ++round) {
+    // A client that binds the database, sends a malformed request and,
+    // having read the answers and the Bye, keeps its socket open.
+    const int fd = ::socket(AF_INET, SOCK_STREAM, 0);
+    ASSERT_GE(fd, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_port = htons(server.port());
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ASSERT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    // A database of its own per round: the last round's second client may
+    // still be leaving.
+    const std::string db = "limited" + std::to_string(round);
+    const std::string connect =
+        lengthPrefix(2 + 4 + 8 + 4) + std::string("\x03\x00", 2) + lengthPrefix(8) + db + lengthPrefix(0);
+    const std::string malformed = lengthPrefix(2 + 4 + 3) + std::string("\x07\x00", 2) + lengthPrefix(1000) + "abc";
+    const std::string out = connect + malformed;
+    ASSERT_EQ(::send(fd, out.data(), out.size(), MSG_NOSIGNAL), static_cast<ssize_t>(out.size()));
+    std::string in;
+    char buffer[512];
+    while (in.find("Malformed request GetData") == std::string::npos) {
+      const ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+      ASSERT_GT(n, 0) << "the server closed before its Bye: " << in;
+      in.append(buffer, static_cast<std::size_t>(n));
+    }
+    auto second = clientOf(server);
+    EXPECT_TRUE(second->connect(db)) << "round " << round;
+    ::close(fd);
+  }
 }
 
 // Uploads in progress when the server stops: the bytes that still arrive

@@ -349,14 +349,17 @@ TEST(CommandCodec, MalformedFieldsAreRefused) {
   // Texts kept inside the stored JSON record must be UTF-8; the refusal
   // names the field.
   try {
-    const std::string latin1 = pack(Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xE9"); }, 0);
+    const std::string latin1 = pack(
+        Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xE9"); }, 0);
     wire::Reader in(latin1);
     up.readRequest(in);
     ADD_FAILURE() << "a name in Latin-1 was accepted";
   } catch (const wire::DecodeError& e) {
     EXPECT_STREQ(e.what(), "pack name is not valid UTF-8");
   }
-  EXPECT_FALSE(refused(up, pack(Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xC3\xA9 \xF0\x9F\x93\xA6"); }, 0),
+  EXPECT_FALSE(refused(up,
+                       pack(
+                           Ipc::wirefmt::kName, [](wire::Writer& w) { w.str("caf\xC3\xA9 \xF0\x9F\x93\xA6"); }, 0),
                        true));
   EXPECT_TRUE(refused(up, bytesOf([](wire::Writer& w) {
                         w.str("id");
