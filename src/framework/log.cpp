@@ -93,14 +93,67 @@ std::shared_ptr<spdlog::logger> currentLogger() {
   return s.logger;
 }
 
+// Length of the well-formed UTF-8 sequence of two or more bytes at p (0
+// when there is none).
+std::size_t utf8Length(const unsigned char* p, const unsigned char* end) {
+  const unsigned c = *p;
+  std::size_t n = 0;
+  unsigned lo = 0x80, hi = 0xBF;
+  if (c >= 0xC2 && c <= 0xDF) {
+    n = 2;
+  } else if (c >= 0xE0 && c <= 0xEF) {
+    n = 3;
+    if (c == 0xE0) lo = 0xA0;
+    if (c == 0xED) hi = 0x9F;
+  } else if (c >= 0xF0 && c <= 0xF4) {
+    n = 4;
+    if (c == 0xF0) lo = 0x90;
+    if (c == 0xF4) hi = 0x8F;
+  } else {
+    return 0;
+  }
+  if (static_cast<std::size_t>(end - p) < n || p[1] < lo || p[1] > hi) return 0;
+  for (std::size_t i = 2; i < n; ++i) {
+    if (p[i] < 0x80 || p[i] > 0xBF) return 0;
+  }
+  return n;
+}
+
 }  // namespace
+
+std::string printable(std::string_view text) {
+  std::string out;
+  out.reserve(text.size());
+  const auto* p = reinterpret_cast<const unsigned char*>(text.data());
+  const auto* end = p + text.size();
+  static constexpr char kHex[] = "0123456789abcdef";
+  while (p < end) {
+    const unsigned c = *p;
+    const bool continuation = c == '\n' && (p + 1 == end || p[1] == '\t');
+    if ((c >= 0x20 && c < 0x7F) || c == '\t' || continuation) {
+      out.push_back(static_cast<char>(c));
+      ++p;
+      continue;
+    }
+    if (const std::size_t n = c >= 0x80 ? utf8Length(p, end) : 0) {
+      out.append(reinterpret_cast<const char*>(p), n);
+      p += n;
+      continue;
+    }
+    out += "\\x";
+    out.push_back(kHex[c >> 4]);
+    out.push_back(kHex[c & 15]);
+    ++p;
+  }
+  return out;
+}
 
 Lock::Lock(LogPriority priority) : priority_(priority) {}
 
 Lock::~Lock() {
   if (priority_ == Debug && !g_LogVerbose) return;
   try {
-    std::string text = std::move(text_).str();
+    const std::string text = printable(std::move(text_).str());
     auto logger = currentLogger();
     logger->log(levelOf(priority_), "[{}] {}", priorityName(priority_), text);
     State& s = state();

@@ -9,6 +9,10 @@
 // error when console output is on. Each entry carries its time, priority,
 // thread and text.
 //
+// Entries often quote what clients sent (database names, keys, paths), so
+// every entry passes through printable() on its way out: no client text can
+// end an entry and forge the next one, or put control bytes into the file.
+//
 // Thread safety: every function here may be called from any thread. One
 // entry object belongs to the thread that made it.
 // Failures: logging never throws out of an entry's destructor; an entry that
@@ -20,6 +24,7 @@
 #include <functional>
 #include <sstream>
 #include <string>
+#include <string_view>
 
 // Enables entries of priority Log::Debug. Test it before building a debug
 // entry so that the text is not formatted for nothing.
@@ -46,6 +51,13 @@ class Lock {
   LogPriority priority_;
   std::ostringstream text_;
 };
+
+// The text as the log writes it: printable ASCII, tabs and well-formed
+// UTF-8 stay; a line break stays only before a tab (the indented
+// continuation lines of the server's own multi-line entries) or at the
+// very end; every other
+// byte becomes "\\xNN" (lower-case hex).
+std::string printable(std::string_view text);
 
 // Mirrors every entry to standard error as well (the server's --console).
 void setConsole(bool on);

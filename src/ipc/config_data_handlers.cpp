@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "engine/db_instances.h"
+#include "framework/log.h"
 #include "ipc/listener.h"
 #include "settings/names.h"
 #include "store/catalog.h"
@@ -21,7 +22,9 @@ void Listener::process(Connect& cmd) {
   // A name that would leave the database root, or give an existing
   // database a second key, is refused before anything is opened or made;
   // the connection keeps whatever binding it had.
-  if (!::DB::isValidDatabaseName(dbName)) {
+  std::string why;
+  if (!pool_->paths().acceptsName(dbName, &why)) {
+    Log::Lock(Log::Notice).logStreamLine() << "Connect refused the database name \"" << dbName << "\": " << why;
     cmd.setResp("Database name " + dbName + " is not valid");
     return;
   }

@@ -65,8 +65,8 @@ void checkSpace(sys::Env& env, const DB::Paths& paths, const ArchiveReader& read
 
 // The database the archive records, when it is another than key and the
 // restore follows it; refuses a recorded name no client could use.
-std::optional<std::string> recordedKey(const std::string& recorded, const std::string& key, bool keepName,
-                                       const std::string& archive) {
+std::optional<std::string> recordedKey(const DB::Paths& paths, const std::string& recorded, const std::string& key,
+                                       bool keepName, const std::string& archive) {
   if (recorded.empty() || recorded == key) return std::nullopt;
   if (keepName) {
     Log::Lock(Log::Notice).logStreamLine() << "Restore found different DB name in backup file (" << recorded
@@ -74,7 +74,7 @@ std::optional<std::string> recordedKey(const std::string& recorded, const std::s
     return std::nullopt;
   }
   std::string why;
-  if (!DB::isValidDatabaseName(recorded, &why)) {
+  if (!paths.acceptsName(recorded, &why)) {
     throw std::runtime_error("The backup file \"" + archive + "\" records an invalid database name (" + why + ")");
   }
   const std::string recordedAsKey = DB::folderName(recorded);
@@ -227,7 +227,7 @@ std::string restoreOne(const std::shared_ptr<DB::DBInstances>& pool, const std::
   }
 
   std::optional<DB::InstanceForMaintenance> second;
-  if (const auto other = recordedKey(readOriginName(env, at.unpacked), key, keepName, archive)) {
+  if (const auto other = recordedKey(paths, readOriginName(env, at.unpacked), key, keepName, archive)) {
     key = *other;
     at = restoreLayout(paths, work, key);
     second.emplace(pool, key, &progress, true, stop);
@@ -268,7 +268,7 @@ std::vector<std::string> restoreFolder(const std::shared_ptr<DB::DBInstances>& p
   for (const sys::DirEntry& e : env.list(from)) {
     const sys::Path file = sys::Path(from) / e.name;
     const std::string name = DB::nameFromBackupFile(e.name);
-    if (e.type != sys::FileType::Regular || name.empty() || !DB::isValidDatabaseName(name)) {
+    if (e.type != sys::FileType::Regular || name.empty() || !paths.acceptsName(name)) {
       Log::Lock(Log::Notice).logStreamLine()
           << "Can not restore " << quoted(file.string()) << " since it does not look like a backup file. Skipped";
       continue;

@@ -32,7 +32,7 @@ bool isContent(const sys::DirEntry& e, const std::string& keptSubfolder) {
 
 // Undoes or finishes the restore whose working folder is work.
 void recoverOne(sys::Env& env, const DB::Paths& paths, const sys::Path& work) {
-  const JournalRecord record = readRestoreJournal(env, work);
+  const JournalRecord record = readRestoreJournal(env, paths, work);
   const RestoreLayout at = restoreLayout(paths, work, record.key);
   RestoreJournal journal(env, work, record.key, record.state);
   if (record.state != RestoreState::Committed) {
@@ -77,7 +77,7 @@ void RestoreJournal::write(RestoreState state) {
   written_ = true;
 }
 
-JournalRecord readRestoreJournal(sys::Env& env, const sys::Path& work) {
+JournalRecord readRestoreJournal(sys::Env& env, const DB::Paths& paths, const sys::Path& work) {
   const sys::Path file = work / kRestoreJournalName;
   std::istringstream in(env.readFile(file));
   std::string magic, key, state;
@@ -93,7 +93,7 @@ JournalRecord readRestoreJournal(sys::Env& env, const sys::Path& work) {
   // The key decides which folders recovery changes: it must be one a
   // client could use (nothing outside the database root).
   std::string why;
-  if (!DB::isValidDatabaseName(record.key, &why) || DB::folderName(record.key) != record.key) {
+  if (!paths.acceptsName(record.key, &why) || DB::folderName(record.key) != record.key) {
     throw bad("names no valid database (\"" + record.key + "\": " + why + ")");
   }
   const std::string s = state.substr(6);
@@ -163,7 +163,7 @@ std::vector<std::string> recoverRestores(sys::Env& env, const DB::Paths& paths) 
     } catch (const std::exception& ex) {
       std::string key;
       try {
-        key = readRestoreJournal(env, work).key;
+        key = readRestoreJournal(env, paths, work).key;
       } catch (const std::exception&) {
         // Unreadable: nobody can tell which database it concerns.
       }

@@ -83,7 +83,7 @@ struct JournalRecord {
 };
 // The journal of a working folder. Throws std::runtime_error when it is
 // not one this server wrote.
-JournalRecord readRestoreJournal(sys::Env& env, const sys::Path& work);
+JournalRecord readRestoreJournal(sys::Env& env, const DB::Paths& paths, const sys::Path& work);
 
 // Undoes a restore that has not committed, as far as the journal says it
 // came: in state placing the new content of the folders is removed and the

@@ -31,6 +31,23 @@ std::string Paths::mainFile(std::string_view key) const { return databaseFolder(
 
 std::string Paths::dataFolder(std::string_view key) const { return databaseFolder(key) + kDataSubfolder; }
 
+bool Paths::acceptsName(std::string_view name, std::string* why) const {
+  if (!isValidDatabaseName(name, why)) return false;
+  const std::string key = folderName(name);
+  std::size_t start = key.find('\\');
+  while (start != std::string::npos) {
+    const std::size_t end = key.find('\\', start + 1);
+    const std::string_view part =
+        std::string_view(key).substr(start + 1, end == std::string::npos ? end : end - start - 1);
+    if (!dbFileName_.empty() && part.starts_with(dbFileName_)) {
+      if (why) *why = "a component of the name is the name of a database's own file";
+      return false;
+    }
+    start = end;
+  }
+  return true;
+}
+
 std::string Paths::backupFile(std::string_view key) const { return backupFolder_ + backupFileName(key); }
 
 }  // namespace DB

@@ -35,6 +35,14 @@ class Paths {
   std::string dataFolder(std::string_view key) const;  // databaseFolder + "d/"
   std::string backupFile(std::string_view key) const;  // backupFolder + backupFileName
 
+  // Whether a client may use the name here: isValidDatabaseName (names.h),
+  // and no component below the first begins with the database file name.
+  // Such a component would be a folder where another database keeps, or
+  // will keep, its file or one of its companions ("a\\cvdb.edb-wal" is
+  // the folder root/a/cvdb.edb-wal, the place of a's log), and that
+  // database could never open again. why, when given, receives the reason.
+  bool acceptsName(std::string_view name, std::string* why = nullptr) const;
+
  private:
   std::string root_;
   std::string logRoot_;

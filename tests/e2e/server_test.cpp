@@ -89,7 +89,7 @@ TEST(ServerRequests, ARefusalKeepsTheConnectionAndAMalformedRequestEndsOnlyItsOw
   // An unknown tag is refused and logged; the connection goes on.
   auto refused = clientOf(server);
   EXPECT_THROW(refused->request(20, ""), cvdb::Refused);
-  EXPECT_TRUE(server.waitForLogLine(std::string("Ipc attempt to generate command with unknown tag: ") + '\x14'));
+  EXPECT_TRUE(server.waitForLogLine("Ipc attempt to generate command with unknown tag: \\x14"));
   refused->ping();
 
   // GetData (tag 7) with a string length that runs past its frame.

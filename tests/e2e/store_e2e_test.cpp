@@ -59,11 +59,30 @@ TEST(StoreEndToEnd, DatabaseNamesThatWouldLeaveTheRootAreRefusedAndMakeNothing) 
     EXPECT_EQ(r.error, "Database name " + name + " is not valid");
   }
   c->ping();  // a refusal is an answer, not the end of the connection
+  EXPECT_TRUE(server.waitForLogLine("Connect refused the database name \"a\\..\\..\\escape\""));
+
+  // A name whose component is the place of another database's file or
+  // companion would make a folder there: refused, and the other database
+  // (open, then closed) opens as before.
+  auto owner = clientOf(server, "victim");
+  owner->setCfg("k", json::strToObject(R"({"v": 1})"));
+  auto other = clientOf(server);
+  for (const std::string& name :
+       {std::string("victim\\cvdb.edb"), std::string("victim\\cvdb.edb-wal"), std::string("victim\\CVDB.EDB-shm"),
+        std::string("v\\cvdb.edb.creating"), std::string("victim\\cvdb.edb.restoring\\deeper")}) {
+    EXPECT_EQ(other->connect(name, 0).error, "Database name " + name + " is not valid") << name;
+  }
+  EXPECT_TRUE(other->connect("victim\\cvdb"));  // a prefix of the file name is no file of it
+  owner.reset();
+  other = clientOf(server, "victim");
+  EXPECT_EQ(other->getCfg("k").dump(), R"({"v":1})");
+  EXPECT_FALSE(fs::exists(dbRoot(server) / "victim" / "cvdb.edb-wal" / "cvdb.edb"));
+
   // A name the file system refuses (a component too long) fails the
   // creation, which takes back every folder it made.
   EXPECT_EQ(endedBy([&] { c->connect("abc\\" + std::string(300, 'x')); }), kTerminating);
   EXPECT_EQ(std::distance(fs::directory_iterator(server.home()), fs::directory_iterator()), 1);   // db/
-  EXPECT_EQ(std::distance(fs::directory_iterator(dbRoot(server)), fs::directory_iterator()), 1);  // config.json
+  EXPECT_EQ(std::distance(fs::directory_iterator(dbRoot(server)), fs::directory_iterator()), 2);  // config.json, victim
 }
 
 TEST(StoreEndToEnd, ConfigurationPartsAndAStoredValueThatIsNoObject) {

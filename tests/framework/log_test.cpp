@@ -33,4 +33,13 @@ TEST(Log, EntriesCarryTimeThreadPriorityAndTextAndTheFileRotatesAtTheRecycleSize
   EXPECT_TRUE(std::filesystem::exists(dir.path() / "cvdbserver.1.log"));
 }
 
+// Client texts inside an entry cannot end it or put control bytes into
+// the file; the server's own indented continuation lines and UTF-8 stay.
+TEST(Log, EntriesArePrintableWhateverTheyQuote) {
+  EXPECT_EQ(Log::printable("db \"x\n2026-12-06 [ERROR] forged\""), "db \"x\\x0a2026-12-06 [ERROR] forged\"");
+  EXPECT_EQ(Log::printable(std::string("tag: \0\x7f\x1b[31m", 12)), "tag: \\x00\\x7f\\x1b[31m");
+  EXPECT_EQ(Log::printable("caf\xC3\xA9 \xE9 \xED\xA0\x80"), "caf\xC3\xA9 \\xe9 \\xed\\xa0\\x80");
+  EXPECT_EQ(Log::printable("Engine initialized\n\tline\ttab\r\nx\n"), "Engine initialized\n\tline\ttab\\x0d\\x0ax\n");
+}
+
 }  // namespace

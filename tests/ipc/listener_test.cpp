@@ -53,7 +53,9 @@ TEST_F(ListenerTest, KnownTagsBuildCommandsThatShareTheListenerAndUnknownOnesAre
   for (const int tag : {0, 2, 20, 65, 255}) {
     log.clear();
     EXPECT_EQ(listener->makeCmd(static_cast<std::uint8_t>(tag)), nullptr) << tag;
-    const std::string line = std::string("Ipc attempt to generate command with unknown tag: ") + static_cast<char>(tag);
+    // The tag byte as it was sent, made printable by the log.
+    const std::string line =
+        Log::printable(std::string("Ipc attempt to generate command with unknown tag: ") + static_cast<char>(tag));
     const auto entries = log.entries();
     ASSERT_EQ(entries.size(), 1u) << tag;
     EXPECT_EQ(entries[0].priority, Log::Error);

@@ -86,6 +86,20 @@ TEST_F(Names, PathsOfAKeyUseSlashesBelowTheirRootsAndNeverLeaveThem) {
 // For any name a client may use, the database's folder lies below DBRoot,
 // is no other database's data folder, and the database found there on disk
 // has the same key again.
+// No name may put a folder where a database keeps, or will keep, its file
+// or a companion of it.
+TEST_F(Names, NamesThatWouldTakeTheFilesOfADatabaseAreRefused) {
+  std::string why;
+  for (const char* name :
+       {"a\\main.edb", "a\\main.edb-wal", "a\\MAIN.EDB-shm", "a\\b\\main.edb.creating", "a/main.edb-journal/x"}) {
+    EXPECT_FALSE(paths_.acceptsName(name, &why)) << name;
+  }
+  EXPECT_EQ(why, "a component of the name is the name of a database's own file");
+  for (const char* name : {"main.edb", "a\\main", "a\\xmain.edb", "a\\b"})
+    EXPECT_TRUE(paths_.acceptsName(name)) << name;
+  EXPECT_FALSE(paths_.acceptsName("a\\..\\b"));  // the general rules first
+}
+
 TEST_F(Names, ValidNamesStayInsideTheirOwnFolder) {
   std::mt19937 random(20240611);
   const std::string alphabet = "aD./\\\\d..-_x";
