@@ -109,18 +109,25 @@ bool isOurs(const FileHeader& header) { return header.applicationId == kApplicat
 
 // The database file of the backup: the one under the configured name, or
 // else the only file that carries our identity (a backup taken while the
-// server used another file name).
-std::optional<fs::path> findDatabase(sys::Env& env, const fs::path& folder, const std::string& fileName) {
-  if (env.stat(folder / fileName).type == sys::FileType::Regular) return folder / fileName;
+// server used another file name). Only a regular file is taken: a link
+// could lead anywhere on the machine, and a link or folder under the
+// configured name is refused rather than passed over for another file.
+fs::path findDatabase(sys::Env& env, const fs::path& folder, const std::string& fileName,
+                      const std::source_location& where) {
+  const auto named = onFiles(where, [&] { return env.stat(folder / fileName).type; });
+  if (named == sys::FileType::Regular) return folder / fileName;
+  if (named != sys::FileType::Missing) refuse(folder, "\"" + fileName + "\" is not a regular file", where);
+  const auto entries = onFiles(where, [&] { return env.list(folder); });
   std::optional<fs::path> found;
-  for (const auto& entry : env.list(folder)) {
+  for (const auto& entry : entries) {
     if (entry.type != sys::FileType::Regular) continue;
     const auto header = readHeader(env, folder / entry.name);
     if (!header || !isOurs(*header)) continue;
-    if (found) return std::nullopt;  // two candidates: none is the one
+    if (found) refuse(folder, "two files of this server in it and none named \"" + fileName + "\"", where);
     found = folder / entry.name;
   }
-  return found;
+  if (!found) refuse(folder, "no database file \"" + fileName + "\" of this server in it", where);
+  return *found;
 }
 
 // The header's facts that the copy relies on: a SQLite page size (a power
@@ -221,9 +228,8 @@ void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs:
   if (instance.state() != Instance::State::Created) DB::throwEngineError(DB::err::kAfterInitialization, where);
   sys::Env& env = *instance.settings().env;
   const auto& fileName = instance.settings().databaseFileName;
-  const auto source = onFiles(where, [&] { return findDatabase(env, backupFolder, fileName); });
-  if (!source) refuse(backupFolder, "no database file \"" + fileName + "\" of this server in it", where);
-  const FileHeader header = checkHeader(env, backupFolder, *source, where);
+  const fs::path source = findDatabase(env, backupFolder, fileName, where);
+  const FileHeader header = checkHeader(env, backupFolder, source, where);
 
   onFiles(where, [&] { env.createFolders(destinationFolder); });
   const fs::path target = destinationFolder / fileName;
@@ -232,7 +238,7 @@ void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs:
   StagedFile staged(env, stagedName);
 
   if (status) status({SnapshotOperation::Restore, StatusKind::Begin, std::nullopt, std::nullopt});
-  copyFile(env, *source, staged.path(), header.pageSize, status, where);
+  copyFile(env, source, staged.path(), header.pageSize, status, where);
   checkContent(env, backupFolder, staged.path(), instance, where);
 
   // Nobody has the destination open (the instance is not initialised).

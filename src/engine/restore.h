@@ -3,11 +3,12 @@
 //
 // restoreInstance finds the database file in the backup folder (the
 // instance's database file name, or else the one file there that carries
-// this server's identity), checks it (ours, not of a newer format, not
-// truncated, and passing SQLite's quick integrity check on a copy), and
-// places that copy as the destination folder's database file, durably. A
-// stale write-ahead log and index of the destination are removed first:
-// replayed onto the restored file they would corrupt it.
+// this server's identity; a regular file, never a link), checks it (ours,
+// not of a newer format, not truncated, and passing SQLite's quick
+// integrity check on a copy), and places that copy as the destination
+// folder's database file, durably. A stale write-ahead log and index of the
+// destination are removed first: replayed onto the restored file they would
+// corrupt it.
 //
 // The instance must be uninitialised (an exclusive maintenance hold), so no
 // connection to the destination is open while the file is replaced.

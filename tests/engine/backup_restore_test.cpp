@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <atomic>
 #include <filesystem>
+#include <map>
 #include <thread>
 #include <vector>
 
@@ -43,6 +44,14 @@ class BackupRestore : public EngineTest {
   std::vector<StatusNotification> notes_;
   engine::StatusCallback record_ = [this](const StatusNotification& n) { notes_.push_back(n); };
 };
+
+// Every file of a folder with its bytes: a refused restore leaves the
+// destination's exactly as they were, and no file of its own.
+std::map<std::string, std::string> filesOf(const fs::path& folder) {
+  std::map<std::string, std::string> files;
+  for (const auto& e : fs::directory_iterator(folder)) files[e.path().filename().string()] = readFile(e.path());
+  return files;
+}
 
 void expectWellFormedReports(const std::vector<StatusNotification>& notes, engine::SnapshotOperation operation) {
   ASSERT_GE(notes.size(), 3u);
@@ -169,8 +178,8 @@ TEST_F(BackupRestore, RestorePlacesTheBackupUnderAnyNameAndDropsAStaleLog) {
   EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
 }
 
-// Backups that are not ours, are newer, or are damaged are refused with
-// -514, and the destination keeps exactly its files.
+// Backups that are not ours, are newer, are damaged, or are not regular
+// files are refused with -514, and the destination keeps exactly its files.
 TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
   const fs::path good = dir_.path() / "good";
   const std::string dest = root() + "dest/";
@@ -185,8 +194,8 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
     for (const std::string& f : {dest + "cvdb.edb", dest + "cvdb.edb-wal"}) fs::copy_file(f, f + ".keep");
   }
   for (const std::string& f : {dest + "cvdb.edb", dest + "cvdb.edb-wal"}) fs::rename(f + ".keep", f);
-  const auto destBefore = readFile(dest + "cvdb.edb");
-  const auto walBefore = readFile(dest + "cvdb.edb-wal");
+  const auto destBefore = filesOf(dest);
+  ASSERT_EQ(destBefore.size(), 2u);  // the file and its log
   const auto goodBytes = readFile(good / "cvdb.edb");
 
   struct Case {
@@ -209,6 +218,21 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + std::string(2, '\0') + goodBytes.substr(18)); }},
       {"page size 1000",
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x03\xe8" + goodBytes.substr(18)); }},
+      // Under the configured name a link to a good database, or a folder:
+      // refused, not passed over for another file of ours beside it.
+      {"link",
+       [&](const fs::path& f) {
+         fs::create_symlink(good / "cvdb.edb", f);
+         writeFile(f.parent_path() / "spare.db", goodBytes);
+       }},
+      {"folder",
+       [&](const fs::path& f) {
+         fs::create_directory(f);
+         writeFile(f.parent_path() / "spare.db", goodBytes);
+       }},
+      // Found by looking for our identity: a link is never a candidate.
+      {"link under another name",
+       [&](const fs::path& f) { fs::create_symlink(good / "cvdb.edb", f.parent_path() / "x.db"); }},
       {"damaged",
        [&](const fs::path& f) {
          std::string bytes = goodBytes;
@@ -222,11 +246,7 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
     c.make(backup / "cvdb.edb");
     auto held = engine::Instance::create(settingsFor("dest"));
     EXPECT_EQ(codeOf([&] { engine::restoreInstance(*held, backup.path(), dest, nullptr); }), err::kBadBackupFormat);
-    EXPECT_TRUE(readFile(dest + "cvdb.edb") == destBefore) << "database file changed";
-    EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBefore) << "write-ahead log changed";
-    std::size_t files = 0;
-    for ([[maybe_unused]] const auto& e : fs::directory_iterator(dest)) ++files;
-    EXPECT_EQ(files, 2u);
+    EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
   }
 
   auto initialised = makeInstance("other");
