@@ -218,6 +218,10 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + std::string(2, '\0') + goodBytes.substr(18)); }},
       {"page size 1000",
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x03\xe8" + goodBytes.substr(18)); }},
+      {"page size 3000",
+       [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x0b\xb8" + goodBytes.substr(18)); }},
+      {"page size 256",
+       [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x01" + '\0' + goodBytes.substr(18)); }},
       // Under the configured name a link to a good database, or a folder:
       // refused, not passed over for another file of ours beside it.
       {"link",
@@ -251,6 +255,24 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
 
   auto initialised = makeInstance("other");
   EXPECT_EQ(codeOf([&] { engine::restoreInstance(*initialised, good, dest, nullptr); }), err::kAfterInitialization);
+}
+
+// SQLite writes the largest page size, 65,536, as 1 in the header's two
+// bytes: such a database is restored, not refused as one of page size 1.
+TEST_F(BackupRestore, ADatabaseOfTheLargestPageSizeIsRestored) {
+  testing_support::TempDir backup;
+  const fs::path source = backup / "cvdb.edb";
+  RawDb(source, true)
+      .exec("PRAGMA page_size=65536; PRAGMA journal_mode=WAL; PRAGMA application_id=" +
+            std::to_string(engine::kApplicationId) + "; PRAGMA user_version=" + std::to_string(engine::kFormatVersion) +
+            "; CREATE TABLE t(x); INSERT INTO t VALUES(7);");
+  ASSERT_EQ(readFile(source).substr(16, 2), std::string("\0\x01", 2));
+
+  const engine::InstanceSettings settings = settingsFor("big");
+  engine::restoreInstance(*engine::Instance::create(settings), backup.path(), settings.instanceFolder, nullptr);
+  RawDb db(settings.instanceFolder / "cvdb.edb");
+  EXPECT_EQ(db.number("PRAGMA page_size"), 65536);
+  EXPECT_EQ(db.number("SELECT x FROM t"), 7);
 }
 
 // Every file-system call that creating a database file, backing one up or
