@@ -3,12 +3,22 @@
 //
 // restoreInstance finds the database file in the backup folder (the
 // instance's database file name, or else the one file there that carries
-// this server's identity; a regular file, never a link), checks it (ours,
-// not of a newer format, not truncated, and passing SQLite's quick
-// integrity check on a copy), and places that copy as the destination
-// folder's database file, durably. A stale write-ahead log and index of the
-// destination are removed first: replayed onto the restored file they would
-// corrupt it.
+// this server's identity; a regular file, never a link), checks its header
+// (ours, not of a newer format, a valid page size, not truncated) and
+// copies it into the destination folder under a staged name. A write-ahead
+// log beside it ("<file>-wal", as in a folder copied from a live database)
+// holds committed transactions the file lacks: it is copied beside the
+// staged copy, which SQLite then opens, replaying the log, and checkpoints,
+// so the copy holds them all. The copy must pass SQLite's quick integrity
+// check; then it is placed as the destination folder's database file,
+// durably. A stale write-ahead log and index of the destination are removed
+// first: replayed onto the restored file they would corrupt it.
+//
+// A log that is no regular file, whose header is damaged, or whose damaged
+// frames would drop a transaction it records as committed refuses the
+// restore: the backup is never restored with transactions missing in
+// silence. What a log holds after its last commit (a transaction still
+// being written when the folder was copied) is left out.
 //
 // The instance must be uninitialised (an exclusive maintenance hold), so no
 // connection to the destination is open while the file is replaced.
@@ -39,8 +49,9 @@ namespace engine {
 
 class Instance;
 
-// Reports Begin, Progress (pages copied, pages in all) and Complete, with
-// operation Restore.
+// Reports Begin, Progress (pages copied, pages in all; a log shipped with
+// the file counts in pages of its bytes) and Complete, with operation
+// Restore.
 using SchemaCheck = std::function<std::string(sqlite3* db)>;
 void restoreInstance(Instance& instance, const std::filesystem::path& backupFolder,
                      const std::filesystem::path& destinationFolder, const StatusCallback& status,

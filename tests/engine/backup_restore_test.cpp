@@ -13,6 +13,7 @@
 #include "engine/database_file.h"
 #include "engine/restore.h"
 #include "engine_fixture.h"
+#include "support/log_capture.h"
 #include "support/raw_db.h"
 
 namespace {
@@ -39,6 +40,31 @@ class BackupRestore : public EngineTest {
         bulk.reset();
       }
     });
+  }
+
+  // A backup folder copied from a live database: its file and write-ahead
+  // log, taken while a session holds the database open. The file holds the
+  // tables only; the rows (one row of "blobs" per transaction) are in the
+  // log. With restartAfter, the log starts over after that many rows (all
+  // of them moved into the file first): the later rows overwrite its
+  // beginning, and frames of the earlier ones stay behind them.
+  void copyLiveDatabase(const std::string& key, const fs::path& to, int rows, int restartAfter = 0) {
+    auto instance = makeInstance(key);
+    auto session = makeDatabase(instance);
+    session->execute("PRAGMA wal_checkpoint(TRUNCATE)");
+    session->execute("PRAGMA wal_autocheckpoint=0");
+    for (int i = 0; i < rows; ++i) {
+      if (i > 0 && i == restartAfter) session->execute("PRAGMA wal_checkpoint(RESTART)");
+      DB::runInTransaction(*session, [&] {
+        session->prepare("INSERT INTO blobs(id, blob) VALUES(?, randomblob(100))")
+            .bindBlob(1, "row" + std::to_string(i))
+            .run();
+      });
+    }
+    const fs::path file = instance->settings().instanceFolder / "cvdb.edb";
+    fs::create_directories(to);
+    fs::copy_file(file, to / "cvdb.edb");
+    fs::copy_file(engine::walFile(file), to / "cvdb.edb-wal");
   }
 
   std::vector<StatusNotification> notes_;
@@ -178,6 +204,128 @@ TEST_F(BackupRestore, RestorePlacesTheBackupUnderAnyNameAndDropsAStaleLog) {
   EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
 }
 
+std::vector<std::string> namesIn(const fs::path& folder) {
+  std::vector<std::string> names;
+  for (const auto& [name, bytes] : filesOf(folder)) names.push_back(name);
+  return names;
+}
+
+// The offset of frame n (from 1) of a write-ahead log: a 32-byte header,
+// then frames of a 24-byte header and a page each.
+std::size_t frameAt(const std::string& log, std::size_t n) {
+  const auto page = (std::size_t{static_cast<unsigned char>(log[10])} << 8) | static_cast<unsigned char>(log[11]);
+  return 32 + (n - 1) * (24 + page);
+}
+
+// A folder copied from a live database holds committed transactions in its
+// write-ahead log only; the restore applies them, under the configured name
+// and under the name of a file found by its identity.
+TEST_F(BackupRestore, RestoreAppliesTheWriteAheadLogShippedBesideTheFile) {
+  const fs::path backup = dir_.path() / "backup";
+  copyLiveDatabase("src", backup, 21);
+  const fs::path alone = dir_.path() / "alone";
+  fs::create_directories(alone);
+  fs::copy_file(backup / "cvdb.edb", alone / "cvdb.edb");
+  ASSERT_EQ(RawDb(alone / "cvdb.edb").number("SELECT count(*) FROM blobs"), 0);  // the rows are in the log only
+  const auto shipped = filesOf(backup);
+
+  const auto restoreAndCount = [&](const fs::path& from, const std::string& key) {
+    const engine::InstanceSettings settings = settingsFor(key);
+    engine::restoreInstance(*engine::Instance::create(settings), from, settings.instanceFolder, record_);
+    EXPECT_EQ(namesIn(settings.instanceFolder), std::vector<std::string>{"cvdb.edb"});
+    RawDb db(settings.instanceFolder / "cvdb.edb");
+    EXPECT_EQ(db.value("PRAGMA integrity_check"), "ok");
+    return db.number("SELECT count(*) FROM blobs");
+  };
+  EXPECT_EQ(restoreAndCount(backup, "a"), 21);
+  expectWellFormedReports(notes_, engine::SnapshotOperation::Restore);
+  EXPECT_TRUE(filesOf(backup) == shipped) << "the backup changed";
+
+  fs::rename(backup / "cvdb.edb", backup / "old.db");
+  fs::rename(backup / "cvdb.edb-wal", backup / "old.db-wal");
+  EXPECT_EQ(restoreAndCount(backup, "b"), 21);
+
+  // A log left beside the staged copy by a restore that did not finish is
+  // not replayed onto the next one's copy.
+  const engine::InstanceSettings settings = settingsFor("c");
+  fs::create_directories(settings.instanceFolder);
+  fs::copy_file(backup / "old.db-wal", settings.instanceFolder / "cvdb.edb.restoring-wal");
+  EXPECT_EQ(restoreAndCount(alone, "c"), 0);
+}
+
+// A log is applied only whole: one that would lose a transaction it
+// records as committed, or is no regular file, is refused and the
+// destination keeps exactly its files. What a log may hold beyond its last
+// commit (a transaction still being written when the folder was copied,
+// frames of the log's earlier rounds) is left out, as SQLite leaves it.
+TEST_F(BackupRestore, ALogThatCannotBeAppliedWholeIsRefused) {
+  const fs::path live = dir_.path() / "live";
+  copyLiveDatabase("src", live, 21);
+  const std::string log = readFile(live / "cvdb.edb-wal");
+  ASSERT_GT(log.size(), frameAt(log, 42));  // two frames (table and index) a row
+
+  const std::string dest = root() + "dest/";
+  makeDatabase(makeInstance("dest"));
+  const auto destBefore = filesOf(dest);
+  ASSERT_EQ(namesIn(dest), std::vector<std::string>{"cvdb.edb"});
+
+  const auto damaged = [&](std::size_t at) {
+    std::string bytes = log;
+    bytes[at] = static_cast<char>(bytes[at] ^ 0x5a);
+    return bytes;
+  };
+  struct Refused {
+    const char* name;
+    std::function<void(const fs::path&)> make;
+    const char* reason;  // in the refusal's log line
+  };
+  const std::vector<Refused> refused{
+      {"header fails its checksum", [&](const fs::path& f) { writeFile(f, damaged(17)); }, "has a damaged header"},
+      {"no log", [&](const fs::path& f) { writeFile(f, damaged(0)); }, "is not a write-ahead log"},
+      {"cut inside its header", [&](const fs::path& f) { writeFile(f, log.substr(0, 20)); }, "cut inside its header"},
+      {"frame damaged before later commits",
+       [&](const fs::path& f) { writeFile(f, damaged(frameAt(log, 2) + 24 + 100)); },
+       "frame 2 of the write-ahead log \"cvdb.edb-wal\" is damaged"},
+      {"link", [&](const fs::path& f) { fs::create_symlink(live / "cvdb.edb-wal", f); }, "is not a regular file"},
+      {"folder", [&](const fs::path& f) { fs::create_directory(f); }, "is not a regular file"},
+  };
+  for (const auto& c : refused) {
+    SCOPED_TRACE(c.name);
+    testing_support::TempDir backup;
+    fs::copy_file(live / "cvdb.edb", backup / "cvdb.edb");
+    c.make(backup / "cvdb.edb-wal");
+    testing_support::LogCapture captured;
+    auto held = engine::Instance::create(settingsFor("dest"));
+    EXPECT_EQ(codeOf([&] { engine::restoreInstance(*held, backup.path(), dest, nullptr); }), err::kBadBackupFormat);
+    EXPECT_TRUE(captured.contains(Log::Warning, c.reason));
+    EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
+  }
+
+  const fs::path restarted = dir_.path() / "restarted";
+  copyLiveDatabase("src2", restarted, 21, 15);
+  struct Kept {
+    const char* name;
+    fs::path file;
+    std::string log;
+    std::int64_t rows;
+  };
+  const std::vector<Kept> kept{
+      {"last frame cut short", live / "cvdb.edb", log.substr(0, log.size() - 1000), 20},
+      {"empty log", live / "cvdb.edb", "", 0},
+      {"earlier round's frames behind the last commit", restarted / "cvdb.edb", readFile(restarted / "cvdb.edb-wal"),
+       21},
+  };
+  for (std::size_t i = 0; i < kept.size(); ++i) {
+    SCOPED_TRACE(kept[i].name);
+    testing_support::TempDir backup;
+    fs::copy_file(kept[i].file, backup / "cvdb.edb");
+    writeFile(backup / "cvdb.edb-wal", kept[i].log);
+    const engine::InstanceSettings settings = settingsFor("kept" + std::to_string(i));
+    engine::restoreInstance(*engine::Instance::create(settings), backup.path(), settings.instanceFolder, nullptr);
+    EXPECT_EQ(RawDb(settings.instanceFolder / "cvdb.edb").number("SELECT count(*) FROM blobs"), kept[i].rows);
+  }
+}
+
 // Backups that are not ours, are newer, are damaged, or are not regular
 // files are refused with -514, and the destination keeps exactly its files.
 TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
@@ -278,9 +426,9 @@ TEST_F(BackupRestore, ADatabaseOfTheLargestPageSizeIsRestored) {
 // Every file-system call that creating a database file, backing one up or
 // restoring one makes, failed in turn: what each promises on failure holds
 // every time. A creation leaves no file (or a whole one) and no building
-// file; a backup leaves no copy; a restore leaves the destination's file and
-// write-ahead log exactly as they were (the log may hold committed
-// transactions) and nothing of its own.
+// file; a backup leaves no copy; a restore (of a folder whose log is
+// applied) leaves the destination's file and write-ahead log exactly as they
+// were (the log may hold committed transactions) and nothing of its own.
 TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
   using testing_support::FaultEnv;
   const auto sweep = [&](const char* what, const std::function<void(int)>& run, const std::function<void(int)>& check) {
@@ -326,7 +474,14 @@ TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
         if (!fs::exists(target / "cvdb.edb")) return;
         EXPECT_EQ(RawDb(target / "cvdb.edb").value("PRAGMA integrity_check"), "ok");
       });
-  const fs::path good = dir_.path() / "b0";
+  // The restores take a folder copied from the live database, with a
+  // transfer that is in its write-ahead log only.
+  const fs::path good = dir_.path() / "live";
+  session->execute("PRAGMA wal_checkpoint(TRUNCATE)");
+  session->execute("PRAGMA wal_autocheckpoint=0");
+  DB::runInTransaction(*session, [&] { session->prepare("UPDATE counter SET value = 999 WHERE id = 1").run(); });
+  fs::create_directories(good);
+  for (const std::string name : {"cvdb.edb", "cvdb.edb-wal"}) fs::copy_file(root() + "src/" + name, good / name);
 
   const std::string dest = root() + "dest/";
   {
@@ -363,7 +518,7 @@ TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
           // the rename): the new file is in place, whole, and the old log is
           // out of SQLite's way.
           EXPECT_EQ(names, (std::vector<std::string>{"cvdb.edb", "cvdb.edb-wal.keep", "cvdb.edb.keep"}));
-          EXPECT_EQ(RawDb(dest + "cvdb.edb").number("SELECT value FROM counter WHERE id = 1"), 1000);
+          EXPECT_EQ(RawDb(dest + "cvdb.edb").number("SELECT value FROM counter WHERE id = 1"), 999);
         } else {
           EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBytes) << "write-ahead log lost";
           EXPECT_EQ(names,
