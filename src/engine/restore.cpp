@@ -340,9 +340,9 @@ void applyLog(sys::Env& env, const fs::path& backupFolder, const fs::path& stage
 }
 
 // SQLite's quick check on the staged copy (never on the backup itself,
-// which stays as it was unpacked).
+// which stays as it was unpacked), then the caller's schema check.
 void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& staged, const Instance& instance,
-                  const std::source_location& where) {
+                  const SchemaCheck& schemaCheck, const std::source_location& where) {
   try {
     auto db = openConnection(env, staged, OpenMode::Existing, instance.settings().busyTimeout, where);
     sqlite3_stmt* raw = nullptr;
@@ -362,6 +362,10 @@ void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& s
                  (verdict.empty() ? std::string(sqlite3_errstr(rc)) : verdict) + ")",
              where);
     }
+    if (schemaCheck) {
+      const std::string missing = schemaCheck(db.get());
+      if (!missing.empty()) refuse(backupFolder, "the database lacks what the server uses: " + missing, where);
+    }
   } catch (const DB::DBExc& e) {
     if (!unreadable(e.code())) throw;
     refuse(backupFolder, "the database cannot be read (" + std::string(e.what()) + ")", where);
@@ -372,7 +376,7 @@ void checkContent(sys::Env& env, const fs::path& backupFolder, const fs::path& s
 }  // namespace
 
 void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs::path& destinationFolder,
-                     const StatusCallback& status, const SchemaCheck&, const std::source_location& where) {
+                     const StatusCallback& status, const SchemaCheck& schemaCheck, const std::source_location& where) {
   if (instance.state() != Instance::State::Created) DB::throwEngineError(DB::err::kAfterInitialization, where);
   sys::Env& env = *instance.settings().env;
   const auto& fileName = instance.settings().databaseFileName;
@@ -405,7 +409,7 @@ void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs:
         committedFrames(env, backupFolder, walFile(staged.path()), log.filename().string(), header.pageSize, where);
     applyLog(env, backupFolder, staged.path(), frames, instance, where);
   }
-  checkContent(env, backupFolder, staged.path(), instance, where);
+  checkContent(env, backupFolder, staged.path(), instance, schemaCheck, where);
 
   // Nobody has the destination open (the instance is not initialised).
   onFiles(where, [&] {

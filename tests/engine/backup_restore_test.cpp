@@ -326,6 +326,43 @@ TEST_F(BackupRestore, ALogThatCannotBeAppliedWholeIsRefused) {
   }
 }
 
+// The caller's schema check runs on the staged copy, with the log applied
+// and before anything is placed; what it says is missing refuses the
+// restore and is logged, and the destination keeps exactly its files.
+TEST_F(BackupRestore, TheSchemaCheckDecidesOnTheStagedCopy) {
+  const fs::path backup = dir_.path() / "backup";
+  copyLiveDatabase("src", backup, 21);
+  std::string checked;
+  std::int64_t rowsSeen = -1;
+  const engine::SchemaCheck counting = [&](sqlite3* db) {
+    checked = fs::path(sqlite3_db_filename(db, "main")).filename().string();
+    sqlite3_stmt* s = nullptr;
+    if (sqlite3_prepare_v2(db, "SELECT count(*) FROM blobs", -1, &s, nullptr) == SQLITE_OK &&
+        sqlite3_step(s) == SQLITE_ROW) {
+      rowsSeen = sqlite3_column_int64(s, 0);
+    }
+    sqlite3_finalize(s);
+    return std::string();
+  };
+  const engine::InstanceSettings settings = settingsFor("a");
+  engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr, counting);
+  EXPECT_EQ(checked, "cvdb.edb.restoring");
+  EXPECT_EQ(rowsSeen, 21);
+  EXPECT_EQ(RawDb(settings.instanceFolder / "cvdb.edb").number("SELECT count(*) FROM blobs"), 21);
+
+  const std::string dest = root() + "dest/";
+  makeDatabase(makeInstance("dest"));
+  const auto destBefore = filesOf(dest);
+  testing_support::LogCapture captured;
+  const engine::SchemaCheck lacking = [](sqlite3*) { return std::string("no table \"info\""); };
+  EXPECT_EQ(codeOf([&] {
+              engine::restoreInstance(*engine::Instance::create(settingsFor("dest")), backup, dest, nullptr, lacking);
+            }),
+            err::kBadBackupFormat);
+  EXPECT_TRUE(captured.contains(Log::Warning, "no table \"info\""));
+  EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
+}
+
 // Backups that are not ours, are newer, are damaged, or are not regular
 // files are refused with -514, and the destination keeps exactly its files.
 TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
