@@ -382,6 +382,11 @@ void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs:
   const auto& fileName = instance.settings().databaseFileName;
   const fs::path source = findDatabase(env, backupFolder, fileName, where);
   const FileHeader header = checkHeader(env, backupFolder, source, where);
+  const fs::path log = walFile(source);
+  const auto logType = onFiles(where, [&] { return env.stat(log).type; });
+  if (logType != sys::FileType::Missing && logType != sys::FileType::Regular) {
+    refuse(backupFolder, "the write-ahead log \"" + log.filename().string() + "\" is not a regular file", where);
+  }
 
   onFiles(where, [&] { env.createFolders(destinationFolder); });
   const fs::path target = destinationFolder / fileName;
@@ -395,14 +400,7 @@ void restoreInstance(Instance& instance, const fs::path& backupFolder, const fs:
 
   if (status) status({SnapshotOperation::Restore, StatusKind::Begin, std::nullopt, std::nullopt});
   std::vector<std::pair<fs::path, fs::path>> files{{source, staged.path()}};
-  const fs::path log = walFile(source);
-  const auto logType = onFiles(where, [&] { return env.stat(log).type; });
-  if (logType != sys::FileType::Missing) {
-    if (logType != sys::FileType::Regular) {
-      refuse(backupFolder, "the write-ahead log \"" + log.filename().string() + "\" is not a regular file", where);
-    }
-    files.emplace_back(log, walFile(staged.path()));
-  }
+  if (logType == sys::FileType::Regular) files.emplace_back(log, walFile(staged.path()));
   copyFiles(env, files, header.pageSize, status, where);
   if (files.size() > 1) {
     const auto frames =
