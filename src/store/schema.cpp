@@ -129,7 +129,7 @@ std::string whatIsMissing(sqlite3* db) {
   }
 
   std::string text;
-  for (const auto& part : missing) text += (text.empty() ? "" : ", ") + part;
+  for (const auto& item : missing) text += (text.empty() ? "" : ", ") + item;
   return text;
 }
 

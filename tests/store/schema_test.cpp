@@ -21,7 +21,7 @@ TEST_F(Schema, ADatabaseTheStoreMadeLacksNothing) {
   EXPECT_EQ(DB::schema::whatIsMissing(RawDb(file).handle()), "");
 }
 
-TEST_F(Schema, EveryMissingOrUnfitPartIsNamed) {
+TEST_F(Schema, EveryMissingOrUnfitTableColumnOrIndexIsNamed) {
   const std::string info = "CREATE TABLE info(id BLOB PRIMARY KEY, folder BLOB, status INTEGER, blob BLOB);";
   const std::string index = "CREATE INDEX fldStaIdx ON info(folder, status);";
   const std::string meta = "CREATE TABLE meta(id BLOB PRIMARY KEY, blob BLOB);";
