@@ -18,6 +18,8 @@
 //
 // Failures: DB::DBExc from the engine.
 
+#include <sqlite3.h>
+
 #include <string>
 
 #include "engine/session.h"
@@ -53,5 +55,15 @@ struct Present {
   bool meta = false;
 };
 Present present(engine::Session& session);
+
+// What the database lacks of the tables, columns and index the store reads
+// and writes ("info" with id, folder, status and blob; "meta" with id and
+// blob, a rowid table; the index fldStaIdx on info(folder, status), neither
+// unique nor partial), as a short text such as `column "info.status",
+// index "fldStaIdx" on info(folder, status)`; "" when it lacks nothing.
+// Restore asks it of a staged copy before placing it: a file with this
+// server's identity but other tables would leave the database unusable.
+// Names compare without case, as SQLite resolves them.
+std::string whatIsMissing(sqlite3* db);
 
 }  // namespace DB::schema

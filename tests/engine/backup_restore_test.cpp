@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <atomic>
 #include <filesystem>
+#include <map>
 #include <thread>
 #include <vector>
 
@@ -12,6 +13,7 @@
 #include "engine/database_file.h"
 #include "engine/restore.h"
 #include "engine_fixture.h"
+#include "support/log_capture.h"
 #include "support/raw_db.h"
 
 namespace {
@@ -40,9 +42,42 @@ class BackupRestore : public EngineTest {
     });
   }
 
+  // A backup folder copied from a live database: its file and write-ahead
+  // log, taken while a session holds the database open. The file holds the
+  // tables only; the rows (one row of "blobs" per transaction) are in the
+  // log. With restartAfter, the log starts over after that many rows (all
+  // of them moved into the file first): the later rows overwrite its
+  // beginning, and frames of the earlier ones stay behind them.
+  void copyLiveDatabase(const std::string& key, const fs::path& to, int rows, int restartAfter = 0) {
+    auto instance = makeInstance(key);
+    auto session = makeDatabase(instance);
+    session->execute("PRAGMA wal_checkpoint(TRUNCATE)");
+    session->execute("PRAGMA wal_autocheckpoint=0");
+    for (int i = 0; i < rows; ++i) {
+      if (i > 0 && i == restartAfter) session->execute("PRAGMA wal_checkpoint(RESTART)");
+      DB::runInTransaction(*session, [&] {
+        session->prepare("INSERT INTO blobs(id, blob) VALUES(?, randomblob(100))")
+            .bindBlob(1, "row" + std::to_string(i))
+            .run();
+      });
+    }
+    const fs::path file = instance->settings().instanceFolder / "cvdb.edb";
+    fs::create_directories(to);
+    fs::copy_file(file, to / "cvdb.edb");
+    fs::copy_file(engine::walFile(file), to / "cvdb.edb-wal");
+  }
+
   std::vector<StatusNotification> notes_;
   engine::StatusCallback record_ = [this](const StatusNotification& n) { notes_.push_back(n); };
 };
+
+// Every file of a folder with its bytes: a refused restore leaves the
+// destination's exactly as they were, and no file of its own.
+std::map<std::string, std::string> filesOf(const fs::path& folder) {
+  std::map<std::string, std::string> files;
+  for (const auto& e : fs::directory_iterator(folder)) files[e.path().filename().string()] = readFile(e.path());
+  return files;
+}
 
 void expectWellFormedReports(const std::vector<StatusNotification>& notes, engine::SnapshotOperation operation) {
   ASSERT_GE(notes.size(), 3u);
@@ -169,8 +204,165 @@ TEST_F(BackupRestore, RestorePlacesTheBackupUnderAnyNameAndDropsAStaleLog) {
   EXPECT_EQ(db.number("SELECT count(*) FROM blobs"), 1000);
 }
 
-// Backups that are not ours, are newer, or are damaged are refused with
-// -514, and the destination keeps exactly its files.
+std::vector<std::string> namesIn(const fs::path& folder) {
+  std::vector<std::string> names;
+  for (const auto& [name, bytes] : filesOf(folder)) names.push_back(name);
+  return names;
+}
+
+// The offset of frame n (from 1) of a write-ahead log: a 32-byte header,
+// then frames of a 24-byte header and a page each.
+std::size_t frameAt(const std::string& log, std::size_t n) {
+  const auto page = (std::size_t{static_cast<unsigned char>(log[10])} << 8) | static_cast<unsigned char>(log[11]);
+  return 32 + (n - 1) * (24 + page);
+}
+
+// A folder copied from a live database holds committed transactions in its
+// write-ahead log only; the restore applies them, under the configured name
+// and under the name of a file found by its identity.
+TEST_F(BackupRestore, RestoreAppliesTheWriteAheadLogShippedBesideTheFile) {
+  const fs::path backup = dir_.path() / "backup";
+  copyLiveDatabase("src", backup, 21);
+  const fs::path alone = dir_.path() / "alone";
+  fs::create_directories(alone);
+  fs::copy_file(backup / "cvdb.edb", alone / "cvdb.edb");
+  ASSERT_EQ(RawDb(alone / "cvdb.edb").number("SELECT count(*) FROM blobs"), 0);  // the rows are in the log only
+  const auto shipped = filesOf(backup);
+
+  const auto restoreAndCount = [&](const fs::path& from, const std::string& key) {
+    const engine::InstanceSettings settings = settingsFor(key);
+    engine::restoreInstance(*engine::Instance::create(settings), from, settings.instanceFolder, record_);
+    EXPECT_EQ(namesIn(settings.instanceFolder), std::vector<std::string>{"cvdb.edb"});
+    RawDb db(settings.instanceFolder / "cvdb.edb");
+    EXPECT_EQ(db.value("PRAGMA integrity_check"), "ok");
+    return db.number("SELECT count(*) FROM blobs");
+  };
+  EXPECT_EQ(restoreAndCount(backup, "a"), 21);
+  expectWellFormedReports(notes_, engine::SnapshotOperation::Restore);
+  EXPECT_TRUE(filesOf(backup) == shipped) << "the backup changed";
+
+  fs::rename(backup / "cvdb.edb", backup / "old.db");
+  fs::rename(backup / "cvdb.edb-wal", backup / "old.db-wal");
+  EXPECT_EQ(restoreAndCount(backup, "b"), 21);
+
+  // A log left beside the staged copy by a restore that did not finish is
+  // not replayed onto the next one's copy.
+  const engine::InstanceSettings settings = settingsFor("c");
+  fs::create_directories(settings.instanceFolder);
+  fs::copy_file(backup / "old.db-wal", settings.instanceFolder / "cvdb.edb.restoring-wal");
+  EXPECT_EQ(restoreAndCount(alone, "c"), 0);
+}
+
+// A log is applied only whole: one that would lose a transaction it
+// records as committed, or is no regular file, is refused and the
+// destination keeps exactly its files. What a log may hold beyond its last
+// commit (a transaction still being written when the folder was copied,
+// frames of the log's earlier rounds) is left out, as SQLite leaves it.
+TEST_F(BackupRestore, ALogThatCannotBeAppliedWholeIsRefused) {
+  const fs::path live = dir_.path() / "live";
+  copyLiveDatabase("src", live, 21);
+  const std::string log = readFile(live / "cvdb.edb-wal");
+  ASSERT_GT(log.size(), frameAt(log, 42));  // two frames (table and index) a row
+
+  const std::string dest = root() + "dest/";
+  makeDatabase(makeInstance("dest"));
+  const auto destBefore = filesOf(dest);
+  ASSERT_EQ(namesIn(dest), std::vector<std::string>{"cvdb.edb"});
+
+  const auto damaged = [&](std::size_t at) {
+    std::string bytes = log;
+    bytes[at] = static_cast<char>(bytes[at] ^ 0x5a);
+    return bytes;
+  };
+  struct Refused {
+    const char* name;
+    std::function<void(const fs::path&)> make;
+    const char* reason;  // in the refusal's log line
+  };
+  const std::vector<Refused> refused{
+      {"header fails its checksum", [&](const fs::path& f) { writeFile(f, damaged(17)); }, "has a damaged header"},
+      {"cut inside its header", [&](const fs::path& f) { writeFile(f, log.substr(0, 20)); }, "cut inside its header"},
+      {"frame damaged before later commits",
+       [&](const fs::path& f) { writeFile(f, damaged(frameAt(log, 2) + 24 + 100)); },
+       "frame 2 of the write-ahead log \"cvdb.edb-wal\" is damaged"},
+      {"link", [&](const fs::path& f) { fs::create_symlink(live / "cvdb.edb-wal", f); }, "is not a regular file"},
+  };
+  for (const auto& c : refused) {
+    SCOPED_TRACE(c.name);
+    testing_support::TempDir backup;
+    fs::copy_file(live / "cvdb.edb", backup / "cvdb.edb");
+    c.make(backup / "cvdb.edb-wal");
+    testing_support::LogCapture captured;
+    auto held = engine::Instance::create(settingsFor("dest"));
+    EXPECT_EQ(codeOf([&] { engine::restoreInstance(*held, backup.path(), dest, nullptr); }), err::kBadBackupFormat);
+    EXPECT_TRUE(captured.contains(Log::Warning, c.reason));
+    EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
+  }
+
+  const fs::path restarted = dir_.path() / "restarted";
+  copyLiveDatabase("src2", restarted, 21, 15);
+  struct Kept {
+    const char* name;
+    fs::path file;
+    std::string log;
+    std::int64_t rows;
+  };
+  const std::vector<Kept> kept{
+      {"last frame cut short", live / "cvdb.edb", log.substr(0, log.size() - 1000), 20},
+      {"empty log", live / "cvdb.edb", "", 0},
+      {"earlier round's frames behind the last commit", restarted / "cvdb.edb", readFile(restarted / "cvdb.edb-wal"),
+       21},
+  };
+  for (std::size_t i = 0; i < kept.size(); ++i) {
+    SCOPED_TRACE(kept[i].name);
+    testing_support::TempDir backup;
+    fs::copy_file(kept[i].file, backup / "cvdb.edb");
+    writeFile(backup / "cvdb.edb-wal", kept[i].log);
+    const engine::InstanceSettings settings = settingsFor("kept" + std::to_string(i));
+    engine::restoreInstance(*engine::Instance::create(settings), backup.path(), settings.instanceFolder, nullptr);
+    EXPECT_EQ(RawDb(settings.instanceFolder / "cvdb.edb").number("SELECT count(*) FROM blobs"), kept[i].rows);
+  }
+}
+
+// The caller's schema check runs on the staged copy, with the log applied
+// and before anything is placed; what it says is missing refuses the
+// restore and is logged, and the destination keeps exactly its files.
+TEST_F(BackupRestore, TheSchemaCheckDecidesOnTheStagedCopy) {
+  const fs::path backup = dir_.path() / "backup";
+  copyLiveDatabase("src", backup, 21);
+  std::string checked;
+  std::int64_t rowsSeen = -1;
+  const engine::SchemaCheck counting = [&](sqlite3* db) {
+    checked = fs::path(sqlite3_db_filename(db, "main")).filename().string();
+    sqlite3_stmt* s = nullptr;
+    if (sqlite3_prepare_v2(db, "SELECT count(*) FROM blobs", -1, &s, nullptr) == SQLITE_OK &&
+        sqlite3_step(s) == SQLITE_ROW) {
+      rowsSeen = sqlite3_column_int64(s, 0);
+    }
+    sqlite3_finalize(s);
+    return std::string();
+  };
+  const engine::InstanceSettings settings = settingsFor("a");
+  engine::restoreInstance(*engine::Instance::create(settings), backup, settings.instanceFolder, nullptr, counting);
+  EXPECT_EQ(checked, "cvdb.edb.restoring");
+  EXPECT_EQ(rowsSeen, 21);
+  EXPECT_EQ(RawDb(settings.instanceFolder / "cvdb.edb").number("SELECT count(*) FROM blobs"), 21);
+
+  const std::string dest = root() + "dest/";
+  makeDatabase(makeInstance("dest"));
+  const auto destBefore = filesOf(dest);
+  testing_support::LogCapture captured;
+  const engine::SchemaCheck lacking = [](sqlite3*) { return std::string("no table \"info\""); };
+  EXPECT_EQ(codeOf([&] {
+              engine::restoreInstance(*engine::Instance::create(settingsFor("dest")), backup, dest, nullptr, lacking);
+            }),
+            err::kBadBackupFormat);
+  EXPECT_TRUE(captured.contains(Log::Warning, "no table \"info\""));
+  EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
+}
+
+// Backups that are not ours, are newer, are damaged, or are not regular
+// files are refused with -514, and the destination keeps exactly its files.
 TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
   const fs::path good = dir_.path() / "good";
   const std::string dest = root() + "dest/";
@@ -185,8 +377,8 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
     for (const std::string& f : {dest + "cvdb.edb", dest + "cvdb.edb-wal"}) fs::copy_file(f, f + ".keep");
   }
   for (const std::string& f : {dest + "cvdb.edb", dest + "cvdb.edb-wal"}) fs::rename(f + ".keep", f);
-  const auto destBefore = readFile(dest + "cvdb.edb");
-  const auto walBefore = readFile(dest + "cvdb.edb-wal");
+  const auto destBefore = filesOf(dest);
+  ASSERT_EQ(destBefore.size(), 2u);  // the file and its log
   const auto goodBytes = readFile(good / "cvdb.edb");
 
   struct Case {
@@ -204,11 +396,25 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
          RawDb(f).exec("PRAGMA user_version=" + std::to_string(engine::kFormatVersion + 1));
        }},
       {"truncated", [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, goodBytes.size() / 2)); }},
-      // A page size the copy would divide by, and one that is no power of two.
+      // A page size the copy would divide by, and ones that are no power of two.
       {"page size 0",
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + std::string(2, '\0') + goodBytes.substr(18)); }},
       {"page size 1000",
        [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x03\xe8" + goodBytes.substr(18)); }},
+      {"page size 3000",
+       [&](const fs::path& f) { writeFile(f, goodBytes.substr(0, 16) + "\x0b\xb8" + goodBytes.substr(18)); }},
+      // Under the configured name a link to a good database, or a folder:
+      // refused, not passed over for another file of ours beside it.
+      {"link",
+       [&](const fs::path& f) {
+         fs::create_symlink(good / "cvdb.edb", f);
+         writeFile(f.parent_path() / "spare.db", goodBytes);
+       }},
+      {"folder",
+       [&](const fs::path& f) {
+         fs::create_directory(f);
+         writeFile(f.parent_path() / "spare.db", goodBytes);
+       }},
       {"damaged",
        [&](const fs::path& f) {
          std::string bytes = goodBytes;
@@ -222,23 +428,37 @@ TEST_F(BackupRestore, UnusableBackupsAreRefusedAndTheDestinationIsUntouched) {
     c.make(backup / "cvdb.edb");
     auto held = engine::Instance::create(settingsFor("dest"));
     EXPECT_EQ(codeOf([&] { engine::restoreInstance(*held, backup.path(), dest, nullptr); }), err::kBadBackupFormat);
-    EXPECT_TRUE(readFile(dest + "cvdb.edb") == destBefore) << "database file changed";
-    EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBefore) << "write-ahead log changed";
-    std::size_t files = 0;
-    for ([[maybe_unused]] const auto& e : fs::directory_iterator(dest)) ++files;
-    EXPECT_EQ(files, 2u);
+    EXPECT_TRUE(filesOf(dest) == destBefore) << "destination changed";
   }
 
   auto initialised = makeInstance("other");
   EXPECT_EQ(codeOf([&] { engine::restoreInstance(*initialised, good, dest, nullptr); }), err::kAfterInitialization);
 }
 
+// SQLite writes the largest page size, 65,536, as 1 in the header's two
+// bytes: such a database is restored, not refused as one of page size 1.
+TEST_F(BackupRestore, ADatabaseOfTheLargestPageSizeIsRestored) {
+  testing_support::TempDir backup;
+  const fs::path source = backup / "cvdb.edb";
+  RawDb(source, true)
+      .exec("PRAGMA page_size=65536; PRAGMA journal_mode=WAL; PRAGMA application_id=" +
+            std::to_string(engine::kApplicationId) + "; PRAGMA user_version=" + std::to_string(engine::kFormatVersion) +
+            "; CREATE TABLE t(x); INSERT INTO t VALUES(7);");
+  ASSERT_EQ(readFile(source).substr(16, 2), std::string("\0\x01", 2));
+
+  const engine::InstanceSettings settings = settingsFor("big");
+  engine::restoreInstance(*engine::Instance::create(settings), backup.path(), settings.instanceFolder, nullptr);
+  RawDb db(settings.instanceFolder / "cvdb.edb");
+  EXPECT_EQ(db.number("PRAGMA page_size"), 65536);
+  EXPECT_EQ(db.number("SELECT x FROM t"), 7);
+}
+
 // Every file-system call that creating a database file, backing one up or
 // restoring one makes, failed in turn: what each promises on failure holds
 // every time. A creation leaves no file (or a whole one) and no building
-// file; a backup leaves no copy; a restore leaves the destination's file and
-// write-ahead log exactly as they were (the log may hold committed
-// transactions) and nothing of its own.
+// file; a backup leaves no copy; a restore (of a folder whose log is
+// applied) leaves the destination's file and write-ahead log exactly as they
+// were (the log may hold committed transactions) and nothing of its own.
 TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
   using testing_support::FaultEnv;
   const auto sweep = [&](const char* what, const std::function<void(int)>& run, const std::function<void(int)>& check) {
@@ -284,7 +504,14 @@ TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
         if (!fs::exists(target / "cvdb.edb")) return;
         EXPECT_EQ(RawDb(target / "cvdb.edb").value("PRAGMA integrity_check"), "ok");
       });
-  const fs::path good = dir_.path() / "b0";
+  // The restores take a folder copied from the live database, with a
+  // transfer that is in its write-ahead log only.
+  const fs::path good = dir_.path() / "live";
+  session->execute("PRAGMA wal_checkpoint(TRUNCATE)");
+  session->execute("PRAGMA wal_autocheckpoint=0");
+  DB::runInTransaction(*session, [&] { session->prepare("UPDATE counter SET value = 999 WHERE id = 1").run(); });
+  fs::create_directories(good);
+  for (const std::string name : {"cvdb.edb", "cvdb.edb-wal"}) fs::copy_file(root() + "src/" + name, good / name);
 
   const std::string dest = root() + "dest/";
   {
@@ -321,7 +548,7 @@ TEST_F(BackupRestore, EveryFailingFileCallLeavesWhatTheHeadersPromise) {
           // the rename): the new file is in place, whole, and the old log is
           // out of SQLite's way.
           EXPECT_EQ(names, (std::vector<std::string>{"cvdb.edb", "cvdb.edb-wal.keep", "cvdb.edb.keep"}));
-          EXPECT_EQ(RawDb(dest + "cvdb.edb").number("SELECT value FROM counter WHERE id = 1"), 1000);
+          EXPECT_EQ(RawDb(dest + "cvdb.edb").number("SELECT value FROM counter WHERE id = 1"), 999);
         } else {
           EXPECT_TRUE(readFile(dest + "cvdb.edb-wal") == walBytes) << "write-ahead log lost";
           EXPECT_EQ(names,

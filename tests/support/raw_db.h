@@ -35,6 +35,9 @@ class RawDb {
   RawDb(const RawDb&) = delete;
   RawDb& operator=(const RawDb&) = delete;
 
+  // The connection itself, for code under test that takes one.
+  sqlite3* handle() const { return db_; }
+
   // Runs one or more statements; SQLite's result code.
   int exec(const std::string& sql) { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr); }
 
