@@ -241,6 +241,9 @@ void DBLocal::restore(const std::string& target, bool all, std::unique_ptr<DBPro
   // connection's own goes first.
   const bool wasOpen = disconnect();
   maint::RestoreOptions options;
+  // A database file without the tables the store uses would leave the
+  // database unusable until the next restore.
+  options.schemaCheck = schema::whatIsMissing;
   if (all) {
     maint::restoreFolder(pool_, target, *callback, options, stop);
   } else {

@@ -259,7 +259,14 @@ TEST_F(Restore, ArchivesWithoutAUsableDatabaseAreRefusedAndNothingChanges) {
   const auto before = files();
   const std::string foreign = craft("foreign.cvbak", {{"cvdb.edb", std::string(8192, 'x')}, {"d\\doc\\one", "1"}});
   const std::string empty = craft("empty.cvbak", {{"originDB.txt", "x\r\nsales"}});
-  for (const auto& bad : {foreign, empty}) {
+  // Our identity, other tables: the store could not use it.
+  {
+    const fs::path odd = dir_ / "odd.edb";
+    fs::copy_file(root() + "sales/cvdb.edb", odd);
+    RawDb(odd).exec("DROP INDEX fldStaIdx");
+  }
+  const std::string unusable = craft("unusable.cvbak", {{"cvdb.edb", readFile(dir_ / "odd.edb")}});
+  for (const auto& bad : {foreign, empty, unusable}) {
     try {
       run(bad);
       FAIL() << bad;
