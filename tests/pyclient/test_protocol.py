@@ -469,6 +469,7 @@ class CfgPartTest(ServerTest):
             "a string": Writer().str("k").bool(False).json_opt('""').bytes(),
             "no data": Writer().str("k").bool(False).json_opt(None).bytes(),
             "not JSON": Writer().str("k").bool(False).json_opt("{x").bytes(),
+            "not UTF-8": Writer().str("k").bool(False).json_opt(b'{"k":"\xff"}').bytes(),
             "delete with data": Writer().str("k").bool(True).json_opt("{}").bytes(),
         }
         for label, payload in cases.items():
@@ -477,6 +478,14 @@ class CfgPartTest(ServerTest):
                 c.send_request(SET_CFG_PART, payload)
                 self.assertBye(c)
                 self.assertEqual(self.client(db).get_cfg_part("k"), {"v": 1})
+
+    def test_keys_are_any_bytes(self) -> None:
+        c = self.client(self.db())
+        key = "a\x00b" + b"\xff\xfe".decode("utf-8", "surrogateescape")
+        c.set_cfg_part(key, {"k": "v"})
+        self.assertEqual(c.get_cfg_part(key), {"k": "v"})
+        self.assertIsNone(c.get_cfg_part("a"))
+        self.assertEqual(c.cfg_ids("a\x00"), [key])
 
     def test_cfg_ids_lists_keys_by_prefix_in_order(self) -> None:
         c = self.client(self.db())
@@ -557,6 +566,22 @@ class PackRecordTest(ServerTest):
             c.get_pack_info("P"),
             complete_pack("P", status=-3, name="renamed", folder="", owner="", doc_count=0, created=-1,
                           modified=1 << 40))
+
+    def test_strings_are_any_bytes(self) -> None:
+        c = self.client(self.db())
+        not_utf8 = "\x00" + b"\xff".decode("utf-8", "surrogateescape")
+        record = complete_pack("p" + not_utf8, folder="f" + not_utf8, name="\x00ü", owner="\x00")
+        c.update_pack_info(record)
+        self.assertEqual(c.get_pack_info("p" + not_utf8), record)
+        self.assertEqual(c.get_pack_infos("f" + not_utf8), [record])
+        self.assertIsNone(c.get_pack_info("p"))
+
+    @unittest.expectedFailure
+    def test_strings_kept_in_the_stored_object_are_any_bytes(self) -> None:
+        # Section 2: a str is "any bytes". Name, owner, host and user that are
+        # not UTF-8 end the connection (the server keeps them in JSON).
+        c = self.client(self.db())
+        c.update_pack_info(complete_pack("p", name=b"\xff".decode("utf-8", "surrogateescape")))
 
     def test_id_length(self) -> None:
         db = self.db()
