@@ -592,7 +592,7 @@ class Client:
                 seen.append(p)
                 yield p
             elif f.kind == KIND_PROGRESS_END:
-                if not f.payload == b"":
+                if f.payload:
                     raise Malformed("ProgressEnd with a payload")
                 if seen and seen[-1].failed:
                     bye = None
