@@ -19,6 +19,7 @@ import os
 import re
 import shutil
 import signal
+import socket
 import sqlite3
 import struct
 import sys
@@ -274,6 +275,19 @@ class FramingTest(ServerTest):
                 # Only the length: the server must judge it before the body.
                 c.send_raw(struct.pack("<I", length))
                 self.assertBye(c, prefix="Malformed frame: ")
+
+
+class AddressTest(ServerTest):
+    def test_ipv6_and_ipv4_loopback(self) -> None:
+        try:
+            probe = socket.socket(socket.AF_INET6, socket.SOCK_STREAM)
+            probe.bind(("::1", 0))
+            probe.close()
+        except OSError:
+            self.skipTest("no IPv6 loopback on this machine")
+        for host in ["::1", "127.0.0.1"]:
+            with self.subTest(host=host), Client(host, self.server.port) as c:
+                c.ping()
 
 
 class MalformedRequestTest(ServerTest):
@@ -925,6 +939,22 @@ class RestoreTest(ServerTest):
         # The session is open again, on the restored database.
         self.assertRestored(c)
 
+    def test_archive_of_another_database(self) -> None:
+        source, target = self.db("_source"), self.db("_target")
+        c = self.client(source)
+        c.set_cfg_part("k", {"from": "source"})
+        c.set_data("X", "f", b"source data")
+        c.backup("copy-" + self.db())
+        c.connect(target)
+        c.set_cfg_part("k", {"from": "target"})
+        c.restore("copy-" + self.db() + ".cvbak")
+        # Into the connection's database, whatever the archive records.
+        self.assertEqual(c.get_cfg_part("k"), {"from": "source"})
+        self.assertEqual(c.get_data("X", "f"), b"source data")
+        c.connect(source)
+        self.assertEqual(c.get_cfg_part("k"), {"from": "source"})
+        self.assertEqual(sorted(n for n in c.db_names() if n.startswith(self.db())), [source, target])
+
     def test_waits_for_the_other_clients(self) -> None:
         name = self.db()
         c = self.prepare(name)
@@ -1016,6 +1046,24 @@ class RestoreTest(ServerTest):
             with self.subTest(name=name):
                 self.assertEqual(self.client(name).get_cfg_part("k"), {"v": name})
         c.ping()
+
+    def test_an_archive_that_records_no_database_goes_by_its_file_name(self) -> None:
+        source, target = self.db("_source"), self.db("-target\\sub")
+        c = self.client(source)
+        c.set_cfg_part("k", {"from": "source"})
+        c.backup()
+        with zipfile.ZipFile(os.path.join(self.server.backup_folder, backup_file_name(database_key(source)))) as real:
+            entries = {i.filename: real.read(i) for i in real.infolist() if i.filename != "originDB.txt"}
+        folder = os.path.join(self.server.backup_folder, "by-file-name-" + self.db())
+        os.makedirs(folder)
+        with zipfile.ZipFile(os.path.join(folder, backup_file_name(database_key(target))), "w", zipfile.ZIP_DEFLATED) as z:
+            for entry, content in entries.items():
+                z.writestr(entry, content)
+        with Client("127.0.0.1", self.server.port) as other:  # closed: the restore waits for its clients
+            other.connect(target)
+            other.set_cfg_part("k", {"from": "target"})
+        c.restore(folder, all=True)
+        self.assertEqual(self.client(target).get_cfg_part("k"), {"from": "source"})
 
     def test_an_archive_naming_a_refused_database_fails(self) -> None:
         name = self.db()
