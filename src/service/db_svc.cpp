@@ -1,6 +1,7 @@
 #include "service/db_svc.h"
 
 #include <memory>
+#include <thread>
 #include <vector>
 
 #include "engine/db_instances.h"
@@ -9,6 +10,7 @@
 #include "ipc/listener.h"
 #include "maintenance/restore_journal.h"
 #include "settings/config.h"
+#include "store/stale_files.h"
 
 namespace DBServer {
 namespace {
@@ -50,6 +52,13 @@ void DBSvc::runSvc() {
     for (const std::string& key : maint::recoverRestores(pool->env(), pool->paths())) {
       unrecovered.push_back(std::make_unique<DB::InstanceForMaintenance>(pool, key, nullptr, true));
     }
+    // Temporary files of data-file writes that a crash cut short go in the
+    // background, beside the clients; the thread ends with the service.
+    // File times are coarser than the clock: a margin keeps a write that
+    // starts right away clear of the line.
+    const auto started = pool->env().now() - std::chrono::seconds(2);
+    std::jthread sweeper(
+        [pool, started](std::stop_token stop) { DB::removeStaleTempFiles(pool->env(), pool->paths(), started, stop); });
     std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
@@ -69,6 +78,8 @@ void DBSvc::runSvc() {
     // The Listener and its server go with the last command that holds them.
     created.reset();
 
+    sweeper.request_stop();
+    sweeper.join();
     unrecovered.clear();
     pool->stop();
     debugLine("Svc stopped");

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "engine/db_exc.h"
+#include "store/stale_files.h"
 #include "store_fixture.h"
 #include "support/log_capture.h"
 
@@ -101,6 +102,26 @@ TEST_F(DataFiles, CopyingAFolderMergesIntoTheTargetAndKeepsTheSource) {
   EXPECT_EQ(messageOf([&] { db.copyDataFolder("none", "other"); }), "Error renaming data folder none to other");
   EXPECT_TRUE(log.contains(Log::Error, "Failed to rename (copy) data folder for none to other. "));
   EXPECT_FALSE(fs::exists(root() + "docs/d/other"));
+}
+
+// Temporary files that interrupted writes left behind go at the start;
+// those of writes younger than the start, and the data files, stay.
+TEST_F(DataFiles, StaleTemporaryFilesOfInterruptedWritesAreRemoved) {
+  auto db = open("s");
+  db->saveDataBlob("data", 4, "doc", "page");
+  const std::string folder = root() + "s/d/doc/";
+  writeFile(folder + ".cvtmp.old123", "half a write");
+  writeFile(folder + ".cvtmp.new456", "running");
+  writeFile(folder + "page.cvtmp.x", "a client's file");
+  const auto start = sys::WallClock::now();
+  env_.setModified(folder + ".cvtmp.old123", start - std::chrono::hours(1));
+  env_.setModified(folder + "page.cvtmp.x", start - std::chrono::hours(1));
+  LogCapture log;
+  const auto report = DB::removeStaleTempFiles(env_, pool()->paths(), start - std::chrono::seconds(2));
+  EXPECT_EQ(report.removed, 1u);
+  EXPECT_EQ(report.bytes, 12u);
+  EXPECT_EQ(entries(folder), (std::vector<std::string>{".cvtmp.new456", "page", "page.cvtmp.x"}));
+  EXPECT_TRUE(log.contains(Log::Notice, "Removed 1 temporary file(s) (12 bytes)"));
 }
 
 }  // namespace

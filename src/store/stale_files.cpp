@@ -1,0 +1,53 @@
+#include "store/stale_files.h"
+
+#include <exception>
+
+#include "framework/log.h"
+#include "store/catalog.h"
+#include "store/db_local.h"
+
+namespace DB {
+
+StaleFilesReport removeStaleTempFiles(sys::Env& env, const Paths& paths, sys::WallClock::time_point before,
+                                      std::stop_token stop) {
+  StaleFilesReport report;
+  std::vector<std::string> keys;
+  try {
+    keys = databaseKeys(env, paths);
+  } catch (const std::exception& e) {
+    Log::Lock(Log::Warning).logStreamLine() << "Stale temporary files: the databases cannot be listed: " << e.what();
+    return report;
+  }
+  for (const std::string& key : keys) {
+    const sys::Path data = paths.dataFolder(key);
+    try {
+      if (env.stat(data).type != sys::FileType::Folder) continue;
+      for (const sys::DirEntry& id : env.list(data)) {
+        if (stop.stop_requested()) return report;
+        if (id.type != sys::FileType::Folder) continue;
+        for (const sys::DirEntry& file : env.list(data / id.name)) {
+          if (file.type != sys::FileType::Regular || !file.name.starts_with(DBLocal::kTempPrefix)) continue;
+          const sys::Path path = data / id.name / file.name;
+          const sys::FileInfo info = env.stat(path);
+          if (info.type != sys::FileType::Regular || info.modified >= before) continue;
+          if (env.remove(path)) {
+            ++report.removed;
+            report.bytes += info.size;
+          }
+        }
+      }
+    } catch (const std::exception& e) {
+      if (g_LogVerbose) {
+        Log::Lock(Log::Debug).logStreamLine()
+            << "Stale temporary files: skipped \"" << data.string() << "\": " << e.what();
+      }
+    }
+  }
+  if (report.removed > 0) {
+    Log::Lock(Log::Notice).logStreamLine() << "Removed " << report.removed << " temporary file(s) (" << report.bytes
+                                           << " bytes) of data-file writes that a stop of the server interrupted";
+  }
+  return report;
+}
+
+}  // namespace DB
