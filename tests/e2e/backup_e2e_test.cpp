@@ -335,7 +335,8 @@ TEST(BackupUnderWriters, TheArchiveHoldsOneMomentOfTheDatabaseAndEveryDataFileWh
     EXPECT_TRUE(inArchive == readFile(file)) << name;
   }
   // Nothing else, apart from the temporary file of a write under way, which
-  // the backup may still catch.
+  // the backup may still catch (Backup.DISABLED_TheTemporaryFileOfAWriteIsLeftOut
+  // in the store tests).
   std::vector<std::string> names;
   for (const auto& e : fs::recursive_directory_iterator(unpacked / "d")) {
     if (!e.is_directory() && !e.path().filename().string().starts_with(".cvtmp.")) {
@@ -496,6 +497,47 @@ TEST(BackupPipelined, RequestsBehindABackupAreAnsweredAfterItsStreamEnds) {
   get.readAnswer(in);
   EXPECT_EQ(seqIn(get.respCfg().dump()), 7);
   expectStandardToolsRead(dir / "piped.cvbak");
+}
+
+// After a failed backup the server ends the connection: a request sent
+// behind it is neither run nor answered, so a client that sees its
+// connection end may take its pipelined write as not done. The outcome
+// depends on how the server's threads meet, so each kind of request is
+// tried 250 times. Disabled while the server still takes the next
+// request between the stream's end and its Bye: today such writes are
+// stored, and reads are answered before the Bye, in some of the tries.
+TEST(BackupPipelined, DISABLED_ARequestBehindAFailedBackupIsNeitherRunNorAnswered) {
+  ServerProcess server(kServer);
+  const std::string db = "piped";
+  clientOf(server, db)->setCfg("layout", part(7));
+
+  // A target in the database's own folder fails the backup.
+  Ipc::DB::Backup backup;
+  backup.setRequest((server.home() / "db" / db / "x.cvbak").string(), false);
+  int answered = 0;
+  for (int attempt = 0; attempt < 500; ++attempt) {
+    std::shared_ptr<Ipc::CmdI> behind;
+    if (attempt % 2 == 0) {
+      auto set = std::make_shared<Ipc::DB::SetCfgPart>();
+      set->setRequest("after-failure-" + std::to_string(attempt), part(1));
+      behind = set;
+    } else {
+      auto get = std::make_shared<Ipc::DB::GetCfgPart>();
+      get->setRequest("layout");
+      behind = get;
+    }
+    SCOPED_TRACE(behind->name() + " " + std::to_string(attempt));
+    auto s = rawConnection(server, db);
+    sendAll(*s, frameOf(backup) + frameOf(*behind));
+    const auto seen = framesUntil(*s, [](const Seen&) { return false; });
+    ASSERT_GE(seen.size(), 3u);
+    EXPECT_EQ(seen.back().kind, wire::FrameKind::Bye);
+    answered += static_cast<int>(
+        std::count_if(seen.begin(), seen.end(), [&](const Seen& f) { return f.tag == behind->tag(); }));
+  }
+  EXPECT_EQ(answered, 0) << "answers to requests behind a failed backup";
+  EXPECT_EQ(clientOf(server, db)->cfgIds("after-failure"), std::vector<std::string>{})
+      << "writes behind a failed backup were stored";
 }
 
 // A server started bound to one CPU (the first this thread may use): its
