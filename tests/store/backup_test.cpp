@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <stop_token>
 
 #include "maintenance/archive_reader.h"
 #include "maintenance/backup.h"
@@ -125,6 +126,54 @@ TEST_F(Backup, AFailureAtAnyFileCallLeavesNothingBehind) {
       EXPECT_FALSE(fs::exists(root() + "db.temp/sales"));
     }
     EXPECT_FALSE(pool()->record("sales")->maintenance);
+  }
+}
+
+// The server's stop reaches a backup through its stop token. Asked at any
+// of its progress messages, the backup ends without completing, the older
+// archive stays as it was, and neither the new archive's temporary file
+// nor the working folder remains; the hold is released.
+TEST_F(Backup, AStopAtAnyProgressMessageKeepsTheOlderArchiveAndLeavesNothingElse) {
+  class StopAt : public DB::DBProgressCallback {
+   public:
+    StopAt(std::size_t at, std::stop_source& stop) : at_(at), stop_(stop) {}
+    void onProgress(std::uint32_t, const std::string&) override {
+      if (seen_++ == at_) stop_.request_stop();
+    }
+
+   private:
+    std::size_t at_;
+    std::size_t seen_ = 0;
+    std::stop_source& stop_;
+  };
+  const fs::path out = dir_ / "out";
+  const std::string target = (out / "s.cvbak").string();
+  const auto texts = run(target);
+  ASSERT_GT(texts.size(), 8u);
+  const std::string older = readFile(target);
+  for (std::size_t at = 0; at < texts.size(); ++at) {
+    SCOPED_TRACE(texts[at]);
+    std::stop_source stop;
+    EXPECT_THROW(db->backup(target, false, std::make_unique<StopAt>(at, stop), stop.get_token()), std::exception);
+    EXPECT_EQ(entries(out), std::vector<std::string>{"s.cvbak"});
+    EXPECT_TRUE(readFile(target) == older);
+    EXPECT_FALSE(fs::exists(root() + "db.temp/sales"));
+    EXPECT_FALSE(pool()->record("sales")->maintenance);
+  }
+  EXPECT_NO_THROW(run(target));  // nothing stays stopped
+}
+
+// The temporary file of a data file being written (the reserved prefix and
+// a unique suffix, beside its target), or one that a crash left in the
+// middle of a write, is no data file: the archive leaves it out, as every
+// other copy of data files does. Disabled while the backup still packs
+// every regular file of the data folder: such a file goes into the archive
+// with whatever part of the write it holds.
+TEST_F(Backup, DISABLED_TheTemporaryFileOfAWriteIsLeftOut) {
+  writeFile(root() + "sales/d/doc/" + std::string(DB::DBLocal::kTempPrefix) + "Ab12Cd", "half of a write");
+  run((dir_ / "out").string() + "/");
+  for (const auto& name : names(dir_ / "out" / "sales.cvbak")) {
+    EXPECT_EQ(name.find(DB::DBLocal::kTempPrefix), std::string::npos) << name;
   }
 }
 
