@@ -45,13 +45,13 @@ class EndOfStream {
 
 // The end of a failed operation: its one failure message at 100, the end
 // of the stream, then the end of the connection (sends after the Bye would
-// be dropped, so the stream ends first).
+// be dropped, so the stream ends first), with no request behind the
+// command taken in between.
 void reportFailure(ProgressCmdsBase& cmd, const std::string& what) noexcept {
   try {
     Log::Lock(Log::Error).logStreamLine() << "Async command " << cmd.name() << " failed with " << what;
     cmd.sendMoreProgress(100, kFailurePrefix + what);
-    cmd.sendNoMoreProgress();
-    cmd.onTransferError(kTerminating);
+    cmd.endStreamAndConnection(kTerminating);
   } catch (...) {
     // Out of memory for the messages: the connection ends with its socket.
   }

@@ -17,14 +17,15 @@ namespace maint {
 namespace {
 
 // The files below folder, recursively in listing order, as (path, entry
-// name) with the name's elements joined by '\' after prefix. Links and
-// other special files are left out.
+// name) with the name's elements joined by '\' after prefix. Links, other
+// special files and the temporary files of data-file writes (a write under
+// way, or one a crash cut short) are left out.
 void collect(sys::Env& env, const sys::Path& folder, const std::string& prefix,
              std::vector<std::pair<sys::Path, std::string>>& out) {
   for (const sys::DirEntry& e : env.list(folder)) {
     if (e.type == sys::FileType::Folder) {
       collect(env, folder / e.name, prefix + e.name + '\\', out);
-    } else if (e.type == sys::FileType::Regular) {
+    } else if (e.type == sys::FileType::Regular && !e.name.starts_with(DB::kDataTempPrefix)) {
       out.emplace_back(folder / e.name, prefix + e.name);
     }
   }

@@ -31,7 +31,11 @@ void ProgressCmdsBase::firstProgressMsg(const std::string& text) { sendProgress(
 
 void ProgressCmdsBase::sendMoreProgress(std::uint32_t percent, const std::string& text) { sendProgress(percent, text); }
 
-void ProgressCmdsBase::sendNoMoreProgress() {
+void ProgressCmdsBase::sendNoMoreProgress() { endStream(nullptr); }
+
+void ProgressCmdsBase::endStreamAndConnection(const std::string& byeReason) { endStream(&byeReason); }
+
+void ProgressCmdsBase::endStream(const std::string* byeReason) {
   sys::MutexLock lock(mutex_);
   if (ended_) return;
   ended_ = true;
@@ -40,6 +44,10 @@ void ProgressCmdsBase::sendNoMoreProgress() {
   wire::beginFrame(frame.head, tag(), wire::FrameKind::ProgressEnd);
   wire::endFrame(frame);
   socket()->send(std::move(frame));
+  // The connection runs these in this order: the end of the stream goes
+  // out, the connection is closing, and only then is the command done, so
+  // no request behind it is taken.
+  if (byeReason) socket()->close(*byeReason);
   socket()->commandDone();
 }
 

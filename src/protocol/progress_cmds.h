@@ -30,6 +30,9 @@ class ProgressCmdsBase : public DbCmdBase {
   void sendMoreProgress(std::uint32_t percent, const std::string& text) EXCLUDES(mutex_);
   // Ends the stream and lets the connection read its next request.
   void sendNoMoreProgress() EXCLUDES(mutex_);
+  // Ends the stream and then the connection (Bye with the reason): requests
+  // the client sent behind the command are neither run nor answered.
+  void endStreamAndConnection(const std::string& byeReason) EXCLUDES(mutex_);
 
   // No Answer frame: the stream is the answer.
   void writeAnswer(wire::Writer&) const override {}
@@ -41,6 +44,8 @@ class ProgressCmdsBase : public DbCmdBase {
 
  private:
   void sendProgress(std::uint32_t percent, const std::string& text) EXCLUDES(mutex_);
+  // byeReason: null to go on with the next request.
+  void endStream(const std::string* byeReason) EXCLUDES(mutex_);
 
   sys::Mutex mutex_;  // orders the frames of concurrent callers
   bool ended_ GUARDED_BY(mutex_) = false;

@@ -21,6 +21,9 @@ inline constexpr const char* kTempSubfolder = "db.temp/";
 inline constexpr const char* kDataSubfolder = "d/";
 inline constexpr const char* kBackupExtension = ".cvbak";
 inline constexpr const char* kOriginFileName = "originDB.txt";
+// Names of the files that a data-file write builds before it renames them
+// into place: never data files themselves.
+inline constexpr std::string_view kDataTempPrefix = ".cvtmp.";
 
 // The database key of a client-given name. Total: every text gives a key.
 std::string folderName(std::string_view name);

@@ -43,6 +43,7 @@
 #include "framework/env.h"
 #include "framework/json.h"
 #include "protocol/pack_info.h"
+#include "settings/names.h"
 
 namespace DB {
 
@@ -122,7 +123,7 @@ class DBLocal {
 
   // Names of the files that a write builds before it renames them into
   // place.
-  static constexpr std::string_view kTempPrefix = ".cvtmp.";
+  static constexpr std::string_view kTempPrefix = kDataTempPrefix;
 
   // ---- Pack records (pack_records.cpp) and pack use (pack_use.cpp) -------
   // A pack is one row of "info" (id, folder, status, and a JSON object with

@@ -334,9 +334,8 @@ TEST(BackupUnderWriters, TheArchiveHoldsOneMomentOfTheDatabaseAndEveryDataFileWh
     const std::string inArchive = readFile(unpacked / "d" / "ballast" / file.filename());
     EXPECT_TRUE(inArchive == readFile(file)) << name;
   }
-  // Nothing else, apart from the temporary file of a write under way, which
-  // the backup may still catch (Backup.DISABLED_TheTemporaryFileOfAWriteIsLeftOut
-  // in the store tests).
+  // Nothing else (temporary files of writes under way are left out:
+  // Backup.TheTemporaryFileOfAWriteIsLeftOut in the store tests).
   std::vector<std::string> names;
   for (const auto& e : fs::recursive_directory_iterator(unpacked / "d")) {
     if (!e.is_directory() && !e.path().filename().string().starts_with(".cvtmp.")) {
@@ -503,10 +502,8 @@ TEST(BackupPipelined, RequestsBehindABackupAreAnsweredAfterItsStreamEnds) {
 // behind it is neither run nor answered, so a client that sees its
 // connection end may take its pipelined write as not done. The outcome
 // depends on how the server's threads meet, so each kind of request is
-// tried 250 times. Disabled while the server still takes the next
-// request between the stream's end and its Bye: today such writes are
-// stored, and reads are answered before the Bye, in some of the tries.
-TEST(BackupPipelined, DISABLED_ARequestBehindAFailedBackupIsNeitherRunNorAnswered) {
+// tried 250 times.
+TEST(BackupPipelined, ARequestBehindAFailedBackupIsNeitherRunNorAnswered) {
   ServerProcess server(kServer);
   const std::string db = "piped";
   clientOf(server, db)->setCfg("layout", part(7));

@@ -166,10 +166,8 @@ TEST_F(Backup, AStopAtAnyProgressMessageKeepsTheOlderArchiveAndLeavesNothingElse
 // The temporary file of a data file being written (the reserved prefix and
 // a unique suffix, beside its target), or one that a crash left in the
 // middle of a write, is no data file: the archive leaves it out, as every
-// other copy of data files does. Disabled while the backup still packs
-// every regular file of the data folder: such a file goes into the archive
-// with whatever part of the write it holds.
-TEST_F(Backup, DISABLED_TheTemporaryFileOfAWriteIsLeftOut) {
+// other copy of data files does.
+TEST_F(Backup, TheTemporaryFileOfAWriteIsLeftOut) {
   writeFile(root() + "sales/d/doc/" + std::string(DB::DBLocal::kTempPrefix) + "Ab12Cd", "half of a write");
   run((dir_ / "out").string() + "/");
   for (const auto& name : names(dir_ / "out" / "sales.cvbak")) {
