@@ -1,5 +1,7 @@
 #include "framework/json.h"
 
+#include "framework/utf8.h"
+
 #include <jansson.h>
 
 #include <cstdlib>
@@ -195,33 +197,12 @@ bool isUtf8(std::string_view text) noexcept {
   const auto* p = reinterpret_cast<const unsigned char*>(text.data());
   const auto* end = p + text.size();
   while (p < end) {
-    const unsigned c = *p;
-    if (c < 0x80) {
+    if (*p < 0x80) {
       ++p;
       continue;
     }
-    // Length of the sequence and the range its second byte must lie in
-    // (which excludes overlong forms, surrogates and values past U+10FFFF).
-    std::size_t n = 0;
-    unsigned lo = 0x80, hi = 0xBF;
-    if (c >= 0xC2 && c <= 0xDF) {
-      n = 2;
-    } else if (c >= 0xE0 && c <= 0xEF) {
-      n = 3;
-      if (c == 0xE0) lo = 0xA0;
-      if (c == 0xED) hi = 0x9F;
-    } else if (c >= 0xF0 && c <= 0xF4) {
-      n = 4;
-      if (c == 0xF0) lo = 0x90;
-      if (c == 0xF4) hi = 0x8F;
-    } else {
-      return false;
-    }
-    if (static_cast<std::size_t>(end - p) < n) return false;
-    if (p[1] < lo || p[1] > hi) return false;
-    for (std::size_t i = 2; i < n; ++i) {
-      if (p[i] < 0x80 || p[i] > 0xBF) return false;
-    }
+    const std::size_t n = utf8::sequenceLength(p, end);
+    if (n == 0) return false;
     p += n;
   }
   return true;

@@ -1,5 +1,7 @@
 #include "framework/log.h"
 
+#include "framework/utf8.h"
+
 #include <spdlog/logger.h>
 #include <spdlog/sinks/rotating_file_sink.h>
 #include <spdlog/sinks/stdout_sinks.h>
@@ -93,32 +95,6 @@ std::shared_ptr<spdlog::logger> currentLogger() {
   return s.logger;
 }
 
-// Length of the well-formed UTF-8 sequence of two or more bytes at p (0
-// when there is none).
-std::size_t utf8Length(const unsigned char* p, const unsigned char* end) {
-  const unsigned c = *p;
-  std::size_t n = 0;
-  unsigned lo = 0x80, hi = 0xBF;
-  if (c >= 0xC2 && c <= 0xDF) {
-    n = 2;
-  } else if (c >= 0xE0 && c <= 0xEF) {
-    n = 3;
-    if (c == 0xE0) lo = 0xA0;
-    if (c == 0xED) hi = 0x9F;
-  } else if (c >= 0xF0 && c <= 0xF4) {
-    n = 4;
-    if (c == 0xF0) lo = 0x90;
-    if (c == 0xF4) hi = 0x8F;
-  } else {
-    return 0;
-  }
-  if (static_cast<std::size_t>(end - p) < n || p[1] < lo || p[1] > hi) return 0;
-  for (std::size_t i = 2; i < n; ++i) {
-    if (p[i] < 0x80 || p[i] > 0xBF) return 0;
-  }
-  return n;
-}
-
 }  // namespace
 
 std::string printable(std::string_view text) {
@@ -135,7 +111,7 @@ std::string printable(std::string_view text) {
       ++p;
       continue;
     }
-    if (const std::size_t n = c >= 0x80 ? utf8Length(p, end) : 0) {
+    if (const std::size_t n = c >= 0x80 ? utf8::sequenceLength(p, end) : 0) {
       out.append(reinterpret_cast<const char*>(p), n);
       p += n;
       continue;

@@ -1,5 +1,7 @@
 #include "store/stored_record_reader.h"
 
+#include "framework/utf8.h"
+
 #include <locale.h>
 
 // The parser's SIMD scans of strings and whitespace; SSE2 is part of every
@@ -113,28 +115,9 @@ bool plainUtf8(const unsigned char* p, const unsigned char* end) {
       ++p;
       continue;
     }
-    // Continuation bytes after the first; the first of them has a narrower
-    // range for E0, ED, F0 and F4.
-    std::ptrdiff_t more = 0;
-    unsigned lo = 0x80, hi = 0xBF;
-    if (c >= 0xC2 && c <= 0xDF) {
-      more = 1;
-    } else if (c >= 0xE0 && c <= 0xEF) {
-      more = 2;
-      if (c == 0xE0) lo = 0xA0;
-      if (c == 0xED) hi = 0x9F;
-    } else if (c >= 0xF0 && c <= 0xF4) {
-      more = 3;
-      if (c == 0xF0) lo = 0x90;
-      if (c == 0xF4) hi = 0x8F;
-    } else {
-      return false;
-    }
-    if (end - p <= more || p[1] < lo || p[1] > hi) return false;
-    for (std::ptrdiff_t i = 2; i <= more; ++i) {
-      if ((p[i] & 0xC0) != 0x80) return false;
-    }
-    p += more + 1;
+    const std::size_t n = utf8::sequenceLength(p, end);
+    if (n == 0) return false;
+    p += n;
   }
   return true;
 }
