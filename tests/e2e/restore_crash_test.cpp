@@ -1,15 +1,19 @@
-// Restores cut short by SIGKILL at random moments. Each round starts a
-// restore on the real server (of one database, or of a folder of archives
-// with --all), kills the server with SIGKILL after a random delay, starts it
-// again on the same database root, and checks that every database holds
-// exactly what it held before the restore or exactly what its archive
-// holds (read back through the client and from its data folder), that its
-// database file passes SQLite's integrity check, and that nothing of the
-// restore is left behind.
+// Restores cut short at random moments. Each round starts a restore on the
+// real server (of one database, or of a folder of archives with --all),
+// kills the server with SIGKILL after a random delay (every fourth round
+// also the next start, while it recovers), starts it again on the same
+// database root, and checks that every database holds exactly what it held
+// before the restore or exactly what its archive holds (read back through
+// the client and from its data folder), that a restore that answered
+// success has committed, that its database file passes SQLite's integrity
+// check, and that nothing of the restore is left behind. A few rounds stop
+// the server with SIGTERM instead: it must end cleanly, with the same
+// guarantees.
 //
-// CVDB_CRASH_ROUNDS sets the number of rounds (20 by default);
-// CVDB_CRASH_SEED replays the kill moments of an earlier run, whose seed
-// the run prints first.
+// CVDB_CRASH_ROUNDS sets the number of rounds (20 killed, 4 stopped by
+// default); CVDB_CRASH_SEED replays the random moments of an earlier run,
+// whose seed each test prints first. tests/soak/restore-crash-soak.sh runs
+// 200 rounds.
 
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -198,24 +202,247 @@ struct Database {
   int current = 1;     // the state it holds between rounds
 };
 
+// What the restore thread saw.
+struct Attempt {
+  std::mutex mutex;
+  std::condition_variable changed;
+  std::optional<Clock::time_point> placing;  // "Metadata restore started..." arrived
+  bool finished = false;
+  bool succeeded = false;
+  std::string error;  // how the restore failed, other than by the connection ending
+  std::string ended;  // how the connection ended
+};
+
+// Three databases: the main one, which every round restores, with some MB
+// of data files and packs (unpacking and placing them takes long enough
+// for kills to land inside); a second one that restores of the folder
+// (--all) restore with it; and one that no restore names.
 class RestoreCrash : public ::testing::Test {
  protected:
+  RestoreCrash()
+      : dbs_{
+            {"crash\\main", "crash_main.cvbak", {20, 24, 96 << 10, 16, 384 << 10}, true, {}},
+            {"crash\\second", "crash_second.cvbak", {6, 4, 32 << 10, 4, 64 << 10}, true, {}},
+            {"bystander", "bystander.cvbak", {4, 2, 8 << 10, 2, 16 << 10}, false, {}},
+        } {}
+
+  // Reads the round count and the seed, builds both states of every
+  // database with their archives (the main database ends in state B), and
+  // times one clean restore of each kind.
+  void prepare(int defaultRounds) {
+    rounds_ = static_cast<int>(envNumber("CVDB_CRASH_ROUNDS").value_or(defaultRounds));
+    seed_ = envNumber("CVDB_CRASH_SEED").value_or(std::random_device{}());
+    std::cout << "[ restore crash ] " << rounds_ << " rounds, seed " << seed_ << " (CVDB_CRASH_SEED=" << seed_
+              << " replays the kill moments)" << std::endl;
+    RecordProperty("seed", std::to_string(seed_));
+    rng_.seed(seed_);
+
+    const auto began = Clock::now();
+    server_ = start();
+    startup_ = std::chrono::duration_cast<Ms>(Clock::now() - began);
+    auto c = clientOf(*server_);
+    for (std::size_t i = 0; i < dbs_.size(); ++i) {
+      Database& d = dbs_[i];
+      ASSERT_TRUE(c->connect(d.name));
+      writeA(*c, d.shape, i * 1000);
+      d.states[0] = readState(*c, d.shape, folderOf(d));
+      if (d.restoredByAll) c->backup("A/", false);
+      // The archive of the main database alone, for the single restores.
+      if (i == 0) c->backup("single/", false);
+      changeToB(*c, d.shape, i * 1000);
+      d.states[1] = readState(*c, d.shape, folderOf(d));
+      if (d.restoredByAll) c->backup("B/", false);
+      ASSERT_NE(d.states[0], d.states[1]);
+    }
+    c.reset();
+    // The single restores go to state A with the main database's own
+    // archive, back to B with a copy of B's.
+    fs::create_directories(root() / "db.backup" / "singleB");
+    fs::copy_file(root() / "db.backup" / "B" / main().backupFile, root() / "db.backup" / "singleB" / main().backupFile);
+
+    // Calibration: one clean restore of each kind, timed as a whole and
+    // from the moment the archive's database file starts to be placed.
+    for (const bool all : {false, true}) {
+      auto restorer = clientOf(*server_, main().name);
+      const int to = all ? 1 : 0;
+      Attempt a;
+      const auto from = Clock::now();
+      launch(*restorer, all, to, a).join();
+      ASSERT_TRUE(a.succeeded) << a.error;
+      ASSERT_TRUE(a.placing.has_value());
+      timing_[all].total = std::chrono::duration_cast<Ms>(Clock::now() - from);
+      timing_[all].tail = std::chrono::duration_cast<Ms>(Clock::now() - *a.placing);
+      for (auto& d : dbs_) {
+        if (all ? d.restoredByAll : &d == &main()) d.current = to;
+        const State now = read(*restorer, d);
+        ASSERT_EQ(now, d.states[d.current]) << d.name << "\n" << differences(now, d.states[d.current]);
+      }
+    }
+    std::cout << "[ restore crash ] the server starts in " << startup_.count()
+              << " ms; a clean restore of one database takes " << timing_[0].total.count() << " ms ("
+              << timing_[0].tail.count() << " ms from placing its database file), of the folder "
+              << timing_[1].total.count() << " ms (" << timing_[1].tail.count() << " ms)" << std::endl;
+  }
+
+  // One round: a restore of the main database (or of the folder) towards
+  // its other state, interrupted by signal after a random delay; with
+  // stopRecovery, the next start is killed too, at a random moment of its
+  // first milliseconds, where the recovery runs. Then the server starts
+  // again and every database is checked.
+  void round(int n, int signal, bool stopRecovery) {
+    const int to = 1 - main().current;
+    const bool all = rng_() % 2 == 0;
+    // Half the delays count from the moment the database file starts to
+    // be placed: the part of the restore that changes the database.
+    const bool tail = rng_() % 2 == 0;
+    const Ms span = tail ? timing_[all].tail : timing_[all].total;
+    const Ms delay{std::uniform_int_distribution<std::int64_t>(0, span.count() * 6 / 5)(rng_)};
+    const Ms recoveryDelay{std::uniform_int_distribution<std::int64_t>(0, startup_.count())(rng_)};
+    std::string what = std::string(all ? "restore --all" : "restore") + " towards state " + "AB"[to] + ", " +
+                       (signal == SIGKILL ? "kill " : "SIGTERM ") + std::to_string(delay.count()) + " ms after " +
+                       (tail ? "placing began" : "the request");
+    if (stopRecovery) what += ", the next start killed after " + std::to_string(recoveryDelay.count()) + " ms";
+    SCOPED_TRACE("round " + std::to_string(n) + " of seed " + std::to_string(seed_) + ": " + what);
+
+    Attempt a;
+    auto restorer = clientOf(*server_, main().name);
+    const auto began = Clock::now();
+    std::thread restoring = launch(*restorer, all, to, a);
+    {
+      std::unique_lock lock(a.mutex);
+      if (tail) a.changed.wait_for(lock, std::chrono::minutes(2), [&] { return a.placing || a.finished; });
+      const auto from = tail && a.placing ? *a.placing : began;
+      a.changed.wait_until(lock, from + delay, [&] { return a.finished; });
+    }
+    if (signal == SIGKILL) {
+      EXPECT_EQ(server_->stop(SIGKILL), 128 + SIGKILL);
+    } else {
+      // A stop waits for the restore, or has it stop before it changes
+      // anything, and ends cleanly.
+      EXPECT_EQ(server_->stop(signal), 0);
+    }
+    restoring.join();
+    restorer.reset();
+    if (signal == SIGKILL || a.error.find("stopping") == std::string::npos) {
+      EXPECT_EQ(a.error, "");
+    }
+    if (!a.succeeded && !a.error.empty()) what += " (the restore answered: " + a.error + ")";
+    if (signal != SIGKILL && !a.ended.empty()) what += " (" + a.ended + ")";
+
+    std::size_t rolledBack = 0, finished = 0;
+    if (stopRecovery) {
+      ServerOptions o = options();
+      o.waitUntilListening = false;
+      ServerProcess recovering(kServer, o);
+      std::this_thread::sleep_for(recoveryDelay);  // the kill's random moment
+      recovering.stop(SIGKILL);
+      rolledBack += recovering.countLogLines(kRolledBack);
+      finished += recovering.countLogLines(kFinished);
+      if (rolledBack + finished > 0) what += " (its recovery had finished)";
+      EXPECT_EQ(recovering.countLogLines("Critical"), 0u);
+    }
+    server_ = start();
+    rolledBack += server_->countLogLines(kRolledBack);
+    finished += server_->countLogLines(kFinished);
+    EXPECT_EQ(server_->countLogLines("Critical"), 0u);
+    EXPECT_EQ(server_->countLogLines("Restore recovery:"), 0u);  // a held file that could not go back
+    EXPECT_EQ(leftovers(), std::vector<std::string>{});
+
+    int changed = 0;
+    auto check = clientOf(*server_);
+    for (auto& d : dbs_) {
+      SCOPED_TRACE(d.name);
+      try {
+        RawDb raw(folderOf(d) / "cvdb.edb");
+        EXPECT_EQ(raw.value("PRAGMA integrity_check"), "ok");
+      } catch (const std::exception& e) {
+        ADD_FAILURE() << e.what();
+      }
+      const State now = read(*check, d);
+      const bool restoredHere = all ? d.restoredByAll : &d == &main();
+      const bool isPrevious = now == d.states[d.current];
+      const bool isRestored = restoredHere && now == d.states[to];
+      // A restore that answered success has committed every database.
+      const bool ok = a.succeeded && restoredHere ? isRestored : isPrevious || isRestored;
+      if (!ok) {
+        ADD_FAILURE() << "neither the previous state "
+                      << "AB"[d.current]
+                      << (restoredHere ? std::string(" nor the restored state ") + "AB"[to] : std::string())
+                      << (a.succeeded ? " (the restore had answered success)" : "") << "; against the previous:\n"
+                      << differences(now, d.states[d.current]) << "against the other:\n"
+                      << differences(now, d.states[1 - d.current]);
+      }
+      if (isRestored && d.current != to) ++changed;
+      if (now == d.states[1 - d.current]) d.current = 1 - d.current;
+    }
+    const std::string outcome = std::string(a.succeeded      ? "answered before the signal"
+                                            : rolledBack > 0 ? "rolled back at the start"
+                                            : finished > 0   ? "finished at the start"
+                                                             : "nothing to recover at the start") +
+                                ", " + std::to_string(changed) + " of " + std::to_string(all ? 2 : 1) +
+                                " databases changed";
+    ++outcomes_[outcome];
+    std::cout << "[ restore crash ] round " << n << ": " << what << ": " << outcome << std::endl;
+  }
+
+  void summary() const {
+    std::cout << "[ restore crash ] seed " << seed_ << ", " << rounds_ << " rounds:";
+    for (const auto& [outcome, count] : outcomes_) std::cout << " " << count << " " << outcome << ";";
+    std::cout << std::endl;
+  }
+
+  Database& main() { return dbs_[0]; }
   fs::path root() const { return dir_ / "db"; }
   fs::path folderOf(const Database& d) const {
-    fs::path f = root();
     std::string key = d.name;
     std::replace(key.begin(), key.end(), '\\', '/');
-    return f / key;
+    return root() / key;
   }
 
-  std::unique_ptr<ServerProcess> start() {
-    fs::create_directories(root());
+  ServerOptions options() const {
     ServerOptions o;
     o.configJson = R"({"ServerPort": 0, "DBRoot": ")" + root().string() + R"(/"})";
-    return std::make_unique<ServerProcess>(kServer, o);
+    return o;
+  }
+  std::unique_ptr<ServerProcess> start() {
+    fs::create_directories(root());
+    return std::make_unique<ServerProcess>(kServer, options());
   }
 
-  // The database's content now, read through a client of server.
+  // Starts a restore towards state `to` on the client's connection (bound
+  // to the main database) in a thread of its own.
+  std::thread launch(cvdb::Client& c, bool all, int to, Attempt& a) {
+    const std::string target =
+        all ? std::string(to == 0 ? "A/" : "B/") : std::string(to == 0 ? "single/" : "singleB/") + main().backupFile;
+    return std::thread([&c, all, target, &a] {
+      try {
+        c.restore(target, all, [&a](std::uint32_t, const std::string& text) {
+          if (text.starts_with("Metadata restore started")) {
+            std::lock_guard lock(a.mutex);
+            if (!a.placing) a.placing = Clock::now();
+            a.changed.notify_all();
+          }
+        });
+        std::lock_guard lock(a.mutex);
+        a.succeeded = true;
+      } catch (const cvdb::OperationFailed& e) {
+        std::lock_guard lock(a.mutex);
+        a.error = e.what();
+      } catch (const cvdb::ConnectionEnded& e) {
+        // The signal.
+        std::lock_guard lock(a.mutex);
+        a.ended = e.what();
+      } catch (const std::exception& e) {
+        std::lock_guard lock(a.mutex);
+        a.error = e.what();
+      }
+      std::lock_guard lock(a.mutex);
+      a.finished = true;
+      a.changed.notify_all();
+    });
+  }
+
+  // The database's content now, read through a client of the server.
   State read(cvdb::Client& c, const Database& d) {
     EXPECT_TRUE(c.connect(d.name, 1)) << d.name;
     return readState(c, d.shape, folderOf(d));
@@ -224,9 +451,9 @@ class RestoreCrash : public ::testing::Test {
   // What a restore may leave that the database itself is not: files beside
   // the database file and its write-ahead log, other folders beside the
   // data folder, working folders below db.temp.
-  std::vector<std::string> leftovers(const std::vector<Database>& dbs) {
+  std::vector<std::string> leftovers() {
     std::vector<std::string> out;
-    for (const auto& d : dbs) {
+    for (const auto& d : dbs_) {
       if (!fs::is_directory(folderOf(d))) {
         out.push_back("(missing) " + folderOf(d).string());
         continue;
@@ -244,188 +471,36 @@ class RestoreCrash : public ::testing::Test {
     return out;
   }
 
-  TempDir dir_;
-};
+  static constexpr const char* kRolledBack = "was interrupted; its previous files were put back";
+  static constexpr const char* kFinished = "had completed before the server stopped";
 
-// What the restore thread saw.
-struct Attempt {
-  std::mutex mutex;
-  std::condition_variable changed;
-  std::optional<Clock::time_point> placing;  // "Metadata restore started..." arrived
-  bool finished = false;
-  bool succeeded = false;
-  std::string error;  // a failure other than the connection ending
+  TempDir dir_;
+  std::vector<Database> dbs_;
+  std::unique_ptr<ServerProcess> server_;
+  int rounds_ = 0;
+  std::uint64_t seed_ = 0;
+  std::mt19937_64 rng_;
+  Ms startup_{0};
+  struct {
+    Ms total{0};
+    Ms tail{0};                          // from "Metadata restore started..." to the end
+  } timing_[2];                          // one database, the folder
+  std::map<std::string, int> outcomes_;  // how the signals landed
 };
 
 TEST_F(RestoreCrash, EveryDatabaseIsItsPreviousOrItsRestoredStateAfterAKillAtAnyMoment) {
-  const int rounds = static_cast<int>(envNumber("CVDB_CRASH_ROUNDS").value_or(20));
-  const std::uint64_t seed = envNumber("CVDB_CRASH_SEED").value_or(std::random_device{}());
-  std::cout << "[ restore crash ] " << rounds << " rounds, seed " << seed << " (CVDB_CRASH_SEED=" << seed
-            << " replays the kill moments)" << std::endl;
-  RecordProperty("seed", std::to_string(seed));
-  std::mt19937_64 rng(seed);
-
-  // Some MB of data files and packs in the database every round restores:
-  // unpacking and placing them takes long enough for kills to land inside.
-  std::vector<Database> dbs{
-      {"crash\\main", "crash_main.cvbak", {20, 24, 96 << 10, 16, 384 << 10}, true, {}},
-      {"crash\\second", "crash_second.cvbak", {6, 4, 32 << 10, 4, 64 << 10}, true, {}},
-      {"bystander", "bystander.cvbak", {4, 2, 8 << 10, 2, 16 << 10}, false, {}},
-  };
-  Database& primary = dbs[0];
-
-  auto server = start();
-  {
-    auto c = clientOf(*server);
-    for (std::size_t i = 0; i < dbs.size(); ++i) {
-      ASSERT_TRUE(c->connect(dbs[i].name));
-      writeA(*c, dbs[i].shape, i * 1000);
-      dbs[i].states[0] = readState(*c, dbs[i].shape, folderOf(dbs[i]));
-      if (dbs[i].restoredByAll) c->backup("A/", false);
-      // The archive of one database alone, restored by the single rounds.
-      if (i == 0) c->backup("single/", false);
-      changeToB(*c, dbs[i].shape, i * 1000);
-      dbs[i].states[1] = readState(*c, dbs[i].shape, folderOf(dbs[i]));
-      if (dbs[i].restoredByAll) c->backup("B/", false);
-      ASSERT_NE(dbs[i].states[0], dbs[i].states[1]);
-    }
+  ASSERT_NO_FATAL_FAILURE(prepare(20));
+  for (int n = 1; n <= rounds_ && !HasFailure(); ++n) {
+    // Every fourth round the recovery itself is cut short.
+    round(n, SIGKILL, rng_() % 4 == 0);
   }
-  // The single rounds restore state A of the main database from its own
-  // archive; for the way back a copy of B's archive lies beside it.
-  fs::create_directories(root() / "db.backup" / "singleB");
-  fs::copy_file(root() / "db.backup" / "B" / primary.backupFile, root() / "db.backup" / "singleB" / primary.backupFile);
+  summary();
+}
 
-  // Starts a restore towards state `to` on the client's connection (bound
-  // to the main database) in a thread of its own.
-  const auto launch = [&](cvdb::Client& c, bool all, int to, Attempt& a) {
-    const std::string target =
-        all ? std::string(to == 0 ? "A/" : "B/") : std::string(to == 0 ? "single/" : "singleB/") + primary.backupFile;
-    return std::thread([&c, all, target, &a] {
-      try {
-        c.restore(target, all, [&a](std::uint32_t, const std::string& text) {
-          if (text.starts_with("Metadata restore started")) {
-            std::lock_guard lock(a.mutex);
-            if (!a.placing) a.placing = Clock::now();
-            a.changed.notify_all();
-          }
-        });
-        std::lock_guard lock(a.mutex);
-        a.succeeded = true;
-      } catch (const cvdb::ConnectionEnded&) {
-        // The kill.
-      } catch (const std::exception& e) {
-        std::lock_guard lock(a.mutex);
-        a.error = e.what();
-      }
-      std::lock_guard lock(a.mutex);
-      a.finished = true;
-      a.changed.notify_all();
-    });
-  };
-
-  // Calibration: one clean restore of each kind, timed as a whole and from
-  // the moment the archive's database file starts to be placed.
-  struct Timing {
-    Ms total{0};
-    Ms tail{0};  // from "Metadata restore started..." to the end
-  } timing[2];
-  for (const bool all : {false, true}) {
-    auto c = clientOf(*server, primary.name);
-    const int to = all ? 1 : 0;
-    Attempt a;
-    const auto began = Clock::now();
-    launch(*c, all, to, a).join();
-    ASSERT_TRUE(a.succeeded) << a.error;
-    ASSERT_TRUE(a.placing.has_value());
-    timing[all].total = std::chrono::duration_cast<Ms>(Clock::now() - began);
-    timing[all].tail = std::chrono::duration_cast<Ms>(Clock::now() - *a.placing);
-    for (auto& d : dbs) {
-      if (all ? d.restoredByAll : &d == &primary) d.current = to;
-      const State now = read(*c, d);
-      EXPECT_EQ(now, d.states[d.current]) << d.name << "\n" << differences(now, d.states[d.current]);
-    }
-  }
-  std::cout << "[ restore crash ] a clean restore of one database takes " << timing[0].total.count() << " ms ("
-            << timing[0].tail.count() << " ms from placing its database file), of the folder "
-            << timing[1].total.count() << " ms (" << timing[1].tail.count() << " ms)" << std::endl;
-
-  // How the kills landed, over every round.
-  std::map<std::string, int> outcomes;
-  for (int round = 1; round <= rounds; ++round) {
-    // Towards the other state of the main database; half the rounds
-    // restore the whole folder, half aim at the part after unpacking.
-    const int to = 1 - primary.current;
-    const bool all = rng() % 2 == 0;
-    const bool tail = rng() % 2 == 0;
-    const Ms span = tail ? timing[all].tail : timing[all].total;
-    const Ms delay{std::uniform_int_distribution<std::int64_t>(0, span.count() * 6 / 5)(rng)};
-    const std::string what = std::string(all ? "restore --all" : "restore") + " towards state " + "AB"[to] + ", kill " +
-                             std::to_string(delay.count()) + " ms after " + (tail ? "placing began" : "the request");
-    SCOPED_TRACE("round " + std::to_string(round) + " of seed " + std::to_string(seed) + ": " + what);
-
-    Attempt a;
-    auto c = clientOf(*server, primary.name);
-    const auto began = Clock::now();
-    std::thread restoring = launch(*c, all, to, a);
-    {
-      std::unique_lock lock(a.mutex);
-      if (tail) a.changed.wait_for(lock, std::chrono::minutes(2), [&] { return a.placing || a.finished; });
-      const auto from = tail && a.placing ? *a.placing : began;
-      a.changed.wait_until(lock, from + delay, [&] { return a.finished; });
-    }
-    EXPECT_EQ(server->stop(SIGKILL), 128 + SIGKILL);
-    restoring.join();
-    c.reset();
-    EXPECT_EQ(a.error, "");
-
-    server = start();
-    const auto rolledBack = server->countLogLines("was interrupted; its previous files were put back");
-    const auto finished = server->countLogLines("had completed before the server stopped");
-    EXPECT_EQ(server->countLogLines("Critical"), 0u);
-    EXPECT_EQ(server->countLogLines("Restore recovery:"), 0u);  // a held file that could not go back
-    EXPECT_EQ(leftovers(dbs), std::vector<std::string>{});
-
-    int changed = 0;
-    auto check = clientOf(*server);
-    for (auto& d : dbs) {
-      SCOPED_TRACE(d.name);
-      try {
-        RawDb raw(folderOf(d) / "cvdb.edb");
-        EXPECT_EQ(raw.value("PRAGMA integrity_check"), "ok");
-      } catch (const std::exception& e) {
-        ADD_FAILURE() << e.what();
-      }
-      const State now = read(*check, d);
-      const bool restoredHere = all ? d.restoredByAll : &d == &primary;
-      const bool isPrevious = now == d.states[d.current];
-      const bool isRestored = restoredHere && now == d.states[to];
-      // A restore that answered success has committed every database.
-      const bool ok = a.succeeded && restoredHere ? isRestored : isPrevious || isRestored;
-      if (!ok) {
-        ADD_FAILURE() << "neither the previous state "
-                      << "AB"[d.current]
-                      << (restoredHere ? std::string(" nor the restored state ") + "AB"[to] : std::string())
-                      << (a.succeeded ? " (the restore had answered success)" : "") << "; against the previous:\n"
-                      << differences(now, d.states[d.current]) << "against the other:\n"
-                      << differences(now, d.states[1 - d.current]);
-      }
-      if (isRestored && d.current != to) ++changed;
-      if (now == d.states[1 - d.current]) d.current = 1 - d.current;
-    }
-    const int aimedAt = all ? 2 : 1;
-    const std::string outcome = std::string(a.succeeded      ? "answered before the kill"
-                                            : rolledBack > 0 ? "rolled back at the start"
-                                            : finished > 0   ? "finished at the start"
-                                                             : "nothing to recover at the start") +
-                                ", " + std::to_string(changed) + " of " + std::to_string(aimedAt) +
-                                " databases changed";
-    ++outcomes[outcome];
-    std::cout << "[ restore crash ] round " << round << ": " << what << ": " << outcome << std::endl;
-    if (HasFailure()) break;
-  }
-  std::cout << "[ restore crash ] seed " << seed << ", " << rounds << " rounds:";
-  for (const auto& [outcome, count] : outcomes) std::cout << " " << count << " " << outcome << ";";
-  std::cout << std::endl;
+TEST_F(RestoreCrash, AStopDuringARestoreEndsCleanlyWithThePreviousOrTheRestoredState) {
+  ASSERT_NO_FATAL_FAILURE(prepare(4));
+  for (int n = 1; n <= rounds_ && !HasFailure(); ++n) round(n, SIGTERM, false);
+  summary();
 }
 
 }  // namespace

@@ -1,10 +1,10 @@
 #!/usr/bin/env bash
 # The restore crash test as a soak run, outside CI: ROUNDS rounds (default
-# 200) of a restore killed with SIGKILL at a random moment, the server
-# started again on the same root and every database checked, repeated
-# REPEAT times (default 1) with a fresh seed each time. Each run prints its
-# seed and how every round's kill landed; the script stops at the first
-# failing run.
+# 200) of a restore killed with SIGKILL at a random moment, and as many
+# stopped with SIGTERM, the server started again on the same root and every
+# database checked each time; repeated REPEAT times (default 1) with a
+# fresh seed each time. Each test prints its seed and how every round's
+# signal landed; the script stops at the first failing run.
 #
 #   tests/soak/restore-crash-soak.sh [build-dir]      (default: build)
 #
