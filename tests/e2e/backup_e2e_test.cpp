@@ -86,7 +86,6 @@ struct Version {
   std::uint32_t writer = 0;
   std::uint32_t file = 0;
   std::uint32_t seq = 0;
-  friend bool operator==(const Version&, const Version&) = default;
 };
 
 constexpr std::size_t kHead = 20;  // "CVBK", writer, file, seq, length
