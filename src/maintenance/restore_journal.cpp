@@ -127,13 +127,17 @@ void moveBack(sys::Env& env, const sys::Path& holding, const sys::Path& target) 
   if (held.empty()) return;
   for (const sys::Path& level : env.createFolders(target)) env.syncFolder(level.parent_path());
   for (const sys::DirEntry& e : held) {
-    if (env.stat(target / e.name).type != sys::FileType::Missing) {
-      Log::Lock(Log::Error).logStreamLine()
-          << "Restore recovery: \"" << (target / e.name).string() << "\" exists; its previous version stays in \""
-          << (holding / e.name).string() << '"';
-      continue;
+    sys::Path to = target / e.name;
+    if (env.stat(to).type != sys::FileType::Missing) {
+      // Something else wrote that name meanwhile. The previous file comes
+      // back under a name of its own rather than go with the working folder.
+      for (int n = 1; env.stat(to).type != sys::FileType::Missing; ++n) {
+        to = target / (e.name + ".before-restore" + (n > 1 ? "." + std::to_string(n) : ""));
+      }
+      Log::Lock(Log::Error).logStreamLine() << "Restore recovery: \"" << (target / e.name).string()
+                                            << "\" exists; its previous version is kept as \"" << to.string() << '"';
     }
-    env.rename(holding / e.name, target / e.name);
+    env.rename(holding / e.name, to);
   }
   env.syncFolder(target);
 }

@@ -92,8 +92,10 @@ JournalRecord readRestoreJournal(sys::Env& env, const DB::Paths& paths, const sy
 void rollBack(sys::Env& env, const RestoreLayout& at, RestoreJournal& journal);
 
 // Moves every held entry of holding back into target (created when
-// missing), then syncs target. An entry whose name stands in target already
-// stays held (logged).
+// missing), then syncs target. An entry whose name something else has taken
+// in target meanwhile comes back as "<name>.before-restore" (".2", ".3", ...
+// after that when taken too), logged, so nothing held is lost with the
+// working folder.
 void moveBack(sys::Env& env, const sys::Path& holding, const sys::Path& target);
 
 // Removes what counts as content of a database folder (regular files and

@@ -396,4 +396,23 @@ TEST_F(Restore, RecoveryTrustsOnlyItsOwnJournals) {
   EXPECT_FALSE(fs::exists(root() + "db.temp/other"));
 }
 
+// A previous file whose name something else took meanwhile comes back
+// under a name of its own instead of going with the working folder.
+TEST_F(Restore, RecoveryKeepsAPreviousFileWhoseNameWasTaken) {
+  files();
+  const std::string work = root() + "db.temp/sales/";
+  writeFile(work + "restore.journal", "cvdb restore journal 1\nkey sales\nstate aside\n");
+  writeFile(work + "db.restore/notes.txt", "previous");
+  writeFile(root() + "sales/notes.txt", "written meanwhile");
+  writeFile(root() + "sales/notes.txt.before-restore", "taken too");
+  LogCapture log;
+  EXPECT_TRUE(maint::recoverRestores(env_, pool()->paths()).empty());
+  EXPECT_EQ(readFile(root() + "sales/notes.txt"), "written meanwhile");
+  EXPECT_EQ(readFile(root() + "sales/notes.txt.before-restore"), "taken too");
+  EXPECT_EQ(readFile(root() + "sales/notes.txt.before-restore.2"), "previous");
+  EXPECT_TRUE(
+      log.contains(Log::Error, "its previous version is kept as \"" + root() + "sales/notes.txt.before-restore.2\""));
+  EXPECT_FALSE(fs::exists(work));
+}
+
 }  // namespace
