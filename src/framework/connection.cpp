@@ -115,6 +115,26 @@ void Connection::close(const std::string& reason) {
   onStrand([this, reason] { beginClose(reason); });
 }
 
+void Connection::stop(const std::string& reason) {
+  onStrand([this, reason] {
+    if (closing_ || finished_ || stopPending_) return;
+    // A progress stream belongs to a maintenance operation, which the
+    // service stops at its next safe point: its client learns of the stop
+    // from the Bye.
+    if (!busy_ || streaming_) {
+      beginClose(reason);
+      return;
+    }
+    stopPending_ = true;
+    stopReason_ = reason;
+    closeTimer_.expires_after(core_->options.stopGrace);
+    closeTimer_.async_wait([self = shared_from_this()](const boost::system::error_code& ec) {
+      if (ec || self->closing_ || self->finished_) return;
+      self->beginClose(self->stopReason_);
+    });
+  });
+}
+
 void Connection::commandDone() {
   onStrand([this] { endCommand(); });
 }
@@ -133,8 +153,14 @@ void Connection::respond(wire::OutFrame answer) {
 void Connection::endCommand() {
   if (!busy_) return;
   busy_ = false;
+  streaming_ = false;
   inFlight_ = nullptr;
   if (closing_ || finished_) releaseSlot();
+  if (stopPending_ && !closing_ && !finished_) {
+    // The answer is queued ahead of the Bye.
+    beginClose(stopReason_);
+    return;
+  }
   goOn();
 }
 

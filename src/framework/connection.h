@@ -81,6 +81,11 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
 
   void send(wire::OutFrame frame) override;
   void close(const std::string& reason) override;
+  // The server is stopping: reads no further request and closes with
+  // reason once the running command (if any) has sent its answer, or at
+  // once when there is none or it streams progress. A command that has not
+  // answered within the stop grace gets the Bye anyway.
+  void stop(const std::string& reason);
   void commandDone() override;
   std::string peer() const override { return peer_; }
   bool isOpen() const override { return open_.load(); }
@@ -110,7 +115,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   // the write queue (connection_write.cpp) have files of their own; the
   // rest, with ending and stalls, is in connection.cpp.
   bool partialFrame() const noexcept { return inBody_ || stageEnd_ > stageBegin_; }
-  bool mayTakeRequest() const noexcept { return !busy_ && !closing_ && !finished_ && outBytes_ <= kOutHighWater; }
+  bool mayTakeRequest() const noexcept {
+    return !busy_ && !closing_ && !finished_ && !stopPending_ && outBytes_ <= kOutHighWater;
+  }
   void endCommand();
   void goOn();
   void startRead();
@@ -179,7 +186,10 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
 
   bool reading_ = false;
   bool writing_ = false;
-  bool busy_ = false;        // a command is running; no further request is read
+  bool busy_ = false;         // a command is running; no further request is read
+  bool streaming_ = false;    // ... and its answer is a progress stream
+  bool stopPending_ = false;  // the server stops: close once the running command has answered
+  std::string stopReason_;
   bool peerDone_ = false;    // the peer sent its end (or the socket broke)
   bool closing_ = false;     // a Bye is queued; nothing else goes out
   bool byeFlushed_ = false;  // the Bye is written; draining until the peer closes

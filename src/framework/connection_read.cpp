@@ -177,6 +177,7 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
 
 void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
   busy_ = true;
+  streaming_ = cmd->streamsProgress();
   answered_ = false;
   inFlight_ = cmd.get();
   processor_ = processor;

@@ -51,7 +51,7 @@ class SvcStub::Impl {
     auto open = core_->beginStop(&first);
     if (!first) return false;
     acceptor_->stop();
-    for (const auto& c : open) c->close("Server is stopping");
+    for (const auto& c : open) c->stop("Server is stopping");
     return true;
   }
 

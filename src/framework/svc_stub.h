@@ -44,6 +44,10 @@ class SvcStub {
     // How long a closing connection waits for its Bye frame to go out and
     // for the peer to close before the socket is closed anyway.
     std::chrono::milliseconds closeGrace{500};
+    // How long a stop lets the commands that are running finish and send
+    // their answers before their connections are closed anyway. The
+    // service unit's stop timeout must leave room for it.
+    std::chrono::milliseconds stopGrace{20000};
     // I/O threads kept for the server's life; 0 means as many as cores, at
     // least 2. More are started while commands occupy them all.
     unsigned ioThreads = 0;
@@ -70,8 +74,12 @@ class SvcStub {
   // The bound port.
   std::uint16_t port() const noexcept;
 
-  // Stops accepting and closes every connection. Returns false when the
-  // server was already stopping.
+  // Stops accepting and reading requests and ends every connection: at
+  // once when it runs no command or a progress stream (which its processor
+  // stops), else once the running command has sent its answer (within
+  // Options::stopGrace), so that a client never gets a Bye for a request
+  // that was carried out. Returns false when the server was already
+  // stopping.
   bool signalStop();
   // Blocks until the server has stopped after signalStop().
   void waitToFinish();

@@ -356,21 +356,45 @@ TEST_F(TransportTest, AClientThatStopsReadingIsDisconnected) {
   EXPECT_TRUE(eventually([&] { return server->connectionCount() == 0; }));
 }
 
-TEST_F(TransportTest, StopWaitsForARunningCommandAndReleasesItsConnection) {
+// A stop lets a running command deliver its answer before the Bye (its
+// work is done: a Bye would report it as failed), runs nothing pipelined
+// behind it, and ends idle connections at once.
+TEST_F(TransportTest, StopDeliversTheAnswerOfARunningCommandThenSaysGoodbye) {
+  RawClient idle(port());
   RawClient c(port());
   c.send(requestBytes(kSlot, strField("s")));
   ASSERT_TRUE(c.read());
-  c.send(requestBytes(kBlock, strField("running")));
+  c.send(requestBytes(kBlock, strField("running")) + requestBytes(kEcho, strField("pipelined")));
   ASSERT_TRUE(proc->waitStarted("running"));
 
   server->signalStop();
-  expectBye(c, "Server is stopping");
+  expectBye(idle, "Server is stopping");
   auto done = std::async(std::launch::async, [&] { server->waitToFinish(); });
   EXPECT_EQ(done.wait_for(200ms), std::future_status::timeout);
   proc->openGate();
+  EXPECT_EQ(answerOf(c), "running");
+  expectBye(c, "Server is stopping");
   done.get();
   EXPECT_EQ(proc->liveSlots, 0);
   EXPECT_EQ(proc->events().back(), "end:running");
+}
+
+TEST_F(TransportTest, AStopGivesUpOnACommandThatOutlastsItsGrace) {
+  stop();
+  Ipc::SvcStub::Options o;
+  o.closeGrace = 300ms;
+  o.stopGrace = 100ms;
+  proc = std::make_shared<FakeProcessor>();
+  server = std::make_unique<Ipc::SvcStub>(0, false, proc->factory(), nullptr, o);
+  proc->server = server.get();
+
+  RawClient c(port());
+  c.send(requestBytes(kBlock, strField("stuck")));
+  ASSERT_TRUE(proc->waitStarted("stuck"));
+  server->signalStop();
+  expectBye(c, "Server is stopping");
+  proc->openGate();
+  server->waitToFinish();
 }
 
 TEST_F(TransportTest, DestroyingTheServerStopsItAndASocketHeldBeyondItStaysSafeToUse) {
