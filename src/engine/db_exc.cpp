@@ -24,6 +24,8 @@ DBExc::DBExc(std::int32_t code, const std::string& file, std::uint32_t line)
 DBExc::DBExc(std::int32_t code, const std::source_location& where)
     : DBExc(code, baseName(where.file_name()), where.line()) {}
 
+DBExc::DBExc(std::int32_t code, const std::string& text) : std::runtime_error(text), code_(code) {}
+
 DBExc::DBExc(const std::string& text) : std::runtime_error(text), code_(kTextCode) {}
 
 DBExc::DBExc(const char* text) : std::runtime_error(text), code_(kTextCode) {}

@@ -22,6 +22,9 @@ class DBExc : public std::runtime_error {
   DBExc(std::int32_t code, const std::string& file, std::uint32_t line);
   // The same from a source location; the file is given by its base name.
   DBExc(std::int32_t code, const std::source_location& where);
+  // The text unchanged, with the code (a failure that its thrower can
+  // explain better than a call site does).
+  DBExc(std::int32_t code, const std::string& text);
   // The text unchanged, code kTextCode.
   explicit DBExc(const std::string& text);
   explicit DBExc(const char* text);

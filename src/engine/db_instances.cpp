@@ -134,6 +134,26 @@ std::unique_ptr<engine::Session> DBInstances::sessionOnOpen(sys::MutexLock& lock
 }
 
 std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKey, const OnNewInstance& onNewInstance) {
+  try {
+    return openSession(dbKey, onNewInstance);
+  } catch (const DBExc& e) {
+    // The engine's codes say only that a limit was reached; the log line of
+    // the refusal says which, and for which database.
+    const std::string code = " (engine error " + std::to_string(e.code()) + ")";
+    if (e.code() == err::kTooManyInstances) {
+      throw DBExc(e.code(), "Database \"" + dbKey + "\" refused: " + std::to_string(settings_.maxActiveDBs) +
+                                " databases are open, the most that MaxActiveDBs allows" + code);
+    }
+    if (e.code() == err::kOutOfSessions) {
+      throw DBExc(e.code(), "Database \"" + dbKey + "\" refused: " + std::to_string(settings_.maxClientsPerDB) +
+                                " clients have it open, the most that MaxActiveClientsPerDB allows" + code);
+    }
+    throw;
+  }
+}
+
+std::unique_ptr<engine::Session> DBInstances::openSession(const std::string& dbKey,
+                                                          const OnNewInstance& onNewInstance) {
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DBInstances: New database connection request for " << dbKey;
   }

@@ -115,7 +115,8 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   // A new session on the database's instance, creating and initialising the
   // instance first when the database has none. Throws "Database not
   // accessible! Possible restore operation in progress." while an exclusive
-  // hold is set, kOutOfSessions / kTooManyInstances at the limits, and
+  // hold is set, kOutOfSessions / kTooManyInstances at the limits (their
+  // texts name the database and the setting that refused it), and
   // whatever onNewInstance throws; then no session stays counted and an
   // instance made for the call is dropped.
   std::unique_ptr<engine::Session> newSession(const std::string& dbKey, const OnNewInstance& onNewInstance)
@@ -154,6 +155,9 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
 
  private:
   friend class InstanceForMaintenance;
+
+  std::unique_ptr<engine::Session> openSession(const std::string& dbKey, const OnNewInstance& onNewInstance)
+      EXCLUDES(mutex_);
 
   struct InstanceRec {
     std::shared_ptr<engine::Instance> instance;  // null once terminated

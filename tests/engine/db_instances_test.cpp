@@ -172,15 +172,30 @@ TEST_F(Pool, DormantInstancesAreClosedAtTwoThirdsOfTheLimitOrWhenAsked) {
   EXPECT_FALSE(record("c"));
 }
 
-TEST_F(Pool, InstanceAndSessionLimitsAreTheEngines) {
+// The refusals keep the engine's codes and say in their texts (which the
+// log shows) which database met which limit.
+TEST_F(Pool, InstanceAndSessionLimitsAreTheEnginesAndNameTheirSetting) {
+  const auto textOf = [](const auto& f) -> std::string {
+    try {
+      f();
+    } catch (const DB::DBExc& e) {
+      return e.what();
+    }
+    return "(no failure)";
+  };
   configure(2, 2);
   auto a1 = open("a");
   auto a2 = open("a");
   EXPECT_EQ(codeOf([&] { open("a"); }), err::kOutOfSessions);
+  EXPECT_EQ(textOf([&] { open("a"); }),
+            "Database \"a\" refused: 2 clients have it open, the most that MaxActiveClientsPerDB allows (engine "
+            "error -1101)");
   EXPECT_EQ(record("a")->sessions, 2u);
 
   auto b = open("b");
   EXPECT_EQ(codeOf([&] { open("c"); }), err::kTooManyInstances);
+  EXPECT_EQ(textOf([&] { open("c"); }),
+            "Database \"c\" refused: 2 databases are open, the most that MaxActiveDBs allows (engine error -1214)");
   EXPECT_FALSE(record("c"));
   close("b", std::move(b));
   auto c = open("c");  // b was dormant and is swept
