@@ -97,6 +97,10 @@ std::string backupOne(const std::shared_ptr<DB::DBInstances>& pool, const std::s
   sys::Env& env = pool->env();
   const DB::Paths& paths = pool->paths();
   const std::string archive = archivePath(paths, env, target, dbKey);
+  if (!paths.allowsMaintenancePath(archive)) {
+    throw std::runtime_error("Backup target \"" + archive +
+                             "\" lies outside the folders that MaintenanceFolders allows");
+  }
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:backup starting for \"" << dbKey << "\". File: " << archive;
   }

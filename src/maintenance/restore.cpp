@@ -204,6 +204,10 @@ std::string restoreOne(const std::shared_ptr<DB::DBInstances>& pool, const std::
   const DB::Paths& paths = pool->paths();
   std::string key = name;
   const std::string archive = restoreSource(paths, archivePath, key);
+  if (!paths.allowsMaintenancePath(archive)) {
+    throw DB::DBExc("Database restore for \"" + key + "\" refused the backup file \"" + archive +
+                    "\": it lies outside the folders that MaintenanceFolders allows");
+  }
   if (g_LogVerbose) Log::Lock(Log::Debug).logStreamLine() << "DB:restore starting. File: " << archive;
   if (env.stat(archive, true).type != sys::FileType::Regular) {
     throw DB::DBExc("Database restore for \"" + key + "\" can not find the backup file: \"" + archive + "\"");
@@ -264,6 +268,10 @@ std::vector<std::string> restoreFolder(const std::shared_ptr<DB::DBInstances>& p
   const DB::Paths& paths = pool->paths();
   std::string from = folder.empty() ? paths.backupFolder() : toSlashes(folder);
   if (from.front() != '/') from = paths.backupFolder() + from;
+  if (!paths.allowsMaintenancePath(from)) {
+    throw DB::DBExc("Restore refused the folder \"" + from +
+                    "\": it lies outside the folders that MaintenanceFolders allows");
+  }
   std::vector<std::string> restored;
   for (const sys::DirEntry& e : env.list(from)) {
     const sys::Path file = sys::Path(from) / e.name;

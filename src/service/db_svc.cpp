@@ -1,5 +1,7 @@
 #include "service/db_svc.h"
 
+#include <unistd.h>
+
 #include <memory>
 #include <thread>
 #include <vector>
@@ -17,6 +19,20 @@ namespace {
 
 const std::string kSvcName = "CorvinaDB";
 const std::string kSvcDisplayName = "Corvina database server";
+
+// Says once where backups and restores may read and write; a root server
+// that lets clients name any path deserves a warning.
+void logMaintenanceFolders(const DB::Paths& paths) {
+  if (paths.maintenanceFolders().empty()) {
+    Log::Lock(geteuid() == 0 ? Log::Warning : Log::Notice).logStreamLine()
+        << "Backup and restore accept any path on the server: MaintenanceFolders is not set";
+    return;
+  }
+  Log::Lock entry(Log::Notice);
+  auto& line = entry.logStreamLine();
+  line << "Backup and restore are confined to \"" << paths.backupFolder() << '"';
+  for (const std::string& folder : paths.maintenanceFolders()) line << ", \"" << folder << '"';
+}
 
 void debugLine(const char* text) {
   if (!g_LogVerbose) return;
@@ -45,6 +61,7 @@ void DBSvc::runSvc() {
     // Everything below the service gets its settings, paths and Env from
     // here, through the pool; nothing below reads the process-wide record.
     const auto pool = DB::DBInstances::create(DB::PoolSettings::from(config), DB::Paths(config), sys::Env::posix());
+    logMaintenanceFolders(pool->paths());
     // Restores that a crash cut short are undone (or finished) before any
     // database opens; a database whose recovery failed stays held, so no
     // client opens it half restored, until a later start recovers it.

@@ -1,5 +1,7 @@
 #include "settings/config.h"
 
+#include <jansson.h>
+
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
@@ -85,6 +87,16 @@ void readKeys(const json::Object& obj, DBConfig& c) {
     c.MaxWaitMaintenanceOpSecs = static_cast<std::int32_t>(static_cast<std::uint32_t>(v.asInteger()));
   }
   if (const auto v = obj.get("EnableEngineLogging"); !v.empty()) c.EnableEngineLogging = v.isTrue();
+  if (const auto v = obj.get("MaintenanceFolders"); !v.empty()) {
+    if (!v.isArray())
+      throw json::Exc(std::string("MaintenanceFolders: expected an array of folders, got ") + v.typeName());
+    std::vector<std::string> folders;
+    for (std::size_t i = 0; i < json_array_size(v.get()); ++i) {
+      const std::string folder = json::Value::borrow(json_array_get(v.get(), i)).asString();
+      if (!folder.empty()) folders.push_back(normaliseFolder(folder));
+    }
+    c.MaintenanceFolders = std::move(folders);
+  }
 }
 
 const DBConfig& loadedRecord() {

@@ -14,6 +14,7 @@
 #include <filesystem>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "framework/env.h"
 
@@ -31,6 +32,9 @@ class DBConfig {
   std::string DBFileName = "cvdb.edb";
   std::int32_t MaxWaitMaintenanceOpSecs = 10;
   bool EnableEngineLogging = false;
+  // Folders that backup targets and restore sources must lie in (with the
+  // backup folder, always allowed); empty allows any path.
+  std::vector<std::string> MaintenanceFolders;
 
   // The process-wide record; loads and prints it on the first call.
   static const DBConfig& inst();

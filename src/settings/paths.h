@@ -9,6 +9,7 @@
 
 #include <string>
 #include <string_view>
+#include <vector>
 
 class DBConfig;
 
@@ -18,7 +19,8 @@ class Paths {
  public:
   explicit Paths(const DBConfig& config);
   // root, logRoot and backupFolder end with "/".
-  Paths(std::string root, std::string logRoot, std::string backupFolder, std::string dbFileName);
+  Paths(std::string root, std::string logRoot, std::string backupFolder, std::string dbFileName,
+        std::vector<std::string> maintenanceFolders = {});
 
   const std::string& root() const noexcept { return root_; }
   const std::string& logRoot() const noexcept { return logRoot_; }
@@ -43,11 +45,21 @@ class Paths {
   // database could never open again. why, when given, receives the reason.
   bool acceptsName(std::string_view name, std::string* why = nullptr) const;
 
+  // The folders that backup targets and restore sources must lie in,
+  // besides the backup folder; empty when any path is allowed.
+  const std::vector<std::string>& maintenanceFolders() const noexcept { return maintenanceFolders_; }
+  // Whether a backup or restore may use the path (a file or a folder, which
+  // need not exist yet): always when no maintenance folders are set, else
+  // when, with ".." and symbolic links resolved as far as the path exists,
+  // it lies in one of them or in the backup folder.
+  bool allowsMaintenancePath(const std::string& path) const;
+
  private:
   std::string root_;
   std::string logRoot_;
   std::string backupFolder_;
   std::string dbFileName_;
+  std::vector<std::string> maintenanceFolders_;
 };
 
 }  // namespace DB

@@ -250,3 +250,45 @@ TEST(CvdbTool, RefusalsLocalMistakesAndAnUnreachableServerHaveTheirOwnStatus) {
 }
 
 }  // namespace
+
+// With MaintenanceFolders set, a client can name no path outside them (or
+// the backup folder) for a backup or a restore: refused before anything is
+// read or written.
+TEST(CvdbTool, MaintenanceFoldersConfineBackupsAndRestores) {
+  testing_support::TempDir dir;
+  const auto allowed = dir.path() / "allowed";
+  const auto outside = dir.path() / "outside";
+  std::filesystem::create_directories(allowed);
+  std::filesystem::create_directories(outside);
+  testing_support::ServerOptions o;
+  o.configJson = R"({"ServerPort": 0, "MaintenanceFolders": [")" + allowed.string() + R"("]})";
+  ServerProcess server(kServer, o);
+  EXPECT_TRUE(server.waitForLogLine("Backup and restore are confined to"));
+  const Tool cvdb = toolOf(server, {"--db", "docs"});
+  ok(cvdb({"cfg", "set", "layout", R"({"v": 1})"}));
+
+  const auto refusedBy = [&](const std::vector<std::string>& args) {
+    const auto r = cvdb(args);
+    EXPECT_EQ(r.status, 1) << r.output;
+    return has(r.output, "lies outside the folders that MaintenanceFolders allows");
+  };
+  EXPECT_TRUE(refusedBy({"backup", (outside / "docs.cvbak").string()}));
+  EXPECT_TRUE(refusedBy({"backup", (allowed / ".." / "outside" / "docs.cvbak").string()}));
+  EXPECT_TRUE(refusedBy({"backup", outside.string() + "/", "--all"}));
+  EXPECT_TRUE(std::filesystem::is_empty(outside));
+
+  ok(cvdb({"backup", (allowed / "docs.cvbak").string()}));
+  ok(cvdb({"backup"}));  // the backup folder is always allowed
+  ok(cvdb({"cfg", "set", "layout", R"({"v": 2})"}));
+  std::filesystem::copy_file(allowed / "docs.cvbak", outside / "docs.cvbak");
+  EXPECT_TRUE(refusedBy({"restore", (outside / "docs.cvbak").string()}));
+  EXPECT_TRUE(refusedBy({"restore", outside.string(), "--all"}));
+  EXPECT_TRUE(has(ok(cvdb({"cfg", "get", "layout"})), "2"));
+  ok(cvdb({"restore", (allowed / "docs.cvbak").string()}));
+  EXPECT_TRUE(has(ok(cvdb({"cfg", "get", "layout"})), "1"));
+}
+
+TEST(CvdbTool, AServerWithoutMaintenanceFoldersSaysThatAnyPathIsAccepted) {
+  ServerProcess server(kServer);
+  EXPECT_TRUE(server.waitForLogLine("Backup and restore accept any path on the server: MaintenanceFolders is not set"));
+}

@@ -196,6 +196,13 @@ TEST(Config, TextsArePaddedCutOrNormalised) {
   // Compared byte for byte before normalising: "/data" is not "/data/", so
   // the backup folder is the root itself, as it always has been.
   EXPECT_EQ(loadWith(R"({"DBRoot": "/data", "BackupFolder": "/data"})").BackupFolder, "/data/");
+
+  // Maintenance folders are normalised like the others; empty entries go.
+  const DBConfig m = loadWith(R"({"MaintenanceFolders": ["\\srv\\bak", "/mnt/x/", ""]})");
+  EXPECT_EQ(m.MaintenanceFolders, (std::vector<std::string>{"/srv/bak/", "/mnt/x/"}));
+  LogCapture log;
+  EXPECT_TRUE(loadWith(R"({"MaintenanceFolders": "/srv/bak"})").MaintenanceFolders.empty());
+  EXPECT_EQ(log.count("MaintenanceFolders: expected an array of folders, got string"), 1u);
 }
 
 TEST(NetworkPath, RemoteFileSystemsAreRecognised) {
