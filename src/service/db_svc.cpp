@@ -71,9 +71,10 @@ void DBSvc::runSvc() {
     }
     // Temporary files of data-file writes that a crash cut short go in the
     // background, beside the clients; the thread ends with the service.
-    // File times are coarser than the clock: a margin keeps a write that
-    // starts right away clear of the line.
-    const auto started = pool->env().now() - std::chrono::seconds(2);
+    // This process's own writes carry its prefix and are never swept, so
+    // the line needs no margin: a file that a crash left moments before
+    // this start goes too.
+    const auto started = pool->env().now();
     std::jthread sweeper(
         [pool, started](std::stop_token stop) { DB::removeStaleTempFiles(pool->env(), pool->paths(), started, stop); });
     std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);

@@ -15,6 +15,7 @@
 #include "framework/log.h"
 #include "settings/names.h"
 #include "store/db_local.h"
+#include "store/stale_files.h"
 
 #include <shared_mutex>
 
@@ -87,7 +88,7 @@ void makeFolders(sys::Env& env, const std::string& folder) {
 class DurableWrite {
  public:
   DurableWrite(sys::Env& env, std::string folder)
-      : env_(env), folder_(std::move(folder)), file_(env_.createTemp(folder_, DBLocal::kTempPrefix, &temp_)) {}
+      : env_(env), folder_(std::move(folder)), file_(env_.createTemp(folder_, processTempPrefix(), &temp_)) {}
   ~DurableWrite() {
     if (renamed_) return;
     try {

@@ -104,24 +104,52 @@ TEST_F(DataFiles, CopyingAFolderMergesIntoTheTargetAndKeepsTheSource) {
   EXPECT_FALSE(fs::exists(root() + "docs/d/other"));
 }
 
-// Temporary files that interrupted writes left behind go at the start;
-// those of writes younger than the start, and the data files, stay.
+// Temporary files that interrupted writes left behind go at the start,
+// also one that a crash left just before it; those of this process's own
+// writes, files younger than the start, and the data files stay.
 TEST_F(DataFiles, StaleTemporaryFilesOfInterruptedWritesAreRemoved) {
   auto db = open("s");
   db->saveDataBlob("data", 4, "doc", "page");
   const std::string folder = root() + "s/d/doc/";
+  const std::string own = DB::processTempPrefix() + "run789";
+  ASSERT_TRUE(own.starts_with(".cvtmp.") && own < ".cvtmp.new456");  // hex digits sort first
   writeFile(folder + ".cvtmp.old123", "half a write");
+  writeFile(folder + ".cvtmp.just5", "cut");
   writeFile(folder + ".cvtmp.new456", "running");
+  writeFile(folder + own, "this process");
   writeFile(folder + "page.cvtmp.x", "a client's file");
   const auto start = sys::WallClock::now();
   env_.setModified(folder + ".cvtmp.old123", start - std::chrono::hours(1));
+  env_.setModified(folder + ".cvtmp.just5", start - std::chrono::milliseconds(20));
+  env_.setModified(folder + ".cvtmp.new456", start + std::chrono::seconds(1));
+  env_.setModified(folder + own, start - std::chrono::hours(1));
   env_.setModified(folder + "page.cvtmp.x", start - std::chrono::hours(1));
   LogCapture log;
-  const auto report = DB::removeStaleTempFiles(env_, pool()->paths(), start - std::chrono::seconds(2));
-  EXPECT_EQ(report.removed, 1u);
-  EXPECT_EQ(report.bytes, 12u);
-  EXPECT_EQ(entries(folder), (std::vector<std::string>{".cvtmp.new456", "page", "page.cvtmp.x"}));
-  EXPECT_TRUE(log.contains(Log::Notice, "Removed 1 temporary file(s) (12 bytes)"));
+  const auto report = DB::removeStaleTempFiles(env_, pool()->paths(), start);
+  EXPECT_EQ(report.removed, 2u);
+  EXPECT_EQ(report.bytes, 15u);
+  EXPECT_EQ(entries(folder), (std::vector<std::string>{own, ".cvtmp.new456", "page", "page.cvtmp.x"}));
+  EXPECT_TRUE(log.contains(Log::Notice, "Removed 2 temporary file(s) (15 bytes)"));
+  // A sweep that finds nothing says so too: its end is always visible.
+  EXPECT_EQ(DB::removeStaleTempFiles(env_, pool()->paths(), start).removed, 0u);
+  EXPECT_TRUE(log.contains(Log::Notice, "No temporary files of interrupted data-file writes found"));
+}
+
+// A write in progress carries this process's prefix, so the sweep of this
+// process never takes it away from under the write.
+TEST_F(DataFiles, AWriteUnderWayIsNeverSwept) {
+  DB::DBLocal db(pool(), "docs");
+  std::vector<std::string> seen;
+  env_.setCallHook([&](testing_support::FaultEnv::Op op, const sys::Path& path) {
+    if (op != testing_support::FaultEnv::Op::Rename || !seen.empty()) return;
+    seen = entries(path.parent_path());
+    DB::removeStaleTempFiles(env_, pool()->paths(), sys::WallClock::now() + std::chrono::hours(1));
+  });
+  save(db, "doc", "page", "content");
+  env_.setCallHook({});
+  ASSERT_EQ(seen.size(), 1u);
+  EXPECT_TRUE(seen[0].starts_with(DB::processTempPrefix())) << seen[0];
+  EXPECT_EQ(db.loadDataBlob("doc", "page").view(), "content");
 }
 
 }  // namespace
