@@ -2,11 +2,15 @@
 
 #include <string_view>
 
+#include "engine/engine_errors.h"
+
 namespace DB {
 namespace {
 
 std::string engineText(std::int32_t code, const std::string& file, std::uint32_t line) {
-  return "DB Engine error " + std::to_string(code) + ", file \"" + file + "\", line " + std::to_string(line);
+  // The one code an operator must act on at once is named in words.
+  const char* const what = code == err::kDiskFull ? " (disk full)" : "";
+  return "DB Engine error " + std::to_string(code) + what + ", file \"" + file + "\", line " + std::to_string(line);
 }
 
 // Build paths are long and differ between machines; the base name is enough

@@ -132,6 +132,7 @@ TEST(DiskFull, WritesAreRefusedWhileTheDiskIsFullAndAcceptedOnceSpaceIsFreed) {
     const std::string cfgError = failureOf([&] { c->setCfg("part0", part(bigPart)); });
     std::cout << "[ disk full ] a configuration part answers: " << cfgError << std::endl;
     EXPECT_EQ(cfgError, std::string("the server ended the connection: ") + kTerminating);
+    EXPECT_TRUE(server.waitForLogLine("SetCfgPart failed with DB Engine error -1808 (disk full)"));
   }
   {
     auto c = clientOf(server, db);

@@ -16,6 +16,8 @@ TEST(DBExc, TextsNameTheCallSiteOrKeepTheGivenText) {
   const DB::DBExc copy = DB::DBExc(-1102, "store.cpp", 25);
   EXPECT_EQ(copy.code(), -1102);
   EXPECT_STREQ(copy.what(), "DB Engine error -1102, file \"store.cpp\", line 25");
+  EXPECT_STREQ(DB::DBExc(-1808, "meta_blobs.cpp", 68).what(),
+               "DB Engine error -1808 (disk full), file \"meta_blobs.cpp\", line 68");
   EXPECT_EQ(DB::DBExc("Operation timeout!").code(), DB::DBExc::kTextCode);
   EXPECT_STREQ(DB::DBExc(std::string("Operation timeout!")).what(), "Operation timeout!");
 
