@@ -108,6 +108,8 @@ class SignalThread {
 
 bool I::initSvc() { return true; }
 
+int I::checkConfig() { return 0; }
+
 const std::filesystem::path& I::fullPathToSvcExe() const {
   static const std::filesystem::path exe = [] {
     std::error_code ec;
@@ -141,6 +143,9 @@ std::optional<int> Host::prepare(int argc, char** argv) {
       ->type_name("DIR");
   app.add_option("--log-dir", logDir, "Folder for the log files (they go to its subfolder svc/)")->type_name("DIR");
   app.add_flag("--console", console, "Log to standard error as well");
+  app.add_flag("--check-config", checkConfig_,
+               "Read config.json, print the settings in effect and exit: 0 when the file was read whole, 1 when the "
+               "server would fall back to defaults for any of it");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -157,6 +162,14 @@ std::optional<int> Host::prepare(int argc, char** argv) {
 int Host::main(int argc, char** argv, std::unique_ptr<I> svc) {
   if (auto code = prepare(argc, argv)) return *code;
   if (!svc) return 1;
+  if (checkConfig_) {
+    try {
+      return svc->checkConfig();
+    } catch (const std::exception& e) {
+      Log::Lock(Log::Error).logStreamLine() << "Checking the configuration failed: " << e.what();
+      return 1;
+    }
+  }
   raiseFileLimit();
   {
     Log::Lock entry(Log::Notice);

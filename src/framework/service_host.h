@@ -11,7 +11,9 @@
 //
 // Command line: --help, --version, --home DIR (the platform's system
 // configuration folder), --log-dir DIR (the platform's log folder),
-// --console (log entries go to standard error too).
+// --console (log entries go to standard error too), --check-config (main()
+// runs the service's checkConfig() instead of the service and returns its
+// result).
 // main() raises the open-file limit to its hard limit, turns SIGTERM and
 // SIGINT into stopSvc() (taken by a dedicated thread with sigwait, never in
 // a signal handler), calls prepareSvc, initSvc and runSvc, and returns 0
@@ -44,6 +46,9 @@ class I {
   virtual void stopSvc() = 0;
   virtual const std::string& svcName() const = 0;
   virtual const std::string& svcDisplayName() const = 0;
+  // Checks the service's settings, says what they are on standard output
+  // and returns the process's exit code; the base has nothing to check.
+  virtual int checkConfig();
   // The running executable; the base reads it from the system.
   virtual const std::filesystem::path& fullPathToSvcExe() const;
   virtual ~I();
@@ -62,6 +67,7 @@ class Host {
 
  private:
   bool prepared_ = false;
+  bool checkConfig_ = false;
   std::optional<int> prepareResult_;
 };
 

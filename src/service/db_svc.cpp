@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <iostream>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -48,6 +49,23 @@ DBSvc::~DBSvc() {
   debugLine("Svc object destroyed");
   sys::MutexLock lock(mutex_);
   listener.reset();
+}
+
+int DBSvc::checkConfig() {
+  std::string problem;
+  const DBConfig config = DBConfig::load(DBConfig::defaultRoot(), sys::Env::posix(), &problem);
+  std::cout << config.printout() << "\tmaintenance folders: ";
+  if (config.MaintenanceFolders.empty()) std::cout << "any path";
+  for (std::size_t i = 0; i < config.MaintenanceFolders.size(); ++i) {
+    std::cout << (i == 0 ? "\"" : ", \"") << config.MaintenanceFolders[i] << '"';
+  }
+  std::cout << '\n';
+  if (!problem.empty()) {
+    std::cout << "Not taken whole: " << problem << '\n';
+    return 1;
+  }
+  std::cout << "The configuration was read whole.\n";
+  return 0;
 }
 
 bool DBSvc::prepareSvc() {

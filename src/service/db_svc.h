@@ -34,6 +34,9 @@ class DBSvc final : public Service::I {
 
   // Loads and prints the settings (first DBConfig::inst()).
   bool prepareSvc() override;
+  // Loads config.json as a start would and prints the settings in effect;
+  // 1 when any of the file was not taken (no file, not JSON, a wrong type).
+  int checkConfig() override;
   // Serves until stopSvc(); then releases the Listener and tears the engine
   // pool down.
   void runSvc() override;

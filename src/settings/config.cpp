@@ -119,7 +119,7 @@ const DBConfig& DBConfig::inst() {
   return loadedRecord();
 }
 
-DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env) {
+DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env, std::string* problem) {
   DBConfig c;
   c.DBRoot = defaultRoot;
   c.DBLogRoot = defaultRoot;
@@ -128,9 +128,12 @@ DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env) {
     if (readConfigFile(env, defaultRoot + kConfigFileName, text)) {
       const json::Object obj = json::strToObject(text);
       if (obj.size() > 0) readKeys(obj, c);
+    } else if (problem) {
+      *problem = "no readable " + defaultRoot + kConfigFileName + ": every setting is its default";
     }
   } catch (const std::exception& e) {
     Log::Lock(Log::Error).logStreamLine() << "Configuration initialization error: " << e.what();
+    if (problem) *problem = e.what();
   }
   if (c.BackupFolder.empty() || c.BackupFolder == c.DBRoot) {
     c.BackupFolder = c.DBRoot + DB::kBackupSubfolder;

@@ -43,7 +43,9 @@ class DBConfig {
   // without touching the process-wide one: every rule of the load
   // (defaults, key order, type errors, limits, the backup-folder rule)
   // applies, and the printout is logged. defaultRoot must end with "/".
-  static DBConfig load(const std::string& defaultRoot, sys::Env& env);
+  // With problem given, it receives why the file was not taken whole (no
+  // file, not a JSON object, a value of the wrong type), or stays empty.
+  static DBConfig load(const std::string& defaultRoot, sys::Env& env, std::string* problem = nullptr);
 
   // The default database root: the platform's system configuration folder
   // joined with "db", followed by "/".

@@ -39,10 +39,36 @@ TEST(ServerCommandLine, VersionHelpAndBadOptions) {
   EXPECT_EQ(version.output, "cvdbserver 6.1.7\n");
   const auto help = ServerProcess::run(kServer, {"--help"});
   EXPECT_EQ(help.status, 0);
-  for (const char* option : {"--home", "--log-dir", "--console", "--version"}) {
+  for (const char* option : {"--home", "--log-dir", "--console", "--version", "--check-config"}) {
     EXPECT_TRUE(has(help.output, option)) << option;
   }
   EXPECT_EQ(ServerProcess::run(kServer, {"--no-such-option"}).status, 2);
+}
+
+// --check-config says what a start would take and fails on a file that
+// would leave settings at their defaults.
+TEST(ServerCommandLine, CheckConfigPrintsTheSettingsAndFailsOnWhatItCannotTake) {
+  testing_support::TempDir home;
+  const auto check = [&](const char* text) {
+    std::filesystem::create_directories(home.path() / "db");
+    if (text) testing_support::writeFile(home.path() / "db" / "config.json", text);
+    return ServerProcess::run(
+        kServer, {"--home", home.path().string(), "--log-dir", (home.path() / "log").string(), "--check-config"});
+  };
+  const auto missing = check(nullptr);
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_TRUE(has(missing.output, "every setting is its default")) << missing.output;
+
+  const auto good = check(R"({"ServerPort": 4000, "MaintenanceFolders": ["/srv/bak"]})");
+  EXPECT_EQ(good.status, 0) << good.output;
+  EXPECT_TRUE(has(good.output, "\tTCP listening port: 4000\n")) << good.output;
+  EXPECT_TRUE(has(good.output, "\tmaintenance folders: \"/srv/bak/\"\n")) << good.output;
+
+  for (const char* bad : {R"({"ServerPort": "4000"})", "not json", R"({"MaintenanceFolders": "/srv"})"}) {
+    const auto r = check(bad);
+    EXPECT_EQ(r.status, 1) << bad;
+    EXPECT_TRUE(has(r.output, "Not taken whole: ")) << r.output;
+  }
 }
 
 TEST(ServerLifecycle, EitherSignalStopsItPromptlyAndCleanlyWithIdleClientsConnected) {
