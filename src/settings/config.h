@@ -31,6 +31,9 @@ class DBConfig {
   std::string DBFileName = "cvdb.edb";
   std::int32_t MaxWaitMaintenanceOpSecs = 10;
   bool EnableEngineLogging = false;
+  // Memory that connections may hold in buffers, all together, in MiB
+  // (answers queued for clients, large requests); 0: no limit.
+  std::uint64_t MaxBufferedMiB = 256;
 
   // The process-wide record; loads and prints it on the first call.
   static const DBConfig& inst();
@@ -45,7 +48,7 @@ class DBConfig {
   // joined with "db", followed by "/".
   static std::string defaultRoot();
 
-  // The fifteen-line settings printout, without the log entry around it.
+  // The sixteen-line settings printout, without the log entry around it.
   std::string printout() const;
 
   // For tests: makes inst() return the given record while the object lives.
