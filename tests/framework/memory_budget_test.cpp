@@ -108,14 +108,6 @@ TEST(MemoryBudget, AFrameLargerThanTheBudgetGoesAloneAndHoldsBackOthersUntilItsT
   EXPECT_EQ(budget.waiting(), 0u);
 }
 
-TEST(MemoryBudget, NoLimitAdmitsEverything) {
-  MemoryBudget budget(0);
-  Waiters w;
-  budget.charge(std::uint64_t{1} << 40);
-  EXPECT_TRUE(budget.admitsAtOnce());
-  EXPECT_TRUE(budget.admit(w.key(0), std::uint64_t{1} << 30, w.wake(0)));
-}
-
 // Releases and admissions that cross on different threads never lose a
 // wake-up: a request that was refused saw usage that a later release gives
 // back, so every refused request is woken exactly once.
