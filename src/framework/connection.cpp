@@ -155,6 +155,7 @@ void Connection::endCommand() {
   busy_ = false;
   streaming_ = false;
   inFlight_ = nullptr;
+  releaseReserved();
   if (closing_ || finished_) releaseSlot();
   if (stopPending_ && !closing_ && !finished_) {
     // The answer is queued ahead of the Bye.
@@ -209,6 +210,7 @@ void Connection::beginClose(const std::string& reason) {
   inBody_ = false;
   // A read into it may be in flight; that read keeps its own share.
   body_.reset();
+  if (!busy_) releaseReserved();
   closeTimer_.expires_after(core_->options.closeGrace);
   closeTimer_.async_wait([self = shared_from_this()](const boost::system::error_code& ec) {
     if (!ec) self->finish();
@@ -216,7 +218,7 @@ void Connection::beginClose(const std::string& reason) {
   // Before the Bye: a client that has read it finds the session gone.
   releaseSlot();
   wire::OutFrame bye = textFrame(0, wire::FrameKind::Bye, reason);
-  outBytes_ += bye.size();
+  addQueued(bye.size());
   out_.push_back(std::move(bye));
   if (!writing_) startWrite();
 }
@@ -244,7 +246,7 @@ void Connection::finish() {
   // Frames that a write in flight gathers from go when it completes; a
   // read in flight holds its own share of its buffer.
   if (!writing_) out_.clear();
-  outBytes_ = 0;
+  leaveBudget();
   body_.reset();
   stage_.reset();
   auto self = shared_from_this();

@@ -101,6 +101,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   // Reports the text through the server's error handler and ends the
   // connection with a Bye frame carrying byeReason.
   void fail(const std::string& text, const std::string& byeReason);
+  // The memory budget has room for the request this connection waits with;
+  // from any thread, never runs it inline.
+  void resumeAfterWait();
 
  private:
   // Runs f on the strand: at once when already there, else queued. Does
@@ -153,6 +156,19 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void armStallTimer();
   void onStallTimer(const boost::system::error_code& ec);
 
+  // The memory budget (connection_budget.cpp): whether a request may go on
+  // (bytes 0: a received frame becomes a command; else a large frame of
+  // that length starts); when not, the connection waits, reading nothing,
+  // until resumeAfterWait.
+  bool admitted(std::uint64_t bytes);
+  void onMemoryFreed();
+  void addQueued(std::uint64_t bytes);
+  // Gives back the reservation of the request frame (received, dropped, or
+  // its command ended).
+  void releaseReserved();
+  // At the end: gives back everything the connection counts.
+  void leaveBudget();
+
   // A frame of the given kind whose payload is one string.
   static wire::OutFrame textFrame(std::uint8_t tag, wire::FrameKind kind, const std::string& text);
 
@@ -177,6 +193,8 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   std::uint32_t bodyLen_ = 0;
   std::uint64_t bodyGot_ = 0;
   bool inBody_ = false;
+  std::uint64_t reserved_ = 0;  // budget held for the large frame being received or run
+  bool waitingMemory_ = false;  // a request waits for the memory budget
 
   // Writing.
   std::deque<wire::OutFrame> out_;

@@ -20,7 +20,9 @@ using Clock = std::chrono::steady_clock;
 }  // namespace
 
 void Connection::startRead() {
-  if (reading_ || peerDone_ || !mayTakeRequest()) return;
+  // A request waiting for the memory budget is not followed by more bytes:
+  // the stall timer must not take it for a stalled frame.
+  if (reading_ || peerDone_ || waitingMemory_ || !mayTakeRequest()) return;
   reading_ = true;
   readSince_ = Clock::now();
   if (inBody_) {
@@ -96,6 +98,8 @@ void Connection::parse() {
       auto owner = SharedMemBuffer(std::move(*body_)).owner();
       body_.reset();
       handleFrame(std::move(owner), size);
+      // The frame's reservation stays with its command until that ends.
+      if (!busy_) releaseReserved();
       continue;
     }
     const std::size_t avail = stageEnd_ - stageBegin_;
@@ -110,6 +114,8 @@ void Connection::parse() {
     const std::size_t got = avail - wire::kLengthSize;
     const unsigned char* start = stage_.get() + stageBegin_ + wire::kLengthSize;
     if (got >= length) {
+      // A new command starts only while the memory budget has room.
+      if (!admitted(0)) return;
       std::shared_ptr<unsigned char> owner(ExportedUCharAlloc::alloc(length), ExportedUCharAlloc());
       std::memcpy(owner.get(), start, length);
       stageBegin_ += wire::kLengthSize + length;
@@ -118,8 +124,11 @@ void Connection::parse() {
       continue;
     }
     if (wire::kLengthSize + length <= kStageSize) return;  // the rest fits in the stage
-    // A large frame: what has arrived moves into a buffer of its own, and the
-    // rest is read straight into it.
+    // A large frame: it counts its whole length against the memory budget
+    // from here on (two frames received halfway can never hold the budget
+    // between them); what has arrived moves into a buffer of its own, and
+    // the rest is read straight into it.
+    if (!admitted(length)) return;
     body_ = std::make_shared<MemBuffer>(std::min<std::uint64_t>(length, std::max<std::uint64_t>(kFirstBodyChunk, got)));
     std::memcpy(body_->data(), start, got);
     bodyLen_ = length;
@@ -214,7 +223,7 @@ void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr
 // The peer has sent its end: once everything it asked for is answered and
 // sent, the connection ends without a Bye.
 void Connection::settleAfterEof() {
-  if (!peerDone_ || closing_ || finished_ || busy_ || writing_ || !out_.empty()) return;
+  if (!peerDone_ || closing_ || finished_ || busy_ || writing_ || !out_.empty() || waitingMemory_) return;
   if (partialFrame()) {
     const std::uint64_t got = inBody_ ? bodyGot_ + wire::kLengthSize : stageEnd_ - stageBegin_;
     const std::uint64_t want =

@@ -26,7 +26,7 @@ struct BufferSpan {
 
 void Connection::enqueue(wire::OutFrame frame) {
   if (closing_ || finished_) return;
-  outBytes_ += frame.size();
+  addQueued(frame.size());
   out_.push_back(std::move(frame));
   if (!writing_) startWrite();
 }
@@ -90,6 +90,7 @@ std::size_t Connection::gather() {
 
 void Connection::consumeWritten(std::uint64_t n) {
   outBytes_ -= n;
+  core_->releaseMemory(n);
   while (n > 0 && !out_.empty()) {
     const std::uint64_t rest = out_.front().size() - frontSent_;
     if (n < rest) {

@@ -70,6 +70,7 @@ class SvcStub::Impl {
   }
 
   std::size_t connectionCount() const { return core_->connectionCount(); }
+  const detail::ServerCore& core() const { return *core_; }
 
  private:
   std::shared_ptr<detail::ServerCore> core_;
@@ -94,6 +95,10 @@ bool SvcStub::signalStop() { return impl_->signalStop(); }
 void SvcStub::waitToFinish() { impl_->waitToFinish(); }
 
 std::size_t SvcStub::connectionCount() const { return impl_->connectionCount(); }
+
+std::uint64_t SvcStub::bufferedBytes() const { return impl_->core().budget.used(); }
+
+std::size_t SvcStub::connectionsWaitingForMemory() const { return impl_->core().budget.waiting(); }
 
 void SvcStub::onRespReady(const std::shared_ptr<CmdI>& cmd) {
   if (!cmd) return;

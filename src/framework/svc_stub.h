@@ -36,6 +36,9 @@ using IpcErrorHandler = std::function<void(const std::shared_ptr<Socket>&, const
 
 class SvcStub {
  public:
+  // The default of Options::memoryBudget.
+  static constexpr std::uint64_t kDefaultMemoryBudget = std::uint64_t{256} << 20;
+
   // Tuning of the transport; the defaults are the server's.
   struct Options {
     // A frame that makes no progress in either direction for this long ends
@@ -59,6 +62,15 @@ class SvcStub {
     // finished one, another thread is started: the longest that other
     // connections wait for blocked commands.
     std::chrono::microseconds blockedAfter{1000};
+    // Bytes that the connections may hold in buffers, all together: answers
+    // queued for clients, and large request frames from their first byte
+    // (their whole announced length) until their command has ended. Beyond
+    // it no new request is taken until the usage falls back; answers of
+    // commands already running are queued all the same. 0: no limit.
+    std::uint64_t memoryBudget = kDefaultMemoryBudget;
+    // How long after a large amount of buffer memory has been released the
+    // allocator is asked to return its free memory to the system (0: never).
+    std::chrono::milliseconds trimDelay{1000};
   };
 
   // port 0 binds a free port (see port()). With forceIp4 false the server
@@ -86,6 +98,10 @@ class SvcStub {
 
   // Connections currently open (for diagnostics and tests).
   std::size_t connectionCount() const;
+  // Bytes counted against Options::memoryBudget, and connections waiting
+  // for it to fall (for diagnostics and tests).
+  std::uint64_t bufferedBytes() const;
+  std::size_t connectionsWaitingForMemory() const;
 
   // Sends the answer of a processed command and lets its connection go on
   // with the next request. For progress commands the answer is their

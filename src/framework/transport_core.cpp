@@ -1,12 +1,19 @@
 #include "framework/transport_core.h"
 
 #include <algorithm>
+#include <chrono>
+#include <string>
 #include <thread>
 
 #include "framework/log.h"
 
 namespace Ipc::detail {
 namespace {
+
+// Bytes released after which freed memory is handed back to the system: a
+// few large answers or one large request, not the steady trickle of small
+// ones.
+constexpr std::uint64_t kTrimAfterReleased = std::uint64_t{16} << 20;
 
 unsigned ioThreadCount(unsigned asked) {
   if (asked > 0) return asked;
@@ -20,6 +27,8 @@ ServerCore::ServerCore(const SvcStub::Options& opts, CmdFactory f, IpcErrorHandl
       factory(std::move(f)),
       threads(IoPool::Options{ioThreadCount(opts.ioThreads), opts.maxThreads, opts.spareIdle, opts.blockedAfter},
               [this](const std::string& text) { report(nullptr, text); }),
+      budget(opts.memoryBudget),
+      trimmer(kTrimAfterReleased, opts.trimDelay),
       onError_(std::move(onError)) {}
 
 void ServerCore::report(const std::shared_ptr<Socket>& socket, const std::string& text) const noexcept {
@@ -33,6 +42,16 @@ void ServerCore::report(const std::shared_ptr<Socket>& socket, const std::string
   } catch (...) {
     // Reporting is best effort: the connection concerned ends anyway.
   }
+}
+
+void ServerCore::noteMemoryWait() noexcept {
+  using namespace std::chrono;
+  const std::int64_t now = duration_cast<milliseconds>(steady_clock::now().time_since_epoch()).count();
+  std::int64_t last = lastMemoryNote_.load();
+  if (last > now - 60000 || !lastMemoryNote_.compare_exchange_strong(last, now)) return;
+  report(nullptr, "Memory budget of " + std::to_string(budget.limit() >> 20) + " MiB reached (" +
+                      std::to_string(budget.used() >> 20) +
+                      " MiB buffered): new requests wait until answers are read or requests end");
 }
 
 bool ServerCore::add(const std::shared_ptr<Connection>& connection) {

@@ -8,15 +8,18 @@
 // runs any more; its sends are dropped).
 // Thread safety: every member may be called from any thread.
 
+#include <atomic>
 #include <boost/asio/io_context.hpp>
 #include <condition_variable>
 #include <cstddef>
+#include <limits>
 #include <memory>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "framework/io_pool.h"
+#include "framework/memory_budget.h"
 #include "framework/svc_stub.h"
 #include "framework/thread_annotations.h"
 
@@ -35,6 +38,19 @@ class ServerCore {
   const CmdFactory factory;
   // The threads that run io, and the commands.
   IoPool threads;
+  // What the connections hold in buffers (Options::memoryBudget).
+  MemoryBudget budget;
+  // Returns memory to the system after large releases (Options::trimDelay).
+  MemoryTrimmer trimmer;
+
+  // Reports that a request waits for the budget: at most once a minute, so
+  // that a server that keeps hitting it says so without flooding the log.
+  void noteMemoryWait() noexcept;
+  // Gives bytes back to the budget; counts them towards the next trim.
+  void releaseMemory(std::uint64_t bytes) {
+    budget.release(bytes);
+    trimmer.released(bytes);
+  }
 
   // Hands a problem to the error handler (or logs it when there is none).
   // Never throws.
@@ -54,6 +70,7 @@ class ServerCore {
 
  private:
   const IpcErrorHandler onError_;
+  std::atomic<std::int64_t> lastMemoryNote_{std::numeric_limits<std::int64_t>::min()};  // steady clock, ms
   mutable sys::Mutex mutex_;
   std::condition_variable changed_;  // with mutex_: a connection was removed, or the stop began
   std::unordered_map<const Connection*, std::weak_ptr<Connection>> connections_ GUARDED_BY(mutex_);

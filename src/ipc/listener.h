@@ -108,7 +108,8 @@ class Listener final : public CmdProcessorDBI {
     explicit Passkey() = default;
     friend class Listener;
     friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
-                                                    std::shared_ptr<::DB::DBInstances> pool);
+                                                    std::shared_ptr<::DB::DBInstances> pool,
+                                                    Ipc::SvcStub::Options options);
   };
 
  public:
@@ -116,7 +117,8 @@ class Listener final : public CmdProcessorDBI {
 
  private:
   friend std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4,
-                                                  std::shared_ptr<::DB::DBInstances> pool);
+                                                  std::shared_ptr<::DB::DBInstances> pool,
+                                                  Ipc::SvcStub::Options options);
   friend Ipc::SvcStub& serverOf(Listener& listener);
 
   // What a maintenance command runs on its thread, on the connection's
@@ -142,8 +144,9 @@ class Listener final : public CmdProcessorDBI {
 
 // Builds the Listener and its command server on the port (0: any free
 // port), serving the databases of the pool; throws std::runtime_error when
-// the port cannot be bound.
-std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool);
+// the port cannot be bound. options tune the transport (the memory budget).
+std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool,
+                                         Ipc::SvcStub::Options options = {});
 // The Listener's command server; throws std::logic_error for a detached
 // Listener.
 Ipc::SvcStub& serverOf(Listener& listener);

@@ -8,7 +8,8 @@
 
 namespace Ipc::DB {
 
-std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool) {
+std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std::shared_ptr<::DB::DBInstances> pool,
+                                         Ipc::SvcStub::Options options) {
   // The command server serves from its construction on, so a command may be
   // processed before the constructor has returned: its answer waits until
   // the server is known.
@@ -26,7 +27,7 @@ std::shared_ptr<Listener> createListener(std::uint16_t port, bool forceIp4, std:
     if (auto l = weak.lock()) l->onIpcError(socket, text);
   };
   try {
-    listener->server_ = std::make_shared<Ipc::SvcStub>(port, forceIp4, std::move(factory), std::move(onError));
+    listener->server_ = std::make_shared<Ipc::SvcStub>(port, forceIp4, std::move(factory), std::move(onError), options);
   } catch (...) {
     serverKnown.set_exception(std::current_exception());
     throw;

@@ -95,7 +95,10 @@ void DBSvc::runSvc() {
     const auto started = pool->env().now();
     std::jthread sweeper(
         [pool, started](std::stop_token stop) { DB::removeStaleTempFiles(pool->env(), pool->paths(), started, stop); });
-    std::shared_ptr<Ipc::DB::Listener> created = Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool);
+    Ipc::SvcStub::Options transport;
+    transport.memoryBudget = config.MaxBufferedMiB << 20;  // 0 stays 0: no limit
+    std::shared_ptr<Ipc::DB::Listener> created =
+        Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool, transport);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);
     {
       sys::MutexLock lock(mutex_);

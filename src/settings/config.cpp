@@ -19,6 +19,9 @@ constexpr const char* kConfigFileName = "config.json";
 constexpr std::uint64_t kMaxActiveDBsLimit = 1024;
 constexpr std::uint64_t kMaxActiveClientsPerDBLimit = 30000;
 constexpr std::size_t kPrefixLength = 3;
+// 1 TiB: beyond any machine the server runs on, and far from overflowing
+// when turned into bytes.
+constexpr std::uint64_t kMaxBufferedMiBLimit = std::uint64_t{1} << 20;
 
 // Set while a test installs its own record; inst() must stay a single load
 // on the hot path, hence an atomic pointer rather than a lock.
@@ -87,6 +90,9 @@ void readKeys(const json::Object& obj, DBConfig& c) {
     c.MaxWaitMaintenanceOpSecs = static_cast<std::int32_t>(static_cast<std::uint32_t>(v.asInteger()));
   }
   if (const auto v = obj.get("EnableEngineLogging"); !v.empty()) c.EnableEngineLogging = v.isTrue();
+  if (const auto v = obj.get("MaxBufferedMiB"); !v.empty()) {
+    c.MaxBufferedMiB = limited(v.asInteger(), kMaxBufferedMiBLimit);
+  }
   if (const auto v = obj.get("MaintenanceFolders"); !v.empty()) {
     if (!v.isArray())
       throw json::Exc(std::string("MaintenanceFolders: expected an array of folders, got ") + v.typeName());
@@ -161,7 +167,9 @@ std::string DBConfig::printout() const {
       << "\textra logging: " << onOff(g_LogVerbose) << '\n'
       << "\trecycle log file size: " << Log::kRecycleLogFileSize << '\n'
       << "\tmaximum wait time maintenance operation: " << MaxWaitMaintenanceOpSecs << '\n'
-      << "\tdb engine event logging: " << onOff(EnableEngineLogging) << '\n';
+      << "\tdb engine event logging: " << onOff(EnableEngineLogging) << '\n'
+      << "\tmaximum buffered memory (MiB): "
+      << (MaxBufferedMiB == 0 ? std::string("unlimited") : std::to_string(MaxBufferedMiB)) << '\n';
   return out.str();
 }
 

@@ -32,6 +32,9 @@ class DBConfig {
   std::string DBFileName = "cvdb.edb";
   std::int32_t MaxWaitMaintenanceOpSecs = 10;
   bool EnableEngineLogging = false;
+  // Memory that connections may hold in buffers, all together, in MiB
+  // (answers queued for clients, large requests); 0: no limit.
+  std::uint64_t MaxBufferedMiB = 256;
   // Folders that backup targets and restore sources must lie in (with the
   // backup folder, always allowed); empty allows any path.
   std::vector<std::string> MaintenanceFolders;
@@ -51,7 +54,7 @@ class DBConfig {
   // joined with "db", followed by "/".
   static std::string defaultRoot();
 
-  // The fifteen-line settings printout, without the log entry around it.
+  // The sixteen-line settings printout, without the log entry around it.
   std::string printout() const;
 
   // For tests: makes inst() return the given record while the object lives.

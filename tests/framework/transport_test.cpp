@@ -43,6 +43,10 @@ class Reports {
     texts_.push_back(text);
     changed_.notify_all();
   }
+  bool has(const std::string& fragment) {
+    std::lock_guard lock(mutex_);
+    return std::any_of(texts_.begin(), texts_.end(), [&](const auto& t) { return t.find(fragment) != t.npos; });
+  }
   bool waitFor(const std::string& fragment) {
     std::unique_lock lock(mutex_);
     return changed_.wait_for(lock, 10s * kSlow, [&] {
@@ -73,9 +77,10 @@ class TransportTest : public ::testing::Test {
 
   void start(bool forceIp4 = false) {
     Ipc::SvcStub::Options o;
-    o.stallTimeout = 300ms * kSlow;
+    o.stallTimeout = stallTimeout * kSlow;
     o.closeGrace = 300ms;
     o.ioThreads = 2;
+    o.memoryBudget = memoryBudget;
     proc = std::make_shared<FakeProcessor>();
     server = std::make_unique<Ipc::SvcStub>(
         0, forceIp4, proc->factory(),
@@ -91,8 +96,16 @@ class TransportTest : public ::testing::Test {
     server.reset();
   }
   std::uint16_t port() const { return server->port(); }
+  void restartWithBudget(std::uint64_t bytes, std::chrono::milliseconds stall = 300ms) {
+    stop();
+    memoryBudget = bytes;
+    stallTimeout = stall;
+    start();
+  }
 
   Reports reports;
+  std::uint64_t memoryBudget = Ipc::SvcStub::kDefaultMemoryBudget;
+  std::chrono::milliseconds stallTimeout = 300ms;
   std::shared_ptr<FakeProcessor> proc;
   std::unique_ptr<Ipc::SvcStub> server;
 };
@@ -500,6 +513,113 @@ TEST_F(TransportTest, RunningOutOfDescriptorsRefusesNewConnectionsAndKeepsServin
   EXPECT_EQ(got, 0);
   EXPECT_TRUE(served.ping());
   EXPECT_TRUE(RawClient(port()).ping());
+}
+
+// ---------------------------------------------------------------- memory budget
+
+constexpr std::uint64_t kSmallBudget = 1 << 20;
+
+// Sends bytes on another thread: a request that waits for the budget is not
+// read, and its sender blocks once the socket buffers are full.
+std::future<void> sendAsync(RawClient& c, std::string bytes) {
+  return std::async(std::launch::async, [&c, b = std::move(bytes)] { c.send(b); });
+}
+
+TEST_F(TransportTest, PastTheMemoryBudgetNewRequestsWaitUntilAClientThatDoesNotReadIsEnded) {
+  restartWithBudget(kSmallBudget);
+  RawClient hog(port());
+  hog.send(requestBytes(kBig, strField("67108864")));
+  ASSERT_TRUE(eventually([&] { return server->bufferedBytes() > kSmallBudget; }));
+
+  // Neither a new command nor a new large frame starts.
+  RawClient small(port());
+  RawClient large(port());
+  const std::string text(600000, 'x');
+  small.send(requestBytes(kEcho, strField("small")));
+  auto sent = sendAsync(large, requestBytes(kEcho, strField(text)));
+  ASSERT_TRUE(eventually([&] { return server->connectionsWaitingForMemory() == 2; }));
+  EXPECT_TRUE(reports.has("Memory budget of 1 MiB reached"));
+
+  // The stall timer ends the hog, and only that lets the others go on.
+  EXPECT_EQ(answerOf(small), "small");
+  EXPECT_TRUE(reports.has("has not read its answers"));
+  EXPECT_TRUE(answerOf(large) == text);
+  sent.get();
+  EXPECT_EQ(server->connectionsWaitingForMemory(), 0u);
+  // Everything counted is given back once the answers are read.
+  EXPECT_TRUE(eventually([&] { return server->bufferedBytes() == 0; }));
+}
+
+TEST_F(TransportTest, AClientThatReadsItsLargeAnswerLateLetsTheWaitingRequestsGoOn) {
+  // A stall timeout long enough that the slow reader is not ended.
+  restartWithBudget(kSmallBudget, 20s);
+  RawClient reader(port());
+  RawClient other(port());
+  reader.send(requestBytes(kBig, strField("67108864")));
+  ASSERT_TRUE(eventually([&] { return server->bufferedBytes() > kSmallBudget; }));
+  other.send(requestBytes(kEcho, strField("after the reader")));
+  ASSERT_TRUE(eventually([&] { return server->connectionsWaitingForMemory() == 1; }));
+  const auto big = reader.read(30s);
+  ASSERT_TRUE(big && big->kind == FrameKind::Answer);
+  EXPECT_EQ(answerOf(other), "after the reader");
+  EXPECT_EQ(server->connectionCount(), 2u);
+  EXPECT_TRUE(eventually([&] { return server->bufferedBytes() == 0; }));
+}
+
+// A large frame counts its whole length from its first bytes until its
+// command ends; a frame that waits for room is not read meanwhile, and the
+// stall timer, which counts only frames partly read, leaves it alone
+// however long the wait.
+TEST_F(TransportTest, ALargeFrameWaitsForRoomBeyondTheStallTimeoutAndThenGoesOn) {
+  restartWithBudget(kSmallBudget);
+  RawClient holder(port());
+  const std::string held(700000, 'h');
+  auto heldSent = sendAsync(holder, requestBytes(kBlock, strField(held)));
+  ASSERT_TRUE(proc->waitStarted(held));
+  heldSent.get();
+  EXPECT_GE(server->bufferedBytes(), held.size());
+
+  RawClient waiter(port());
+  const std::string text(700000, 'w');
+  auto sent = sendAsync(waiter, requestBytes(kEcho, strField(text)));
+  ASSERT_TRUE(eventually([&] { return server->connectionsWaitingForMemory() == 1; }));
+  // Three stall timeouts: the span under test, not a synchronisation.
+  std::this_thread::sleep_for(3 * 300ms * kSlow);
+  EXPECT_FALSE(reports.has("sent part of a frame"));
+  EXPECT_EQ(server->connectionCount(), 2u);
+
+  proc->openGate();
+  EXPECT_TRUE(answerOf(holder) == held);
+  EXPECT_TRUE(answerOf(waiter) == text);
+  sent.get();
+  EXPECT_TRUE(eventually([&] { return server->bufferedBytes() == 0; }));
+}
+
+TEST_F(TransportTest, AFrameLargerThanTheWholeBudgetIsServedWhenNothingElseIsCounted) {
+  restartWithBudget(kSmallBudget);
+  // Alone, at once.
+  RawClient c(port());
+  std::string text(3 << 20, '\0');
+  for (std::size_t i = 0; i < text.size(); ++i) text[i] = static_cast<char>(i * 13 + 1);
+  EXPECT_TRUE(echo(c, text) == text);
+
+  // Beside a running command's reservation it waits for that to end.
+  RawClient holder(port());
+  const std::string held(100000, 'h');
+  holder.send(requestBytes(kBlock, strField(held)));
+  ASSERT_TRUE(proc->waitStarted(held));
+  auto sent = sendAsync(c, requestBytes(kEcho, strField(text)));
+  ASSERT_TRUE(eventually([&] { return server->connectionsWaitingForMemory() == 1; }));
+  proc->openGate();
+  EXPECT_TRUE(answerOf(holder) == held);
+  EXPECT_TRUE(answerOf(c) == text);
+  sent.get();
+
+  // Connections that end with answers queued give them back.
+  c.send(requestBytes(kBig, strField("67108864")));
+  ASSERT_TRUE(eventually([&] { return server->bufferedBytes() > kSmallBudget; }));
+  c.close(true);
+  EXPECT_TRUE(eventually([&] { return server->bufferedBytes() == 0; }));
 }
 
 }  // namespace

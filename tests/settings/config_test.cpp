@@ -66,7 +66,8 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
                                "\textra logging: disabled\n"
                                "\trecycle log file size: 10485760\n"
                                "\tmaximum wait time maintenance operation: 10\n"
-                               "\tdb engine event logging: disabled\n";
+                               "\tdb engine event logging: disabled\n"
+                               "\tmaximum buffered memory (MiB): 256\n";
   const auto entries = log.entries();
   ASSERT_EQ(entries.size(), 1u);
   EXPECT_EQ(entries[0].priority, Log::Notice);
@@ -169,6 +170,14 @@ TEST(Config, NumbersAreLimitedAndTruncatedAsStored) {
   EXPECT_EQ(b.MaxActiveClientsPerDB, 30000u);
   EXPECT_EQ(b.MaxWaitMaintenanceOpSecs, -1);
   EXPECT_NE(b.printout().find("\tmaximum wait time maintenance operation: -1\n"), std::string::npos);
+
+  // The memory bound: 256 MiB unless set, 0 switches it off, 1 TiB at most.
+  EXPECT_EQ(loadWith("{}").MaxBufferedMiB, 256u);
+  const DBConfig off = loadWith(R"({"MaxBufferedMiB": 0})");
+  EXPECT_EQ(off.MaxBufferedMiB, 0u);
+  EXPECT_NE(off.printout().find("\tmaximum buffered memory (MiB): unlimited\n"), std::string::npos);
+  EXPECT_EQ(loadWith(R"({"MaxBufferedMiB": -1})").MaxBufferedMiB, std::uint64_t{1} << 20);
+  EXPECT_EQ(loadWith(R"({"MaxBufferedMiB": 64})").MaxBufferedMiB, 64u);
 }
 
 TEST(Config, TextsArePaddedCutOrNormalised) {
