@@ -17,6 +17,13 @@ namespace {
 namespace asio = boost::asio;
 using Clock = std::chrono::steady_clock;
 
+// Ends the connection for a request that did not decode: at once from its
+// frame, or later in finishRequest, with the same texts either way.
+void failMalformed(Connection& c, const CmdI& cmd, const std::string& problem) {
+  c.fail("Malformed request " + cmd.name() + " from " + c.peer() + ": " + problem + "; connection ended",
+         "Malformed request " + cmd.name() + ": " + problem);
+}
+
 }  // namespace
 
 void Connection::startRead() {
@@ -149,8 +156,7 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
       enqueue(textFrame(r.tag, wire::FrameKind::Refused, "Unknown command tag " + tag));
       return;
     case Outcome::Malformed:
-      fail("Malformed request " + r.cmd->name() + " from " + peer_ + ": " + r.problem + "; connection ended",
-           "Malformed request " + r.cmd->name() + ": " + r.problem);
+      failMalformed(*this, *r.cmd, r.problem);
       return;
     case Outcome::Command:
       break;
@@ -160,7 +166,12 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
   cmd->attachSocket(shared_from_this());
   const auto processor = cmd->processor();
   if (!processor) {
-    // Keep-alive and the like: answered here, without a processor.
+    // Keep-alive and the like: answered here, without a processor (and
+    // with nothing costly left to decode).
+    if (const auto problem = finishRequest(*cmd)) {
+      failMalformed(*this, *cmd, *problem);
+      return;
+    }
     wire::OutFrame answer;
     try {
       answer = cmd->answerFrame();
@@ -192,6 +203,13 @@ void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr
   // Another thread takes over the other connections if this one blocks.
   IoPool::Busy busy(core_->threads);
   try {
+    // The costly rest of the request's decoding (a large JSON text) is done
+    // here rather than on the strand, where it would hold up the thread's
+    // other connections.
+    if (const auto problem = finishRequest(*cmd)) {
+      failMalformed(*this, *cmd, *problem);
+      return;
+    }
     processor->processCmd(cmd);
   } catch (const std::exception& e) {
     fail("Command " + cmd->name() + " from " + peer_ + " failed: " + e.what() + "; connection ended",

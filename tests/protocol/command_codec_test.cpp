@@ -44,6 +44,7 @@ std::shared_ptr<C> toServer(const C& client) {
   auto server = std::make_shared<C>();
   wire::Reader in = r.reader();
   server->readRequest(in);
+  server->finishRequest();
   return server;
 }
 
@@ -224,6 +225,7 @@ bool refused(Ipc::CmdI& cmd, const std::string& payload, bool request) {
     wire::Reader in(payload);
     if (request) {
       cmd.readRequest(in);
+      cmd.finishRequest();
     } else {
       cmd.readAnswer(in);
     }
