@@ -33,11 +33,12 @@ void Connection::startRead() {
   if (inBody_) {
     if (bodyGot_ == body_->size()) {
       // The frame's bytes go into a buffer that grows with what has arrived,
-      // so that a length field alone never reserves the announced size.
-      const std::uint64_t capacity = std::min<std::uint64_t>(bodyLen_, body_->size() * 2);
-      auto bigger = std::make_shared<MemBuffer>(capacity);
-      std::memcpy(bigger->data(), body_->data(), static_cast<std::size_t>(bodyGot_));
-      body_ = std::move(bigger);
+      // so that a length field alone never reserves the announced size. It
+      // grows in place (no read into it is in flight, and the last one's
+      // handler shares this very MemBuffer): a large one is remapped, not
+      // copied, which on this thread would hold up its other connections
+      // for as long as copying the frame so far takes.
+      body_->grow(std::min<std::uint64_t>(bodyLen_, body_->size() * 2));
     }
     readInto(body_, body_->data() + bodyGot_, static_cast<std::size_t>(body_->size() - bodyGot_));
   } else {
