@@ -195,14 +195,24 @@ void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_
   // The command runs on this thread once the strand's handler has returned
   // (a deferred task is not handed to another thread), but outside the
   // strand: the connection's writes, timers and closing go on meanwhile.
-  asio::defer(core_->io.get_executor(), [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
+  // The command travels in a slot that execute empties: Asio may copy the
+  // handler on its way (its default invocation hook runs a copy), and the
+  // share of every copy would outlive the busy scope.
+  auto slot = std::make_shared<std::shared_ptr<CmdI>>(cmd);
+  asio::defer(core_->io.get_executor(),
+              [self = shared_from_this(), slot, processor] { self->execute(std::move(*slot), processor); });
 }
 
-void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+void Connection::execute(std::shared_ptr<CmdI> command, const std::shared_ptr<CmdProcessorI>& processor) {
   // Closed before it started (the server is stopping): nobody waits for it.
   if (!open_.load()) return;
   // Another thread takes over the other connections if this one blocks.
   IoPool::Busy busy(core_->threads);
+  // Released before the busy scope ends (usually the last share): freeing a
+  // large request or answer (the parsed tree of a configuration part takes
+  // about as long to free as to build) is part of the command's time, not
+  // of the I/O thread's handlers.
+  const std::shared_ptr<CmdI> cmd = std::move(command);
   try {
     // The costly rest of the request's decoding (a large JSON text) is done
     // here rather than on the strand, where it would hold up the thread's
