@@ -98,6 +98,10 @@ int main(int argc, char** argv) {
     std::atomic<bool> writing{false};
     std::atomic<bool> done{false};
     std::vector<double> latencies;
+    // The longest read and when it began, from the writers' start.
+    double longest = 0;
+    double longestAt = 0;
+    Clock::time_point writersStart;
     std::string bystanderError;
     std::thread reader([&] {
       latencies.reserve(1 << 20);
@@ -106,7 +110,13 @@ int main(int argc, char** argv) {
           const auto t0 = Clock::now();
           const bool counted = writing;
           if (bystander.getCfg("probe").empty()) throw std::runtime_error("the probe part is missing");
-          if (counted) latencies.push_back(ms(Clock::now() - t0));
+          if (counted) {
+            latencies.push_back(ms(Clock::now() - t0));
+            if (latencies.back() > longest) {
+              longest = latencies.back();
+              longestAt = ms(t0 - writersStart);
+            }
+          }
         }
       } catch (const std::exception& e) {
         bystanderError = e.what();
@@ -130,6 +140,7 @@ int main(int argc, char** argv) {
     }
     // The bystander is under way before the writers start.
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    writersStart = Clock::now();
     writing = true;
     go = true;
     for (auto& t : threads) t.join();
@@ -146,9 +157,14 @@ int main(int argc, char** argv) {
     const auto pick = [&](double q) {
       return latencies[std::min(latencies.size() - 1, static_cast<std::size_t>(q * latencies.size()))];
     };
-    std::printf("bystander p50 %.3f ms p99 %.3f ms max %.3f ms reads %zu; %u writers of %zu MiB, slowest %.0f ms\n",
-                pick(0.5), pick(0.99), latencies.back(), latencies.size(), writers, mib,
-                *std::max_element(writerMs.begin(), writerMs.end()));
+    const auto over = [&](double limit) {
+      return latencies.end() - std::upper_bound(latencies.begin(), latencies.end(), limit);
+    };
+    std::printf(
+        "bystander p50 %.3f ms p99 %.3f ms max %.3f ms reads %zu (over 20 ms: %td, over 200 ms: %td; longest at +%.0f "
+        "ms); %u writers of %zu MiB, slowest %.0f ms\n",
+        pick(0.5), pick(0.99), latencies.back(), latencies.size(), over(20), over(200), longestAt, writers, mib,
+        *std::max_element(writerMs.begin(), writerMs.end()));
   } catch (const std::exception& e) {
     std::fprintf(stderr, "big_cfg_bench: %s\n", e.what());
     return 1;
