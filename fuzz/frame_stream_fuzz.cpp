@@ -2,7 +2,8 @@
 // frames. Each frame's length field is checked as the transport checks it,
 // then the frame goes through the transport's request decoding with the
 // server's command table: kind check, command creation by tag, the
-// command's request decoder and the exact-consumption rule.
+// command's request decoder and the exact-consumption rule, then the rest
+// of the request's decoding (finishRequest).
 //
 // The properties: no crash, no read outside a frame (each body is copied to
 // an allocation of exactly its size, so AddressSanitizer sees any overrun),
@@ -34,6 +35,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     switch (r.outcome) {
       case Outcome::Command:
         if (!r.cmd || r.cmd->tag() != r.tag) __builtin_trap();
+        // The rest of the decoding, which the server does where the command
+        // runs; a failure there ends the connection too.
+        if (Ipc::finishRequest(*r.cmd)) return 0;
         break;
       case Outcome::UnknownTag:
         if (r.cmd) __builtin_trap();

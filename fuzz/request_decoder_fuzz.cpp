@@ -27,7 +27,10 @@ bool decode(Ipc::CmdI& cmd, const std::string& payload, bool request) {
   wire::Reader in(owner, payload.size());
   try {
     if (request) {
+      // What the server does with a request: read it, then finish it where
+      // the command runs.
       cmd.readRequest(in);
+      cmd.finishRequest();
     } else {
       cmd.readAnswer(in);
     }

@@ -25,6 +25,16 @@ MemBuffer MemBuffer::copyOf(const void* data, std::uint64_t size) {
   return b;
 }
 
+void MemBuffer::grow(std::uint64_t size) {
+  if (size <= size_) return;
+  if (size > std::numeric_limits<std::size_t>::max()) throw std::bad_alloc();
+  void* p = std::realloc(data_.get(), static_cast<std::size_t>(size));
+  if (!p) throw std::bad_alloc();
+  (void)data_.release();  // realloc has taken the old block over
+  data_.reset(static_cast<unsigned char*>(p));
+  size_ = size;
+}
+
 unsigned char* MemBuffer::release() noexcept {
   size_ = 0;
   return data_.release();

@@ -37,6 +37,14 @@ class MemBuffer {
     return {reinterpret_cast<const char*>(data_.get()), static_cast<std::size_t>(size_)};
   }
 
+  // Grows the buffer to size bytes (no smaller than size()), keeping its
+  // bytes; the new ones are not initialised. The bytes may move, so
+  // pointers into them become invalid. A large buffer is remapped rather
+  // than copied (realloc), so growing one step by step costs nothing in
+  // proportion to what it holds. Throws std::bad_alloc, leaving the buffer
+  // as it was.
+  void grow(std::uint64_t size);
+
   // Hands the bytes to the caller, who releases them with ExportedUCharAlloc.
   unsigned char* release() noexcept;
 

@@ -4,8 +4,9 @@
 //
 // The transport reads a request frame, asks its factory for a command of the
 // frame's tag, lets the command read its request, attaches the connection's
-// Socket and hands the command to its processor's processCmd (commands
-// without a processor, such as PingPong, are answered at once). The
+// Socket and hands the command to its processor's processCmd, on the thread
+// that runs it, after the command's finishRequest (commands without a
+// processor, such as PingPong, are answered at once). The
 // processor runs the command and calls SvcStub::onRespReady, which sends the
 // answer, or the command's onTransferError, which ends the connection.
 //
@@ -76,6 +77,16 @@ class CmdI : public std::enable_shared_from_this<CmdI> {
   // readRequest throws wire::DecodeError (or json::Exc for JSON fields) on
   // malformed input.
   virtual void readRequest(wire::Reader& in) = 0;
+  // Server side: completes what readRequest left for later. readRequest
+  // runs on an I/O thread while the frame is cut from the connection's
+  // bytes, where work in proportion to a large payload (parsing a JSON text
+  // of megabytes) would hold up every connection that thread serves; it
+  // checks the framing and keeps such a field's bytes, and this parses
+  // them. Called once, on the thread that runs the command (where it may
+  // take its time), before the processor sees the command. Throws as
+  // readRequest does; the request is then malformed. The default does
+  // nothing.
+  virtual void finishRequest() {}
   virtual void writeAnswer(wire::Writer& out) const = 0;
   // Client side: write the request payload, read the answer payload.
   virtual void writeRequest(wire::Writer& out) const = 0;

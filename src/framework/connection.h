@@ -129,8 +129,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void parse();
   void handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t size);
   void runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
-  // Not on the strand: runs the command in a busy scope of the I/O pool.
-  void execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor);
+  // Not on the strand: runs the command in a busy scope of the I/O pool,
+  // and lets go of it there.
+  void execute(std::shared_ptr<CmdI> command, const std::shared_ptr<CmdProcessorI>& processor);
   void settleAfterEof();
 
   void enqueue(wire::OutFrame frame);

@@ -17,6 +17,13 @@ namespace {
 namespace asio = boost::asio;
 using Clock = std::chrono::steady_clock;
 
+// Ends the connection for a request that did not decode: at once from its
+// frame, or later in finishRequest, with the same texts either way.
+void failMalformed(Connection& c, const CmdI& cmd, const std::string& problem) {
+  c.fail("Malformed request " + cmd.name() + " from " + c.peer() + ": " + problem + "; connection ended",
+         "Malformed request " + cmd.name() + ": " + problem);
+}
+
 }  // namespace
 
 void Connection::startRead() {
@@ -28,11 +35,12 @@ void Connection::startRead() {
   if (inBody_) {
     if (bodyGot_ == body_->size()) {
       // The frame's bytes go into a buffer that grows with what has arrived,
-      // so that a length field alone never reserves the announced size.
-      const std::uint64_t capacity = std::min<std::uint64_t>(bodyLen_, body_->size() * 2);
-      auto bigger = std::make_shared<MemBuffer>(capacity);
-      std::memcpy(bigger->data(), body_->data(), static_cast<std::size_t>(bodyGot_));
-      body_ = std::move(bigger);
+      // so that a length field alone never reserves the announced size. It
+      // grows in place (no read into it is in flight, and the last one's
+      // handler shares this very MemBuffer): a large one is remapped, not
+      // copied, which on this thread would hold up its other connections
+      // for as long as copying the frame so far takes.
+      body_->grow(std::min<std::uint64_t>(bodyLen_, body_->size() * 2));
     }
     readInto(body_, body_->data() + bodyGot_, static_cast<std::size_t>(body_->size() - bodyGot_));
   } else {
@@ -158,8 +166,7 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
       enqueue(textFrame(r.tag, wire::FrameKind::Refused, "Unknown command tag " + tag));
       return;
     case Outcome::Malformed:
-      fail("Malformed request " + r.cmd->name() + " from " + peer_ + ": " + r.problem + "; connection ended",
-           "Malformed request " + r.cmd->name() + ": " + r.problem);
+      failMalformed(*this, *r.cmd, r.problem);
       return;
     case Outcome::Command:
       break;
@@ -169,7 +176,12 @@ void Connection::handleFrame(std::shared_ptr<unsigned char> body, std::uint32_t 
   cmd->attachSocket(shared_from_this());
   const auto processor = cmd->processor();
   if (!processor) {
-    // Keep-alive and the like: answered here, without a processor.
+    // Keep-alive and the like: answered here, without a processor (and
+    // with nothing costly left to decode).
+    if (const auto problem = finishRequest(*cmd)) {
+      failMalformed(*this, *cmd, *problem);
+      return;
+    }
     wire::OutFrame answer;
     try {
       answer = cmd->answerFrame();
@@ -193,15 +205,32 @@ void Connection::runCommand(const std::shared_ptr<CmdI>& cmd, const std::shared_
   // The command runs on this thread once the strand's handler has returned
   // (a deferred task is not handed to another thread), but outside the
   // strand: the connection's writes, timers and closing go on meanwhile.
-  asio::defer(core_->io.get_executor(), [self = shared_from_this(), cmd, processor] { self->execute(cmd, processor); });
+  // The command travels in a slot that execute empties: Asio may copy the
+  // handler on its way (its default invocation hook runs a copy), and the
+  // share of every copy would outlive the busy scope.
+  auto slot = std::make_shared<std::shared_ptr<CmdI>>(cmd);
+  asio::defer(core_->io.get_executor(),
+              [self = shared_from_this(), slot, processor] { self->execute(std::move(*slot), processor); });
 }
 
-void Connection::execute(const std::shared_ptr<CmdI>& cmd, const std::shared_ptr<CmdProcessorI>& processor) {
+void Connection::execute(std::shared_ptr<CmdI> command, const std::shared_ptr<CmdProcessorI>& processor) {
   // Closed before it started (the server is stopping): nobody waits for it.
   if (!open_.load()) return;
   // Another thread takes over the other connections if this one blocks.
   IoPool::Busy busy(core_->threads);
+  // Released before the busy scope ends (usually the last share): freeing a
+  // large request or answer (the parsed tree of a configuration part takes
+  // about as long to free as to build) is part of the command's time, not
+  // of the I/O thread's handlers.
+  const std::shared_ptr<CmdI> cmd = std::move(command);
   try {
+    // The costly rest of the request's decoding (a large JSON text) is done
+    // here rather than on the strand, where it would hold up the thread's
+    // other connections.
+    if (const auto problem = finishRequest(*cmd)) {
+      failMalformed(*this, *cmd, *problem);
+      return;
+    }
     processor->processCmd(cmd);
   } catch (const std::exception& e) {
     fail("Command " + cmd->name() + " from " + peer_ + " failed: " + e.what() + "; connection ended",

@@ -171,7 +171,9 @@ namespace {
 
 Value parse(const char* data, std::size_t size, std::size_t flags) {
   json_error_t error;
-  json_t* v = json_loadb(data, size, flags | JSON_ALLOW_NUL, &error);
+  // An empty view may have no address, which the parser refuses as a wrong
+  // argument; it is the empty text, with the parser's own message for it.
+  json_t* v = json_loadb(data ? data : "", size, flags | JSON_ALLOW_NUL, &error);
   if (!v) {
     throw Exc("JSON error: " + std::string(error.text) + " at line " + std::to_string(error.line) + ", column " +
               std::to_string(error.column));

@@ -51,4 +51,17 @@ DecodedRequest decodeRequest(const std::shared_ptr<unsigned char>& body, std::ui
   return r;
 }
 
+std::optional<std::string> finishRequest(CmdI& cmd) {
+  try {
+    cmd.finishRequest();
+  } catch (const std::bad_alloc&) {
+    throw;
+  } catch (const std::exception& e) {
+    return std::string(e.what());
+  } catch (...) {
+    return std::string("unknown exception");
+  }
+  return std::nullopt;
+}
+
 }  // namespace Ipc

@@ -50,14 +50,18 @@ bool Reader::boolean() {
   return v == 1;
 }
 
-std::string Reader::str() {
+std::string Reader::str() { return std::string(strView()); }
+
+std::string_view Reader::strView() {
   const std::uint32_t n = u32();
   need(n, "string");
-  std::string s(reinterpret_cast<const char*>(p_), n);
+  std::string_view v(reinterpret_cast<const char*>(p_), n);
   p_ += n;
   left_ -= n;
-  return s;
+  return v;
 }
+
+SharedMemBuffer Reader::sharedStr() { return share(strView()); }
 
 std::string_view Reader::bytes() {
   const std::uint64_t n = u64();
@@ -68,8 +72,9 @@ std::string_view Reader::bytes() {
   return v;
 }
 
-SharedMemBuffer Reader::sharedBytes() {
-  const std::string_view v = bytes();
+SharedMemBuffer Reader::sharedBytes() { return share(bytes()); }
+
+SharedMemBuffer Reader::share(std::string_view v) const {
   if (v.empty()) return {};
   if (owner_) {
     auto* p = reinterpret_cast<unsigned char*>(const_cast<char*>(v.data()));

@@ -78,6 +78,13 @@ class Reader {
   std::uint64_t u64() { return fixed<std::uint64_t>(); }
   std::int64_t i64() { return static_cast<std::int64_t>(fixed<std::uint64_t>()); }
   std::string str();
+  // The same encoding as str(), as a view into the reader's bytes (valid as
+  // long as they are): a long text is neither copied nor allocated.
+  std::string_view strView();
+  // The same encoding as str(), as a buffer that shares the reader's owner
+  // (or a copy when the reader has none): bytes kept for later without a
+  // copy.
+  SharedMemBuffer sharedStr();
   // A view into the reader's bytes (valid as long as they are): u64 length,
   // then the bytes.
   std::string_view bytes();
@@ -92,6 +99,8 @@ class Reader {
 
  private:
   void need(std::uint64_t n, const char* what) const;
+  // The view's bytes as a buffer that shares the owner, or a copy.
+  SharedMemBuffer share(std::string_view v) const;
   template <typename T>
   T fixed() {
     need(sizeof(T), "integer");

@@ -1,5 +1,7 @@
 #include "protocol/config_data_cmds.h"
 
+#include <utility>
+
 #include "protocol/record_wire.h"
 
 namespace Ipc::DB {
@@ -60,15 +62,25 @@ void SetCfgPart::setDeleteRequest(std::string key) {
 void SetCfgPart::readRequest(wire::Reader& in) {
   key_ = in.str();
   delete_ = in.boolean();
-  const json::Value v = wirefmt::readJson(in);
+  // The json? field of wirefmt::readJson, its text kept unparsed.
+  textPending_ = in.boolean();
+  text_ = textPending_ ? in.sharedStr() : SharedMemBuffer();
   in.expectEnd();
-  if (delete_) {
-    if (!v.empty()) throw wire::DecodeError("SetCfgPart deletes and carries data");
-    data_ = json::Object();
-  } else {
-    if (v.empty()) throw wire::DecodeError("SetCfgPart carries no data");
-    data_ = json::Object(v);  // json::Exc unless an object
-  }
+  data_ = json::Object();
+  if (!textPending_ && !delete_) throw wire::DecodeError("SetCfgPart carries no data");
+}
+
+void SetCfgPart::finishRequest() {
+  if (!textPending_) return;
+  textPending_ = false;
+  // The frame's bytes go once parsed, before the command runs.
+  SharedMemBuffer text;
+  std::swap(text, text_);
+  // Parsed first even when deleting, so that a text that is not JSON is
+  // refused for that, whatever else is wrong with the request.
+  const json::Value v = json::strToValue(text.view());
+  if (delete_) throw wire::DecodeError("SetCfgPart deletes and carries data");
+  data_ = json::Object(v);  // json::Exc unless an object
 }
 
 void SetCfgPart::writeRequest(wire::Writer& out) const {

@@ -70,13 +70,20 @@ class GetCfgPart final : public DbCmd<GetCfgPart> {
 };
 
 // Tag 5: writes or deletes one configuration part.
+//
+// On the server, readRequest checks the fields' framing and keeps the JSON
+// text's bytes, shared with the request frame; finishRequest parses them.
+// A part runs to hundreds of megabytes, and its parse (with the UTF-8
+// check) then takes seconds, which belong on the command's thread and not
+// on the I/O thread that cut the frame.
 class SetCfgPart final : public DbCmd<SetCfgPart> {
  public:
   using DbCmd::DbCmd;
 
   const std::string& key() const noexcept { return key_; }
   bool deleteData() const noexcept { return delete_; }
-  // The object to store; an empty object when deleteData().
+  // The object to store; an empty object when deleteData(). On the server,
+  // set by finishRequest.
   const json::Object& jCfgData() const noexcept { return data_; }
   void setRequest(std::string key, json::Object data);
   void setDeleteRequest(std::string key);
@@ -84,6 +91,7 @@ class SetCfgPart final : public DbCmd<SetCfgPart> {
   void setResp() {}
 
   void readRequest(wire::Reader& in) override;
+  void finishRequest() override;
   void writeAnswer(wire::Writer&) const override {}
   void writeRequest(wire::Writer& out) const override;
   void readAnswer(wire::Reader& in) override { in.expectEnd(); }
@@ -92,6 +100,10 @@ class SetCfgPart final : public DbCmd<SetCfgPart> {
   std::string key_;
   bool delete_ = false;
   json::Object data_;
+  // Between readRequest and finishRequest: the request carries a JSON text,
+  // and its bytes (released once parsed).
+  bool textPending_ = false;
+  SharedMemBuffer text_;
 };
 
 // Tag 6: lists the configuration keys that begin with a prefix.

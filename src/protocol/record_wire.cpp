@@ -64,8 +64,7 @@ void writeJson(wire::Writer& out, const json::Value& v) {
 
 json::Value readJson(wire::Reader& in) {
   if (!in.boolean()) return {};
-  const std::string text = in.str();
-  return json::strToValue(text);
+  return json::strToValue(in.strView());
 }
 
 void writeUse(wire::Writer& out, const UseInfo& u) {

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "e2e_support.h"
+#include "framework/wire.h"
 #include "support/raw_db.h"
 
 namespace {
@@ -124,6 +125,59 @@ TEST(ServerRequests, ARefusalKeepsTheConnectionAndAMalformedRequestEndsOnlyItsOw
   EXPECT_TRUE(endedBy([&] { malformed->awaitEnd(); }).starts_with("Malformed request GetData"));
   EXPECT_TRUE(server.waitForLogLine("Ipc Malformed request GetData from 127.0.0.1:"));
   bystander->ping();
+}
+
+// A configuration part's JSON text is parsed where the command runs, not
+// where its frame is read: valid parts, small and large, are stored in
+// compact form, the delete form removes them, and each kind of bad part
+// ends only its own connection with the parser's reason in the Bye and in
+// the log, having stored nothing.
+TEST(ServerRequests, ConfigurationTextsAreCheckedBeforeTheCommandRunsAndRefusedWithTheirReason) {
+  ServerProcess server(kServer);
+  auto owner = clientOf(server, "cfgtexts");
+  const auto setCfg = [](const std::string& key, bool del, int present, const std::string& text) {
+    std::string payload;
+    wire::Writer w(payload);
+    w.str(key);
+    w.boolean(del);
+    w.u8(static_cast<std::uint8_t>(present));
+    if (present) w.str(text);
+    return payload;
+  };
+
+  std::string big = "{ \"list\": [";
+  std::string compact = "{\"list\":[";
+  for (int i = 0; big.size() < (1 << 20); ++i) {
+    big += (i ? ", " : "") + std::to_string(i);
+    compact += (i ? "," : "") + std::to_string(i);
+  }
+  big += "] }";
+  compact += "]}";
+  EXPECT_EQ(owner->request(5, setCfg("big", false, 1, big)), "");
+  EXPECT_EQ(owner->getCfg("big").dump(), compact);
+  EXPECT_EQ(owner->request(5, setCfg("small", false, 1, R"({"b": [true, null], "a": "x"})")), "");
+  EXPECT_EQ(owner->getCfg("small").dump(), R"({"b":[true,null],"a":"x"})");
+  EXPECT_EQ(owner->request(5, setCfg("big", true, 0, "")), "");
+  EXPECT_TRUE(owner->getCfg("big").empty());
+
+  const std::vector<std::pair<std::string, std::string>> refused{
+      {setCfg("bad", false, 1, "{\"a\":"), "JSON error: unexpected token near end of file at line 1, column 5"},
+      {setCfg("bad", false, 1, "[1]"), "JSON error: Wrong type: array. Expected type: object"},
+      {setCfg("bad", false, 1, "{\"a\":\"caf\xE9\"}"),
+       "JSON error: unable to decode byte 0xe9 near '\"caf' at line 1, column 9"},
+      {setCfg("bad", false, 0, ""), "SetCfgPart carries no data"},
+      {setCfg("small", true, 1, "{}"), "SetCfgPart deletes and carries data"},
+      {setCfg("small", true, 1, "{"), "JSON error: string or '}' expected near end of file at line 1, column 1"},
+  };
+  for (const auto& [payload, why] : refused) {
+    SCOPED_TRACE(why);
+    auto c = clientOf(server, "cfgtexts");
+    EXPECT_EQ(endedBy([&] { c->request(5, payload); }), "Malformed request SetCfgPart: " + why);
+    EXPECT_TRUE(server.waitForLogLine(": " + why + "; connection ended"));
+  }
+  EXPECT_EQ(server.countLogLines("Ipc Malformed request SetCfgPart from 127.0.0.1:"), refused.size());
+  EXPECT_TRUE(owner->getCfg("bad").empty());
+  EXPECT_EQ(owner->getCfg("small").dump(), R"({"b":[true,null],"a":"x"})");
 }
 
 // The session of a connection that the server ends is given back when the

@@ -16,6 +16,11 @@ void TestCmd::writeAnswer(wire::Writer& out) const {
   }
 }
 
+void TestCmd::finishRequest() {
+  if (tag_ == kFinishFails) throw wire::DecodeError("deferred " + text);
+  if (tag_ == kFinishBlocks) processor_->holdInFinish(text);
+}
+
 FakeProcessor::~FakeProcessor() { joinThreads(); }
 
 namespace {
@@ -40,6 +45,7 @@ void FakeProcessor::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
   record("start:" + c.text);
   switch (c.tag()) {
     case kEcho:
+    case kFinishBlocks:
       c.answer = c.text;
       break;
     case kBlock: {
@@ -101,10 +107,20 @@ void FakeProcessor::openGate() {
 }
 
 bool FakeProcessor::waitStarted(const std::string& text, std::chrono::milliseconds timeout) {
+  return waitFor("start:" + text, timeout);
+}
+
+bool FakeProcessor::waitFor(const std::string& event, std::chrono::milliseconds timeout) {
   sys::MutexLock lock(mutex_);
   return changed_.wait_for(lock.native(), timeout, [&]() REQUIRES(mutex_) {
-    return std::find(events_.begin(), events_.end(), "start:" + text) != events_.end();
+    return std::find(events_.begin(), events_.end(), event) != events_.end();
   });
+}
+
+void FakeProcessor::holdInFinish(const std::string& text) {
+  record("finish:" + text);
+  sys::MutexLock lock(mutex_);
+  changed_.wait(lock.native(), [this]() REQUIRES(mutex_) { return gateOpen_; });
 }
 
 std::vector<std::string> FakeProcessor::events() const {
@@ -135,7 +151,9 @@ Ipc::CmdFactory FakeProcessor::factory() {
     ++self->created;
     if (tag == 1) return std::make_shared<Ipc::PingPong>();
     if (tag == kFactoryThrows) throw std::bad_weak_ptr();
-    if (tag >= kEcho && tag <= kSlot) return std::make_shared<TestCmd>(tag, self);
+    if ((tag >= kEcho && tag <= kSlot) || tag == kFinishFails || tag == kFinishBlocks) {
+      return std::make_shared<TestCmd>(tag, self);
+    }
     --self->created;
     return nullptr;
   };

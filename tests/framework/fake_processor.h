@@ -25,6 +25,8 @@ enum TestTag : std::uint8_t {
   kHangup = 16,      // ends the connection through onTransferError
   kSlot = 17,        // puts a tracked ConnInf into the connection's slot ("keep": and keeps the socket)
   kFactoryThrows = 18,
+  kFinishFails = 21,   // finishRequest refuses the request ("deferred <text>")
+  kFinishBlocks = 22,  // finishRequest waits until the test opens the gate; then an echo
 };
 
 class FakeProcessor;
@@ -39,6 +41,7 @@ class TestCmd final : public Ipc::CmdI {
   void accept(Ipc::CmdProcessorI&) override {}
   std::shared_ptr<Ipc::CmdProcessorI> processor() const noexcept override;
   void readRequest(wire::Reader& in) override { text = in.str(); }
+  void finishRequest() override;
   void writeAnswer(wire::Writer& out) const override;
   void writeRequest(wire::Writer& out) const override { out.str(text); }
   void readAnswer(wire::Reader& in) override { answer = in.str(); }
@@ -84,7 +87,12 @@ class FakeProcessor final : public Ipc::CmdProcessorI {
   void openGate();
   // Waits until a command with this request text has started.
   bool waitStarted(const std::string& text, std::chrono::milliseconds timeout = std::chrono::seconds(10));
-  // "start:<text>" and "end:<text>" in the order they happened.
+  // Waits until the event has happened.
+  bool waitFor(const std::string& event, std::chrono::milliseconds timeout = std::chrono::seconds(10));
+  // A kFinishBlocks command's finishRequest: records "finish:<text>" and
+  // waits for the gate.
+  void holdInFinish(const std::string& text) EXCLUDES(mutex_);
+  // "start:<text>", "end:<text>" and "finish:<text>" in the order they happened.
   std::vector<std::string> events() const;
   // Waits until the progress threads have ended.
   void joinThreads();

@@ -174,6 +174,10 @@ TEST_F(TransportTest, MalformedInputAndProcessorFaultsEndOnlyTheirConnection) {
       {requestBytes(kEcho, strField("x") + "zz"), "Malformed request Test10", "trailing"},
       {requestBytes(1, "p"), "Malformed request PingPong", "Malformed request PingPong"},
       {requestBytes(kFactoryThrows), "Terminating client connection", "Cannot create a command for tag 18"},
+      // Found malformed where the command runs, before its processor sees
+      // it: the same texts as a request that is malformed in its frame.
+      {requestBytes(kFinishFails, strField("x")), "Malformed request Test21: deferred x",
+       "deferred x; connection ended"},
       // From here on the request reaches the processor.
       {requestBytes(kThrowOther, strField("x")), "Terminating client connection", "failed with an unknown exception"},
       {requestBytes(kSilent, strField("x")), "Terminating client connection", "ended without an answer"},
@@ -188,6 +192,7 @@ TEST_F(TransportTest, MalformedInputAndProcessorFaultsEndOnlyTheirConnection) {
     EXPECT_TRUE(reports.waitFor(report));
     EXPECT_TRUE(bystander.ping());
   }
+  EXPECT_TRUE(reports.waitFor("Malformed request Test21 from 127.0.0.1:"));
   EXPECT_EQ(proc->processed, 3);
 }
 
@@ -332,6 +337,33 @@ TEST_F(TransportTest, CommandsOfOneConnectionRunInOrderAndBlockedOnesStallNoOthe
   const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
   EXPECT_LT(pos("start:still served"), pos("end:b0"));
   EXPECT_LT(pos("end:b0"), pos("start:after"));
+}
+
+// The rest of a request's decoding (a large JSON text's parse) runs where
+// the command runs: while it takes its time on more connections than the
+// server has I/O threads, others are served, and each command then runs
+// with its request complete.
+TEST_F(TransportTest, RequestsFinishingTheirDecodingStallNoOtherConnection) {
+  std::vector<RawClient> finishing;
+  for (int i = 0; i < 4; ++i) {
+    finishing.emplace_back(port());
+    const std::string text = "f" + std::to_string(i);
+    finishing.back().send(requestBytes(kFinishBlocks, strField(text)));
+    ASSERT_TRUE(proc->waitFor("finish:" + text));
+  }
+  RawClient other(port());
+  EXPECT_TRUE(other.ping());
+  EXPECT_EQ(echo(other, "still served"), "still served");
+  EXPECT_EQ(proc->processed, 1);
+
+  proc->openGate();
+  for (int i = 0; i < 4; ++i) EXPECT_EQ(answerOf(finishing[i]), "f" + std::to_string(i));
+  const auto ev = proc->events();
+  const auto pos = [&](const std::string& e) { return std::find(ev.begin(), ev.end(), e) - ev.begin(); };
+  for (int i = 0; i < 4; ++i) {
+    const std::string text = "f" + std::to_string(i);
+    EXPECT_LT(pos("finish:" + text), pos("start:" + text));
+  }
 }
 
 TEST_F(TransportTest, LargeAndPipelinedFramesRoundTripIntactAndInOrder) {

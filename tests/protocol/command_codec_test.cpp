@@ -44,6 +44,7 @@ std::shared_ptr<C> toServer(const C& client) {
   auto server = std::make_shared<C>();
   wire::Reader in = r.reader();
   server->readRequest(in);
+  server->finishRequest();
   return server;
 }
 
@@ -224,6 +225,7 @@ bool refused(Ipc::CmdI& cmd, const std::string& payload, bool request) {
     wire::Reader in(payload);
     if (request) {
       cmd.readRequest(in);
+      cmd.finishRequest();
     } else {
       cmd.readAnswer(in);
     }
@@ -387,6 +389,77 @@ TEST(CommandCodec, MalformedFieldsAreRefused) {
                         w.u64(~0ULL);
                       }),
                       true));
+}
+
+// SetCfgPart on the server: readRequest checks the framing and keeps the
+// JSON text, shared with the frame; finishRequest parses it and lets the
+// frame go. Each refusal comes from the step that can see it, with the
+// same text as when the whole request was read at once.
+TEST(CommandCodec, SetCfgPartLeavesItsJsonTextToFinishRequest) {
+  struct Case {
+    bool del;
+    int present;
+    std::string text;
+    std::string trailing;
+    const char* refusedBy;  // "read", "finish" or nothing
+    std::string why;
+  };
+  const std::string big = "{\"a\":\"" + std::string(200000, 'x') + "\"}";
+  const std::vector<Case> cases{
+      {false, 1, big, "", nullptr, ""},
+      {true, 0, "", "", nullptr, ""},
+      {false, 1, "{\"a\":", "", "finish", "JSON error: unexpected token near end of file at line 1, column 5"},
+      {false, 1, "[1]", "", "finish", "JSON error: Wrong type: array. Expected type: object"},
+      {false, 1, "\"x\"", "", "finish", "JSON error: Wrong type: string. Expected type: object"},
+      {false, 1, "", "", "finish", "JSON error: unexpected token near end of file at line 1, column 0"},
+      {false, 1, "{\"a\":\"caf\xE9\"}", "", "finish",
+       "JSON error: unable to decode byte 0xe9 near '\"caf' at line 1, column 9"},
+      {true, 1, "{}", "", "finish", "SetCfgPart deletes and carries data"},
+      // Deleting with a text that is not JSON: the text is what is wrong.
+      {true, 1, "{", "", "finish", "JSON error: string or '}' expected near end of file at line 1, column 1"},
+      {false, 0, "", "", "read", "SetCfgPart carries no data"},
+      {false, 2, "{}", "", "read", "boolean field holds 2"},
+      {false, 1, "{}", "z", "read", "1 unexpected trailing byte(s)"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.text.substr(0, 20) + (c.del ? " (delete)" : ""));
+    const std::string payload = bytesOf([&](wire::Writer& w) {
+                                  w.str("k");
+                                  w.boolean(c.del);
+                                  w.u8(static_cast<std::uint8_t>(c.present));
+                                  if (c.present) w.str(c.text);
+                                }) +
+                                c.trailing;
+    std::shared_ptr<unsigned char> frame(ExportedUCharAlloc::alloc(payload.size()), ExportedUCharAlloc());
+    std::memcpy(frame.get(), payload.data(), payload.size());
+    const std::weak_ptr<unsigned char> frameAlive = frame;
+    SetCfgPart cmd;
+    const auto step = [&](const char* name, const std::function<void()>& run) {
+      try {
+        run();
+      } catch (const std::exception& e) {
+        EXPECT_STREQ(name, c.refusedBy) << e.what();
+        EXPECT_EQ(e.what(), c.why);
+        return false;
+      }
+      return true;
+    };
+    if (!step("read", [&] {
+          wire::Reader in(std::move(frame), payload.size());
+          cmd.readRequest(in);
+        })) {
+      continue;
+    }
+    // Read, the command holds the frame's bytes (those of a text); finished,
+    // it does not.
+    EXPECT_EQ(frameAlive.expired(), c.text.empty());
+    if (!step("finish", [&] { cmd.finishRequest(); })) continue;
+    EXPECT_EQ(c.refusedBy, nullptr);
+    EXPECT_TRUE(frameAlive.expired());
+    EXPECT_EQ(cmd.key(), "k");
+    EXPECT_EQ(cmd.deleteData(), c.del);
+    EXPECT_EQ(cmd.jCfgData(), c.del ? json::Object() : json::strToObject(c.text));
+  }
 }
 
 }  // namespace
