@@ -367,6 +367,9 @@ TEST_F(TransportTest, RequestsFinishingTheirDecodingStallNoOtherConnection) {
 }
 
 TEST_F(TransportTest, LargeAndPipelinedFramesRoundTripIntactAndInOrder) {
+  // Megabytes in each direction: a loaded machine may pause either side
+  // for longer than the short stall timeout of the other tests.
+  restartWithBudget(Ipc::SvcStub::kDefaultMemoryBudget, 10s);
   RawClient c(port());
   std::string text(8 << 20, '\0');
   for (std::size_t i = 0; i < text.size(); ++i) text[i] = static_cast<char>(i * 31 + 7);
