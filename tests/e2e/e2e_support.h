@@ -5,9 +5,15 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -79,5 +85,23 @@ inline std::string ok(const ServerProcess::Result& r) {
 #endif
 
 inline bool has(const std::string& output, const std::string& text) { return output.find(text) != std::string::npos; }
+
+// n bytes that follow from the seed and do not compress.
+inline std::string randomBytes(std::size_t n, std::uint64_t seed) {
+  std::mt19937_64 gen(seed);
+  std::string out(n, '\0');
+  for (std::size_t i = 0; i < n; i += 8) {
+    const std::uint64_t word = gen();
+    std::memcpy(out.data() + i, &word, std::min<std::size_t>(8, n - i));
+  }
+  return out;
+}
+
+// A number from the environment (rounds and seeds of the crash tests).
+inline std::optional<std::uint64_t> envNumber(const char* name) {
+  const char* text = std::getenv(name);
+  if (text == nullptr || *text == '\0') return std::nullopt;
+  return std::stoull(text);
+}
 
 }  // namespace e2e

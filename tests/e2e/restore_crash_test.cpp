@@ -55,16 +55,6 @@ std::string digest(std::string_view bytes) {
   return std::to_string(bytes.size()) + ":" + std::to_string(std::hash<std::string_view>{}(bytes));
 }
 
-std::string randomBytes(std::size_t n, std::uint64_t seed) {
-  std::mt19937_64 gen(seed);
-  std::string out(n, '\0');
-  for (std::size_t i = 0; i < n; i += 8) {
-    const std::uint64_t word = gen();
-    std::memcpy(out.data() + i, &word, std::min<std::size_t>(8, n - i));
-  }
-  return out;
-}
-
 // Text that compresses about four to one.
 std::string textBytes(std::size_t n, std::uint64_t seed) {
   static const char* const words[] = {"invoice ", "page ", "total ", "scanned ", "line\n", "42 ", "customer "};
@@ -189,12 +179,6 @@ std::string differences(const State& got, const State& want) {
     out += "  " + k + ": has " + gv + ", expected " + wv + "\n";
   }
   return out;
-}
-
-std::optional<std::uint64_t> envNumber(const char* name) {
-  const char* text = std::getenv(name);
-  if (text == nullptr || *text == '\0') return std::nullopt;
-  return std::stoull(text);
 }
 
 struct Database {

@@ -54,22 +54,6 @@ const char* const kHomes[] = {"load\\alpha", "load\\beta", "load\\gamma"};
 // Both lines the start-up sweep ends with contain this.
 constexpr const char* kSweepEnded = "data-file writes";
 
-std::optional<std::uint64_t> envNumber(const char* name) {
-  const char* text = std::getenv(name);
-  if (text == nullptr || *text == '\0') return std::nullopt;
-  return std::stoull(text);
-}
-
-std::string randomBytes(std::size_t n, std::uint64_t seed) {
-  std::mt19937_64 gen(seed);
-  std::string out(n, '\0');
-  for (std::size_t i = 0; i < n; i += 8) {
-    const std::uint64_t word = gen();
-    std::memcpy(out.data() + i, &word, std::min<std::size_t>(8, n - i));
-  }
-  return out;
-}
-
 // The content of write number seq: its number first, then bytes that
 // follow from it, so that a read tells which write it is and whether it is
 // whole. Sizes from a few bytes to a few hundred KiB.
