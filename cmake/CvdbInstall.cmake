@@ -8,6 +8,7 @@ set(CVDB_DOC_DIR "${CMAKE_INSTALL_DATAROOTDIR}/doc/cvdbserver")
 
 install(TARGETS cvdbserver cvdb RUNTIME DESTINATION "${CMAKE_INSTALL_BINDIR}")
 
+set_property(DIRECTORY APPEND PROPERTY CMAKE_CONFIGURE_DEPENDS "${PROJECT_SOURCE_DIR}/packaging/cvdbserver.service")
 file(READ "${PROJECT_SOURCE_DIR}/packaging/cvdbserver.service" cvdb_unit)
 string(REPLACE "/usr/local/bin/" "${CMAKE_INSTALL_FULL_BINDIR}/" cvdb_unit "${cvdb_unit}")
 string(REPLACE "/usr/local/share/doc/cvdbserver/" "${CMAKE_INSTALL_PREFIX}/${CVDB_DOC_DIR}/" cvdb_unit "${cvdb_unit}")

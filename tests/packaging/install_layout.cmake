@@ -26,6 +26,20 @@ if(NOT exec MATCHES "^ExecStart=/.*/bin/cvdbserver --home ")
   message(FATAL_ERROR "unexpected ExecStart line: ${exec}")
 endif()
 
+# The unit's confinement, as systemd rates it (where systemd is installed).
+find_program(SYSTEMD_ANALYZE systemd-analyze)
+if(SYSTEMD_ANALYZE)
+  execute_process(COMMAND "${SYSTEMD_ANALYZE}" security --offline=true --no-pager
+                          "${prefix}/lib/systemd/system/cvdbserver.service"
+                  OUTPUT_VARIABLE report ERROR_VARIABLE report)
+  if(NOT report MATCHES "Overall exposure level for cvdbserver.service: ([0-9.]+)")
+    message(FATAL_ERROR "no exposure level in:\n${report}")
+  endif()
+  if(CMAKE_MATCH_1 GREATER 2.0)
+    message(FATAL_ERROR "the unit's exposure level is ${CMAKE_MATCH_1}, above 2.0:\n${report}")
+  endif()
+endif()
+
 file(MAKE_DIRECTORY "${WORK_DIR}/home/db")
 file(COPY_FILE "${prefix}/share/doc/cvdbserver/examples/config.example.json" "${WORK_DIR}/home/db/config.json")
 execute_process(COMMAND "${prefix}/bin/cvdbserver" --home "${WORK_DIR}/home" --log-dir "${WORK_DIR}/log" --check-config
