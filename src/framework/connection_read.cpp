@@ -89,6 +89,7 @@ void Connection::onRead(const boost::system::error_code& ec, std::size_t n) {
     finish();
     return;
   }
+  core_->bytesIn.fetch_add(n, std::memory_order_relaxed);
   if (inBody_) {
     bodyGot_ += n;
   } else {

@@ -91,6 +91,7 @@ std::size_t Connection::gather() {
 void Connection::consumeWritten(std::uint64_t n) {
   outBytes_ -= n;
   core_->releaseMemory(n);
+  core_->bytesOut.fetch_add(n, std::memory_order_relaxed);
   while (n > 0 && !out_.empty()) {
     const std::uint64_t rest = out_.front().size() - frontSent_;
     if (n < rest) {

@@ -100,6 +100,12 @@ std::uint64_t SvcStub::bufferedBytes() const { return impl_->core().budget.used(
 
 std::size_t SvcStub::connectionsWaitingForMemory() const { return impl_->core().budget.waiting(); }
 
+std::uint64_t SvcStub::memoryLimit() const { return impl_->core().budget.limit(); }
+
+std::uint64_t SvcStub::bytesReceived() const { return impl_->core().bytesIn.load(std::memory_order_relaxed); }
+
+std::uint64_t SvcStub::bytesSent() const { return impl_->core().bytesOut.load(std::memory_order_relaxed); }
+
 void SvcStub::onRespReady(const std::shared_ptr<CmdI>& cmd) {
   if (!cmd) return;
   const auto connection = std::dynamic_pointer_cast<detail::Connection>(cmd->socket());

@@ -102,6 +102,11 @@ class SvcStub {
   // for it to fall (for diagnostics and tests).
   std::uint64_t bufferedBytes() const;
   std::size_t connectionsWaitingForMemory() const;
+  // The budget's limit in bytes (MemoryBudget::kUnlimited without one).
+  std::uint64_t memoryLimit() const;
+  // Bytes read from and written to client sockets since the start.
+  std::uint64_t bytesReceived() const;
+  std::uint64_t bytesSent() const;
 
   // Sends the answer of a processed command and lets its connection go on
   // with the next request. For progress commands the answer is their

@@ -40,6 +40,9 @@ class ServerCore {
   IoPool threads;
   // What the connections hold in buffers (Options::memoryBudget).
   MemoryBudget budget;
+  // Bytes read from and written to clients' sockets, for the metrics.
+  std::atomic<std::uint64_t> bytesIn{0};
+  std::atomic<std::uint64_t> bytesOut{0};
   // Returns memory to the system after large releases (Options::trimDelay).
   MemoryTrimmer trimmer;
 

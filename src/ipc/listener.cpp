@@ -1,5 +1,6 @@
 #include "ipc/listener.h"
 
+#include <chrono>
 #include <stdexcept>
 
 #include "framework/log.h"
@@ -33,16 +34,20 @@ std::shared_ptr<Ipc::CmdI> Listener::makeCmd(std::uint8_t tag) {
 }
 
 void Listener::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
+  const auto started = std::chrono::steady_clock::now();
+  bool failed = false;
   try {
     cmd->accept(*this);
     respond_(cmd);
   } catch (const std::exception& e) {
+    failed = true;
     {
       Log::Lock entry(Log::Error);
       entry.logStreamLine() << "Dispatching command " << cmd->name() << " failed with " << e.what();
     }
     cmd->onTransferError("Terminating client connection due to processing error");
   }
+  stats_.record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
 }
 
 void Listener::onIpcError(const std::shared_ptr<Ipc::Socket>&, const std::string& text) {

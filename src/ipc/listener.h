@@ -20,6 +20,7 @@
 #include <string_view>
 
 #include "framework/svc_stub.h"
+#include "ipc/command_stats.h"
 #include "ipc/maintenance_runner.h"
 #include "protocol/commands.h"
 #include "protocol/processor.h"
@@ -66,6 +67,9 @@ class Listener final : public CmdProcessorDBI {
   // with "Terminating client connection due to processing error"; no answer
   // is sent. Other exceptions propagate.
   void processCmd(std::shared_ptr<Ipc::CmdI> cmd) override;
+
+  // What the commands did so far (requests, failures, handler times).
+  const CommandStats& stats() const noexcept { return stats_; }
 
   // Logs "Ipc " + text (priority 4).
   void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
@@ -139,6 +143,7 @@ class Listener final : public CmdProcessorDBI {
   // connection's store works with.
   const std::shared_ptr<::DB::DBInstances> pool_;
   MaintenanceRunner maintenance_;
+  CommandStats stats_;
   std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
 };
 

@@ -12,6 +12,7 @@
 #include "framework/log.h"
 #include "ipc/listener.h"
 #include "maintenance/restore_journal.h"
+#include "service/metrics_page.h"
 #include "settings/config.h"
 #include "store/stale_files.h"
 
@@ -106,7 +107,9 @@ void DBSvc::runSvc() {
       // A stop that came while there was no server to tell.
       if (stopRequested_) server.signalStop();
     }
+    std::unique_ptr<MetricsServer> metrics = startMetrics(config, created, pool);
     server.waitToFinish();
+    metrics.reset();
     // Running maintenance operations stop at their next safe point (their
     // clients are gone already) before the pool they use is stopped.
     created->stopMaintenance();
@@ -131,6 +134,34 @@ void DBSvc::runSvc() {
     entry.logStreamLine() << "Service main failed with unknown error";
     throw;
   }
+}
+
+std::unique_ptr<MetricsServer> DBSvc::startMetrics(const DBConfig& config,
+                                                   const std::shared_ptr<Ipc::DB::Listener>& served,
+                                                   const std::shared_ptr<DB::DBInstances>& pool) {
+  if (config.MetricsPort == 0) return nullptr;
+  const std::weak_ptr<Ipc::DB::Listener> weak = served;
+  std::unique_ptr<MetricsServer> metrics;
+  try {
+    metrics = std::make_unique<MetricsServer>(
+        config.MetricsAddress, config.MetricsPort,
+        [weak, pool, &config] {
+          const auto l = weak.lock();
+          if (!l) throw std::runtime_error("the server is stopping");
+          return metricsPage(*l, *pool, config);
+        },
+        [this] {
+          sys::MutexLock lock(mutex_);
+          return listener != nullptr && !stopRequested_;
+        });
+  } catch (const std::exception& e) {
+    // Monitoring is not worth refusing the clients for.
+    Log::Lock(Log::Error).logStreamLine() << "Metrics are not served: " << e.what();
+    return nullptr;
+  }
+  Log::Lock(Log::Notice).logStreamLine() << "Metrics on http://" << config.MetricsAddress << ':' << metrics->port()
+                                         << "/metrics and /healthz";
+  return metrics;
 }
 
 void DBSvc::stopSvc() {

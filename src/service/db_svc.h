@@ -18,6 +18,12 @@
 
 #include "framework/service_host.h"
 #include "framework/thread_annotations.h"
+#include "service/metrics_server.h"
+
+class DBConfig;
+namespace DB {
+class DBInstances;
+}
 
 namespace Ipc::DB {
 class Listener;
@@ -45,6 +51,10 @@ class DBSvc final : public Service::I {
   const std::string& svcDisplayName() const override;
 
  private:
+  // The HTTP listener of /metrics and /healthz when MetricsPort is set.
+  std::unique_ptr<MetricsServer> startMetrics(const DBConfig& config, const std::shared_ptr<Ipc::DB::Listener>& served,
+                                              const std::shared_ptr<DB::DBInstances>& pool) EXCLUDES(mutex_);
+
   sys::Mutex mutex_;
   std::shared_ptr<Ipc::DB::Listener> listener GUARDED_BY(mutex_);
   bool stopRequested_ GUARDED_BY(mutex_) = false;

@@ -103,6 +103,8 @@ void readKeys(const json::Object& obj, DBConfig& c) {
     }
     c.MaintenanceFolders = std::move(folders);
   }
+  if (const auto v = obj.get("MetricsPort"); !v.empty()) c.MetricsPort = static_cast<std::uint16_t>(v.asInteger());
+  if (const auto v = obj.get("MetricsAddress"); !v.empty()) c.MetricsAddress = v.asString();
 }
 
 const DBConfig& loadedRecord() {

@@ -38,6 +38,9 @@ class DBConfig {
   // Folders that backup targets and restore sources must lie in (with the
   // backup folder, always allowed); empty allows any path.
   std::vector<std::string> MaintenanceFolders;
+  // The HTTP port of /metrics and /healthz (0: none), and its address.
+  std::uint16_t MetricsPort = 0;
+  std::string MetricsAddress = "127.0.0.1";
 
   // The process-wide record; loads and prints it on the first call.
   static const DBConfig& inst();

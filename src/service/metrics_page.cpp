@@ -1,0 +1,38 @@
+#include "service/metrics_page.h"
+
+#include <sstream>
+
+#include "engine/db_instances.h"
+#include "ipc/listener.h"
+#include "settings/config.h"
+
+namespace DBServer {
+namespace {
+
+void gauge(std::ostream& out, const char* name, const char* help, std::uint64_t value, const char* type = "gauge") {
+  out << "# HELP " << name << ' ' << help << "\n# TYPE " << name << ' ' << type << '\n' << name << ' ' << value << '\n';
+}
+
+}  // namespace
+
+std::string metricsPage(Ipc::DB::Listener& listener, const DB::DBInstances& pool, const DBConfig& config) {
+  const Ipc::SvcStub& server = Ipc::DB::serverOf(listener);
+  std::ostringstream out;
+  gauge(out, "cvdb_connections_open", "Client connections open.", server.connectionCount());
+  gauge(out, "cvdb_connections_waiting_for_memory", "Connections whose next request waits for the memory budget.",
+        server.connectionsWaitingForMemory());
+  gauge(out, "cvdb_buffered_bytes", "Bytes of queued answers and large requests counted against the budget.",
+        server.bufferedBytes());
+  if (config.MaxBufferedMiB != 0) {
+    gauge(out, "cvdb_buffered_limit_bytes", "The memory budget (MaxBufferedMiB).", server.memoryLimit());
+  }
+  gauge(out, "cvdb_received_bytes_total", "Bytes read from client connections.", server.bytesReceived(), "counter");
+  gauge(out, "cvdb_sent_bytes_total", "Bytes written to client connections.", server.bytesSent(), "counter");
+  gauge(out, "cvdb_databases_open", "Databases open (engine instances).", pool.liveInstances());
+  gauge(out, "cvdb_databases_limit", "MaxActiveDBs.", config.MaxActiveDBs);
+  gauge(out, "cvdb_clients_per_database_limit", "MaxActiveClientsPerDB.", config.MaxActiveClientsPerDB);
+  listener.stats().write(out);
+  return out.str();
+}
+
+}  // namespace DBServer
