@@ -1,6 +1,7 @@
 #include "engine/db_instances.h"
 
 #include "engine/db_exc.h"
+#include "engine/engine_counters.h"
 #include "engine/engine_errors.h"
 #include "framework/log.h"
 #include "framework/open_files.h"
@@ -141,10 +142,12 @@ std::unique_ptr<engine::Session> DBInstances::newSession(const std::string& dbKe
     // the refusal says which, and for which database.
     const std::string code = " (engine error " + std::to_string(e.code()) + ")";
     if (e.code() == err::kTooManyInstances) {
+      engine::counters().refusedByDatabaseLimit.fetch_add(1, std::memory_order_relaxed);
       throw DBExc(e.code(), "Database \"" + dbKey + "\" refused: " + std::to_string(settings_.maxActiveDBs) +
                                 " databases are open, the most that MaxActiveDBs allows" + code);
     }
     if (e.code() == err::kOutOfSessions) {
+      engine::counters().refusedByClientLimit.fetch_add(1, std::memory_order_relaxed);
       throw DBExc(e.code(), "Database \"" + dbKey + "\" refused: " + std::to_string(settings_.maxClientsPerDB) +
                                 " clients have it open, the most that MaxActiveClientsPerDB allows" + code);
     }

@@ -18,7 +18,9 @@
 // Thread safety: every member may be called from any thread.
 // Failures: DB::DBExc with an engine code (engine_errors.h).
 // The write gate serialises the database's writers inside the process
-// (write_gate.h); sessions take it around their write transactions.
+// (write_gate.h); sessions take it around their write transactions. The
+// store's writers go through the commit queue first (commit_queue.h), so
+// that the writes that queue up share one commit.
 
 #include <atomic>
 #include <chrono>
@@ -29,6 +31,7 @@
 #include <source_location>
 #include <string>
 
+#include "engine/commit_queue.h"
 #include "engine/write_gate.h"
 #include "framework/env.h"
 #include "framework/thread_annotations.h"
@@ -109,6 +112,9 @@ class Instance : public std::enable_shared_from_this<Instance> {
   // The attached database file, if any.
   std::optional<std::filesystem::path> attachedDatabase() const EXCLUDES(mutex_);
 
+  // The queue in which the writers of the database form their groups.
+  CommitQueue& commitQueue() noexcept { return commitQueue_; }
+
  private:
   friend class Session;
   void sessionEnded() noexcept EXCLUDES(mutex_);
@@ -126,6 +132,7 @@ class Instance : public std::enable_shared_from_this<Instance> {
   std::uint64_t sessions_ GUARDED_BY(mutex_) = 0;
   std::optional<std::filesystem::path> attached_ GUARDED_BY(mutex_);
   WriteGate writeGate_;
+  CommitQueue commitQueue_;
 };
 
 }  // namespace engine

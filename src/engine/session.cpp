@@ -178,6 +178,8 @@ void Session::rollback(const std::source_location& where) {
   releaseWriteLock();
 }
 
+bool Session::transactionOpen() const noexcept { return db_ && sqlite3_get_autocommit(db_.get()) == 0; }
+
 void Session::releaseWriteLock() noexcept {
   if (!writeLocked_) return;
   writeLocked_ = false;

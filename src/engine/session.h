@@ -90,6 +90,10 @@ class Session {
   // fails (which is then thrown). Nothing to do outside a transaction.
   void rollback(const std::source_location& where = std::source_location::current());
   bool inTransaction() const noexcept { return writeLocked_; }
+  // Whether SQLite's transaction is still open: some failures (a full disk,
+  // an I/O error) make SQLite roll the whole transaction back by itself,
+  // savepoints included, while the write lock is still held.
+  bool transactionOpen() const noexcept;
 
   std::int64_t lastInsertRowid() const noexcept;
   std::int64_t changes() const noexcept;

@@ -4,6 +4,7 @@
 #include <array>
 #include <random>
 
+#include "engine/engine_counters.h"
 #include "engine/engine_errors.h"
 #include "engine/instance.h"
 #include "framework/log.h"
@@ -120,6 +121,7 @@ void Transaction::countAttempt() {
   if (attempts_ > kMaxRetries || paused_ >= kMaxPauseTotal) {
     throw DBExc("Transaction made too many attmepts to gain access to a locked item");
   }
+  engine::counters().transactionRetries.fetch_add(1, std::memory_order_relaxed);
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "Transaction::retry"
                                           << " S:" << session_.id() << " " << attempts_ << " attempt(s) so far.";

@@ -84,6 +84,7 @@ DBLocal::~DBLocal() { disconnect(); }
 std::uint64_t DBLocal::sessionId() const noexcept { return session_ ? session_->id() : 0; }
 
 engine::Session& DBLocal::session(const std::source_location& where) {
+  if (groupSession_ != nullptr) return *groupSession_;
   if (!session_) throwEngineError(err::kInvalidDatabaseId, where);
   return *session_;
 }

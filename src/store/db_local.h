@@ -34,8 +34,10 @@
 #include <stop_token>
 #include <string>
 #include <string_view>
+#include <type_traits>
 #include <vector>
 
+#include "engine/instance.h"
 #include "engine/progress.h"
 #include "engine/session.h"
 #include "engine/statement.h"
@@ -131,7 +133,7 @@ class DBLocal {
   // stored form) and its content: the row of "meta" under the pack's id.
   // Every read of a stored use list passes Ipc::kUseLimitSeconds, so the
   // entries of a client that crashed end after seven hours.
-  // Writes run in runInTransaction: a record, its use list and its content
+  // Writes run in write() (grouped commits): a record, its use list and its content
   // change together or not at all, and a refused request leaves nothing.
 
   // The records of folder (of every folder when it is empty), ordered by
@@ -214,7 +216,17 @@ class DBLocal {
 
   // ---- Helpers shared by the table operations, the pack code included --
   // The open session; throws kInvalidDatabaseId when the store is closed.
+  // Inside a body that write() runs, the session its group runs on.
   engine::Session& session(const std::source_location& where = std::source_location::current());
+
+  // Runs body (no arguments) as one write of the database's commit queue
+  // (engine/commit_queue.h): in a write transaction, grouped with the
+  // writes of other connections that queued meanwhile, with retry. Returns
+  // the body's result once its group committed. bytes: about how much the
+  // body writes. The body may run on another connection's thread and more
+  // than once; it reaches the engine only through session().
+  template <class Body>
+  auto write(std::uint64_t bytes, Body&& body) -> std::invoke_result_t<Body&>;
 
   // The value stored under key in "meta" (what a seek on the key followed
   // by reading the "blob" column gives): empty when there is no row or the
@@ -248,6 +260,36 @@ class DBLocal {
   const std::string folder_;
   const std::string dbFile_;
   std::unique_ptr<engine::Session> session_;
+  // The session of the group that runs one of this store's write bodies,
+  // while it runs (on the group leader's thread; this store's own thread
+  // waits in write() meanwhile).
+  engine::Session* groupSession_ = nullptr;
 };
+
+template <class Body>
+auto DBLocal::write(std::uint64_t bytes, Body&& body) -> std::invoke_result_t<Body&> {
+  using Result = std::invoke_result_t<Body&>;
+  struct GroupSession {
+    GroupSession(DBLocal& owner, engine::Session& group) : store(owner) { store.groupSession_ = &group; }
+    ~GroupSession() { store.groupSession_ = nullptr; }
+    GroupSession(const GroupSession&) = delete;
+    GroupSession& operator=(const GroupSession&) = delete;
+    DBLocal& store;
+  };
+  engine::Session& own = session();
+  if constexpr (std::is_void_v<Result>) {
+    own.instance()->commitQueue().run(own, bytes, [&](engine::Session& group) {
+      const GroupSession scope(*this, group);
+      body();
+    });
+  } else {
+    std::optional<Result> result;
+    own.instance()->commitQueue().run(own, bytes, [&](engine::Session& group) {
+      const GroupSession scope(*this, group);
+      result.emplace(body());
+    });
+    return std::move(*result);
+  }
+}
 
 }  // namespace DB

@@ -7,7 +7,6 @@
 #include "engine/blob_io.h"
 #include "engine/db_exc.h"
 #include "engine/engine_errors.h"
-#include "engine/transaction.h"
 #include "framework/log.h"
 #include "store/db_local.h"
 #include "store/schema.h"
@@ -96,7 +95,7 @@ MemBuffer DBLocal::loadMetaBlob(const std::string& key) {
 }
 
 void DBLocal::saveMetaBlob(const void* data, std::uint64_t length, const std::string& key) {
-  runInTransaction(session(), [&] { putMeta(key, data, length); });
+  write(length, [&] { putMeta(key, data, length); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine()
         << "DB:saveMetaBlob S:" << sessionId() << " Stored metadata for key " << key << " size: " << length;
@@ -104,7 +103,7 @@ void DBLocal::saveMetaBlob(const void* data, std::uint64_t length, const std::st
 }
 
 bool DBLocal::removeMetaBlob(const std::string& key) {
-  const bool deleted = runInTransaction(session(), [&] { return deleteMeta(key); });
+  const bool deleted = write(key.size(), [&] { return deleteMeta(key); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:removeMetaBlob S:" << sessionId() << ' '
                                           << (deleted ? "Deleted metadata for " : "No metadata found for ") << key;

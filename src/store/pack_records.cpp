@@ -5,7 +5,6 @@
 #include <string_view>
 
 #include "engine/db_exc.h"
-#include "engine/transaction.h"
 #include "framework/log.h"
 #include "store/db_local.h"
 #include "store/pack_sql.h"
@@ -13,6 +12,9 @@
 
 namespace DB {
 namespace {
+
+// About what a record's row takes, for the commit queue's group bound.
+constexpr std::uint64_t kRecordBytes = 1024;
 
 void logInfoFor(std::uint64_t session, const std::string& id, const Ipc::PackInfoPtr& info) {
   Log::Lock entry(Log::Debug);
@@ -120,7 +122,7 @@ Ipc::PackInfoPtr DBLocal::upsertInfo(const Ipc::PackInfo& request, bool useUpdat
 }
 
 Ipc::PackInfoPtr DBLocal::updateInfo(const Ipc::PackInfo& request) {
-  Ipc::PackInfoPtr result = runInTransaction(session(), [&] { return upsertInfo(request, false); });
+  Ipc::PackInfoPtr result = write(kRecordBytes, [&] { return upsertInfo(request, false); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:updateInfo S:" << sessionId() << " Info for " << request.id()
                                           << (request.allValid() ? " fully updated" : " updated");
@@ -129,7 +131,7 @@ Ipc::PackInfoPtr DBLocal::updateInfo(const Ipc::PackInfo& request) {
 }
 
 void DBLocal::savePackMeta(const Ipc::PackInfo& request, const void* content, std::uint64_t length) {
-  const bool stored = runInTransaction(session(), [&] {
+  const bool stored = write(kRecordBytes + length, [&] {
     // No record means a CloseEdit for a missing pack: a content without a
     // record could be neither fetched nor erased.
     if (!upsertInfo(request, false)) return false;
@@ -164,7 +166,7 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
     return found;
   }
 
-  PackMeta changed = runInTransaction(session(), [&] {
+  PackMeta changed = write(kRecordBytes, [&] {
     PackMeta m;
     m.info = upsertInfo(request, true);
     // A pack without record has no content to hand out.
@@ -179,8 +181,8 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
 }
 
 void DBLocal::removePack(const std::string& id) {
-  auto& s = session();
-  const bool removed = runInTransaction(s, [&] {
+  const bool removed = write(kRecordBytes, [&] {
+    auto& s = session();
     {
       auto del = s.prepare(pack_sql::kDeleteInfo);
       del.bindBlob(1, id);
@@ -193,7 +195,7 @@ void DBLocal::removePack(const std::string& id) {
     return true;
   });
   if (removed && g_LogVerbose) {
-    Log::Lock(Log::Debug).logStreamLine() << "DB:removePack S:" << s.id() << " Deleted pack metadata for " << id;
+    Log::Lock(Log::Debug).logStreamLine() << "DB:removePack S:" << sessionId() << " Deleted pack metadata for " << id;
   }
 }
 
