@@ -47,7 +47,7 @@ void Listener::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
     }
     cmd->onTransferError("Terminating client connection due to processing error");
   }
-  stats_.record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
+  stats_->record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
 }
 
 void Listener::onIpcError(const std::shared_ptr<Ipc::Socket>&, const std::string& text) {

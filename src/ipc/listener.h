@@ -69,7 +69,9 @@ class Listener final : public CmdProcessorDBI {
   void processCmd(std::shared_ptr<Ipc::CmdI> cmd) override;
 
   // What the commands did so far (requests, failures, handler times).
-  const CommandStats& stats() const noexcept { return stats_; }
+  const CommandStats& stats() const noexcept { return *stats_; }
+  // Maintenance operations running now.
+  std::size_t maintenanceRunning() const { return maintenance_.running(); }
 
   // Logs "Ipc " + text (priority 4).
   void onIpcError(const std::shared_ptr<Ipc::Socket>& socket, const std::string& text) override;
@@ -143,7 +145,8 @@ class Listener final : public CmdProcessorDBI {
   // connection's store works with.
   const std::shared_ptr<::DB::DBInstances> pool_;
   MaintenanceRunner maintenance_;
-  CommandStats stats_;
+  // Shared with the maintenance threads, which may outlive the Listener.
+  std::shared_ptr<CommandStats> stats_ = std::make_shared<CommandStats>();
   std::shared_ptr<Ipc::SvcStub> server_;  // null for a detached Listener
 };
 

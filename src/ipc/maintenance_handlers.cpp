@@ -2,6 +2,7 @@
 // answer with a progress stream: the start text at once, then whatever the
 // operation reports from a thread of its own, and the stream's end.
 
+#include <chrono>
 #include <memory>
 #include <stdexcept>
 
@@ -63,12 +64,20 @@ void Listener::runAsync(ProgressCmdsBase& cmd, const std::string& startText, Mai
   cmd.firstProgressMsg(startText);
   auto self = std::static_pointer_cast<ProgressCmdsBase>(cmd.shared_from_this());
   try {
-    maintenance_.start([self, work = std::move(work)](std::stop_token stop) {
+    maintenance_.start([self, stats = stats_, work = std::move(work)](std::stop_token stop) {
+      // Counted before the stream ends, so that a client that saw the end
+      // finds its operation on the metrics page.
+      const auto started = std::chrono::steady_clock::now();
+      const auto count = [&](bool succeeded) {
+        stats->recordOperation(self->tag(), self->name(), std::chrono::steady_clock::now() - started, succeeded);
+      };
       EndOfStream end(*self);
       try {
         ::DB::DBLocal& db = dbOfConn(*self);
         work(db, std::make_unique<ProgressCB>(*self), std::move(stop));
+        count(true);
       } catch (const std::exception& e) {
+        count(false);
         reportFailure(*self, e.what());
       }
     });

@@ -2,7 +2,9 @@
 
 #include <sstream>
 
+#include "engine/commit_queue.h"
 #include "engine/db_instances.h"
+#include "engine/engine_counters.h"
 #include "ipc/listener.h"
 #include "settings/config.h"
 
@@ -31,6 +33,23 @@ std::string metricsPage(Ipc::DB::Listener& listener, const DB::DBInstances& pool
   gauge(out, "cvdb_databases_open", "Databases open (engine instances).", pool.liveInstances());
   gauge(out, "cvdb_databases_limit", "MaxActiveDBs.", config.MaxActiveDBs);
   gauge(out, "cvdb_clients_per_database_limit", "MaxActiveClientsPerDB.", config.MaxActiveClientsPerDB);
+  const auto& engineCounts = engine::counters();
+  out << "# HELP cvdb_sessions_refused_total Connections to a database refused at a limit, by the setting.\n"
+         "# TYPE cvdb_sessions_refused_total counter\n"
+      << "cvdb_sessions_refused_total{limit=\"MaxActiveDBs\"} "
+      << engineCounts.refusedByDatabaseLimit.load(std::memory_order_relaxed) << '\n'
+      << "cvdb_sessions_refused_total{limit=\"MaxActiveClientsPerDB\"} "
+      << engineCounts.refusedByClientLimit.load(std::memory_order_relaxed) << '\n';
+  gauge(out, "cvdb_transaction_retries_total", "Write transactions tried again after a conflict or a lock wait.",
+        engineCounts.transactionRetries.load(std::memory_order_relaxed), "counter");
+  gauge(out, "cvdb_maintenance_running", "Maintenance operations (backup, restore, cleanup) running.",
+        listener.maintenanceRunning());
+  const auto commits = engine::CommitQueue::stats();
+  gauge(out, "cvdb_commit_groups_total", "Write transactions committed (or failed) for the commit queue's groups.",
+        commits.commits, "counter");
+  gauge(out, "cvdb_commit_grouped_requests_total", "Write requests carried by those groups.", commits.requests,
+        "counter");
+  gauge(out, "cvdb_commit_group_largest", "The most write requests that shared one commit.", commits.largest);
   listener.stats().write(out);
   return out.str();
 }

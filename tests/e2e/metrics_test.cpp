@@ -59,7 +59,7 @@ TEST(Metrics, HealthAndCountersMoveWithTheClients) {
   const std::uint16_t port = freePort();
   ASSERT_NE(port, 0);
   testing_support::ServerOptions o;
-  o.configJson = R"({"ServerPort": 0, "MetricsPort": )" + std::to_string(port) + "}";
+  o.configJson = R"({"ServerPort": 0, "MaxActiveClientsPerDB": 1, "MetricsPort": )" + std::to_string(port) + "}";
   ServerProcess server(kServer, o);
   ASSERT_TRUE(server.waitForLogLine("Metrics on http://127.0.0.1:" + std::to_string(port)));
 
@@ -82,6 +82,22 @@ TEST(Metrics, HealthAndCountersMoveWithTheClients) {
     EXPECT_EQ(metric(during, "cvdb_request_duration_seconds_bucket{command=\"SetCfgPart\",le=\"+Inf\"}"), 3);
     EXPECT_GT(metric(during, "cvdb_received_bytes_total"), metric(before, "cvdb_received_bytes_total"));
     EXPECT_EQ(metric(during, "cvdb_buffered_limit_bytes"), 256.0 * 1024 * 1024);
+    // One writer alone: each write is a group of its own.
+    EXPECT_EQ(metric(during, "cvdb_commit_groups_total") - metric(before, "cvdb_commit_groups_total"), 3) << during;
+    EXPECT_EQ(metric(during, "cvdb_commit_grouped_requests_total"), metric(during, "cvdb_commit_groups_total"));
+    // A second client of the database is refused at the limit.
+    auto second = clientOf(server);
+    EXPECT_EQ(endedBy([&] { second->connect("watched"); }), kTerminating);
+    // A backup counts as a request when it starts and as an operation when
+    // it ends.
+    c->backup("", false);
+    const std::string maintained = get(port, "/metrics");
+    EXPECT_EQ(metric(maintained, "cvdb_sessions_refused_total{limit=\"MaxActiveClientsPerDB\"}"), 1) << maintained;
+    EXPECT_EQ(metric(maintained, "cvdb_sessions_refused_total{limit=\"MaxActiveDBs\"}"), 0) << maintained;
+    EXPECT_EQ(metric(maintained, "cvdb_maintenance_operations_total{command=\"Backup\",outcome=\"ok\"}"), 1);
+    EXPECT_EQ(metric(maintained, "cvdb_maintenance_last_success{command=\"Backup\"}"), 1) << maintained;
+    EXPECT_GE(metric(maintained, "cvdb_maintenance_last_duration_seconds{command=\"Backup\"}"), 0);
+    EXPECT_GE(metric(maintained, "cvdb_transaction_retries_total"), 0);
     // A request that fails ends its connection and counts as a failure.
     EXPECT_EQ(endedBy([&] { c->getData("..", "x"); }), kTerminating);
   }
