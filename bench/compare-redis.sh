@@ -141,6 +141,11 @@ row() {
   if [[ $target != - ]]; then
     verdict=$(awk -v r="$ratio" -v t="$target" 'BEGIN { print (r >= t ? ">= " t " met" : ">= " t " MISSED") }')
   fi
+  # At 50 connections our p99 may be at most three times Redis's.
+  if [[ $name == *"50 conn"* ]]; then
+    verdict+=$(awk -v a="$mp9" -v b="$mtp9" -v sep="${verdict:+; }" 'BEGIN { x = (b > 0 ? a / b : 0);
+      printf "%sp99 %.1fx%s", sep, x, (x <= 3 ? "" : " (over 3x)") }')
+  fi
   printf '%-40s %10.0f %9.0f %9.0f %10.0f %9.0f %9.0f %6s  %s\n' "$name" "$mo" "$mp5" "$mp9" "$mt" "$mtp5" "$mtp9" \
     "$ratio" "$verdict"
 }
@@ -151,11 +156,12 @@ if wants kv; then
   row "ping, 1 conn" - "ours --command ping -c 1" "redis_bench -c 1 -t ping_mbulk"
   row "ping, 50 conn" 0.8 "ours --command ping -c 50" "redis_bench -c 50 -t ping_mbulk"
   row "100 B config read, 1 conn" - "ours --command getcfg -c 1" "redis_bench -c 1 -t get -d 100"
-  row "100 B config read, 50 conn" 0.6 "ours --command getcfg -c 50" "redis_bench -c 50 -t get -d 100"
-  row "  (Redis GET through load_gen's loop)" - "ours --command getcfg -c 50" "redis_loop --command getcfg -c 50"
-  row "100 B durable write, 1 conn" - "ours --command setcfg -c 1" "redis_bench -c 1 -t set -d 100"
+  row "100 B config read, 50 conn" 1 "ours --command getcfg -c 50" "redis_bench -c 50 -t get -d 100"
+  row "  (Redis GET through load_gen's loop)" 0.7 "ours --command getcfg -c 50" "redis_loop --command getcfg -c 50"
+  row "100 B durable write, 1 conn" 1 "ours --command setcfg -c 1" "redis_bench -c 1 -t set -d 100"
   redis_one=$(for ((i = 0; i < runs; i++)); do redis_bench -c 1 -t set -d 100; done | cut -d' ' -f1 | median)
-  row "100 B durable write, 50 conn, 16 db" - "ours --command setcfg -c 50 --databases 16" \
+  row "100 B durable write, 50 conn, 1 db" 0.5 "ours --command setcfg -c 50" "redis_bench -c 50 -t set -d 100"
+  row "100 B durable write, 50 conn, 16 db" 0.7 "ours --command setcfg -c 50 --databases 16" \
     "redis_bench -c 50 -t set -d 100"
   awk -v a="$last_ours" -v b="$redis_one" 'BEGIN {
     r = a / b; printf "%-40s %10.0f %39.0f %6.2f  >= 1 %s\n", "  (against Redis SET with 1 conn)", a, b, r,
@@ -165,8 +171,8 @@ fi
 if wants packs; then
   packs() { ours "$@" --folder-packs "$folder_packs"; }
   row "GetPackInfo, 1 conn" - "packs --command getpackinfo -c 1" "redis_loop --command getpackinfo -c 1"
-  row "GetPackInfo, 50 conn, 1 db" 0.6 "packs --command getpackinfo -c 50" "redis_loop --command getpackinfo -c 50"
-  row "GetPackInfo, 50 conn, 16 db" 0.6 "packs --command getpackinfo -c 50 --databases 16" \
+  row "GetPackInfo, 50 conn, 1 db" 0.7 "packs --command getpackinfo -c 50" "redis_loop --command getpackinfo -c 50"
+  row "GetPackInfo, 50 conn, 16 db" 0.7 "packs --command getpackinfo -c 50 --databases 16" \
     "redis_loop --command getpackinfo -c 50"
   # Redis: HGETALL and GET of the content, sent together.
   row "GetPack (record + 10 KiB), 1 conn" - "packs --command getpack -c 1" "redis_loop --command getpack -c 1"
@@ -183,7 +189,7 @@ if wants packs; then
   # Writes last: the reads above see databases that bursts of writes have
   # not just grown.
   row "SavePack 1 KiB + 10 KiB, 1 conn" 1 "packs --command savepack -c 1" "redis_loop --command savepack -c 1"
-  row "SavePack, 50 conn, 1 db" - "packs --command savepack -c 50" "redis_loop --command savepack -c 50"
+  row "SavePack, 50 conn, 1 db" 0.5 "packs --command savepack -c 50" "redis_loop --command savepack -c 50"
   row "SavePack, 50 conn, 16 db" - "packs --command savepack -c 50 --databases 16" \
     "redis_loop --command savepack -c 50"
 fi
