@@ -121,6 +121,28 @@ void createDatabaseFile(sys::Env& env, const fs::path& file, std::chrono::millis
   }
 }
 
+void removeCreationLeftovers(sys::Env& env, const fs::path& file) noexcept {
+  const auto building = withSuffix(file, ".creating");
+  std::size_t removed = 0;
+  for (const auto& f : {building, walFile(building), shmFile(building), journalFile(building)}) {
+    try {
+      if (env.stat(f).type == sys::FileType::Missing) continue;
+      env.remove(f);
+      ++removed;
+    } catch (const std::system_error&) {
+      // Left for the next attach.
+    }
+  }
+  if (removed == 0) return;
+  try {
+    Log::Lock(Log::Notice).logStreamLine()
+        << "Engine: removed " << removed << " file(s) that an unfinished creation of \"" << file.string()
+        << "\" left behind";
+  } catch (const std::exception&) {
+    // The files are gone; only the line is missing.
+  }
+}
+
 fs::path walFile(const fs::path& file) { return withSuffix(file, "-wal"); }
 fs::path shmFile(const fs::path& file) { return withSuffix(file, "-shm"); }
 fs::path journalFile(const fs::path& file) { return withSuffix(file, "-journal"); }

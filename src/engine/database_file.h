@@ -44,6 +44,13 @@ void checkIdentity(sqlite3* db, const std::filesystem::path& file, const std::so
 void createDatabaseFile(sys::Env& env, const std::filesystem::path& file, std::chrono::milliseconds busyTimeout,
                         const std::source_location& where);
 
+// Removes what a creation of file that never finished left beside it (the
+// file it was building, which may be a second link to file itself, and
+// that file's companions). Call only where no creation of file can be
+// running: when the database is first attached. Never throws; a file that
+// cannot be removed is left for the next time.
+void removeCreationLeftovers(sys::Env& env, const std::filesystem::path& file) noexcept;
+
 // The companions SQLite keeps beside a database file.
 std::filesystem::path walFile(const std::filesystem::path& file);
 std::filesystem::path shmFile(const std::filesystem::path& file);

@@ -49,12 +49,17 @@ std::int32_t Session::attachDatabase(const std::filesystem::path& file, const st
   checkInstanceLive(where);
   const bool opened = !db_;
   if (opened) open(file, where);
+  std::int32_t attached = 0;
   try {
-    return instance_->attach(file, where);
+    attached = instance_->attach(file, where);
   } catch (...) {
     if (opened) closeConnection();
     throw;
   }
+  // The first attach in this process: no creation of the file can be
+  // running, so whatever one left behind belongs to nobody.
+  if (attached == 0) removeCreationLeftovers(*instance_->settings().env, file);
+  return attached;
 }
 
 void Session::createDatabase(const std::filesystem::path& file, const std::source_location& where) {

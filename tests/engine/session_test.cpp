@@ -75,6 +75,21 @@ TEST_F(Sessions, CreationNeverReplacesAFileAndIgnoresLeftovers) {
   other->createDatabase(fresh);
   EXPECT_FALSE(fs::exists(fresh.string() + ".creating"));
   EXPECT_TRUE(other->isOpen());
+  other->execute("CREATE TABLE t(x); INSERT INTO t VALUES(7);");
+  other.reset();
+
+  // A creation killed between its link and its unlink leaves a second name
+  // of the live file, one killed earlier its half-made files: the next
+  // first attach removes them and leaves the database whole.
+  fs::create_hard_link(fresh, fresh.string() + ".creating");
+  writeFile(fresh.string() + ".creating-wal", "half-made");
+  auto reopened = makeInstance("dup2")->beginSession();
+  reopened->attachDatabase(fresh);
+  EXPECT_FALSE(fs::exists(fresh.string() + ".creating"));
+  EXPECT_FALSE(fs::exists(fresh.string() + ".creating-wal"));
+  auto row = reopened->prepare("SELECT x FROM t");
+  ASSERT_TRUE(row.step());
+  EXPECT_EQ(row.columnInt64(0), 7);
 }
 
 // Files that are not databases of this server are refused with their own
