@@ -48,7 +48,10 @@ void CommitQueue::run(Session& own, std::uint64_t bytes, const Body& body) {
 }
 
 void CommitQueue::submit(Session& own, Request& request) {
+  // Filled under the lock, so it must not allocate: a failure there would
+  // leave the queue without a leader.
   std::vector<Request*> group;
+  group.reserve(kMaxGroupRequests);
   {
     sys::MutexLock lock(mutex_);
     queue_.push_back(&request);
