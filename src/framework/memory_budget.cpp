@@ -36,17 +36,7 @@ void MemoryBudget::release(std::uint64_t bytes) {
   std::vector<Wake> ready;
   {
     sys::MutexLock lock(mutex_);
-    const std::uint64_t used = used_.load();
-    for (auto it = waiters_.begin(); it != waiters_.end();) {
-      if (fits(used, it->second.bytes)) {
-        auto next = std::next(it);
-        ready.push_back(drop(it));
-        it = next;
-      } else {
-        ++it;
-      }
-    }
-    hasWaiters_.store(!waiters_.empty());
+    takeFitting(ready);
   }
   for (auto& wake : ready) {
     if (wake) wake();
@@ -80,23 +70,25 @@ void MemoryBudget::forget(const void* key) {
     forgotten = drop(it);
     hasWaiters_.store(!waiters_.empty());
     // The others may have waited only for that frame to get its turn.
-    if (oversize && oversizeWaiting_ == 0) {
-      const std::uint64_t used = used_.load();
-      for (auto w = waiters_.begin(); w != waiters_.end();) {
-        if (fits(used, w->second.bytes)) {
-          auto next = std::next(w);
-          ready.push_back(drop(w));
-          w = next;
-        } else {
-          ++w;
-        }
-      }
-      hasWaiters_.store(!waiters_.empty());
-    }
+    if (oversize && oversizeWaiting_ == 0) takeFitting(ready);
   }
   for (auto& wake : ready) {
     if (wake) wake();
   }
+}
+
+void MemoryBudget::takeFitting(std::vector<Wake>& ready) {
+  const std::uint64_t used = used_.load();
+  for (auto it = waiters_.begin(); it != waiters_.end();) {
+    if (fits(used, it->second.bytes)) {
+      auto next = std::next(it);
+      ready.push_back(drop(it));
+      it = next;
+    } else {
+      ++it;
+    }
+  }
+  hasWaiters_.store(!waiters_.empty());
 }
 
 std::size_t MemoryBudget::waiting() const {

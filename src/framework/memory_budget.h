@@ -82,6 +82,9 @@ class MemoryBudget {
   // Removes a waiter and returns its wake-up, to be released (or called)
   // after the lock: it may hold the last reference to its owner.
   Wake drop(std::unordered_map<const void*, Waiter>::iterator it) REQUIRES(mutex_);
+  // Takes every waiter that fits now out of the list and adds its wake-up
+  // to ready, to be called after the lock.
+  void takeFitting(std::vector<Wake>& ready) REQUIRES(mutex_);
 
   const std::uint64_t limit_;
   std::atomic<std::uint64_t> used_{0};
