@@ -37,6 +37,7 @@
 #include <limits>
 #include <thread>
 #include <unordered_map>
+#include <vector>
 
 #include "framework/thread_annotations.h"
 
