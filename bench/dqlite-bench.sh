@@ -89,48 +89,63 @@ done
 entry=${addresses[nodes - 1]}
 
 # ---------------------------------------------------------------- measuring
-# Every measurement prints "writes/s p50-us p99-us busy-retries".
+# Every measurement prints "writes/s p50-us p99-us busy-retries cpu-us":
+# the last is the processor time per write of the writing process and, on
+# dqlite, of the nodes.
 
 field() { sed -n "s/.*\"$2\":\([0-9.]*\).*/\1/p" <<<"$1"; }
+tick_us=$((1000000 / $(getconf CLK_TCK)))
+nodes_cpu_us() {  # user and system time of every node so far
+  local pid total=0
+  for pid in "${node_pids[@]}"; do
+    total=$((total + $(awk '{ print $14 + $15 }' "/proc/$pid/stat")))
+  done
+  echo $((total * tick_us))
+}
 
 measure() {  # local|dqlite, a name for the run's databases, then dqlite_bench write options
-  local side=$1 name=$2 out
+  local side=$1 name=$2 out nodes_before nodes_after
   shift 2
   local where=$entry
   [[ $side == local ]] && where=$work/local
+  nodes_before=$(nodes_cpu_us)
   out=$("$bench" write "$side" "$where" --seconds "$seconds" --name "$name" "$@") || {
     echo "dqlite-bench: the $side run ($*) failed: $out" >&2
     exit 1
   }
-  echo "$(field "$out" writes_per_sec) $(field "$out" p50_us) $(field "$out" p99_us) $(field "$out" busy_retries)"
+  nodes_after=$(nodes_cpu_us)
+  [[ $side == local ]] && nodes_after=$nodes_before
+  echo "$(field "$out" writes_per_sec) $(field "$out" p50_us) $(field "$out" p99_us) $(field "$out" busy_retries)" \
+    "$(awk -v c="$(field "$out" cpu_us)" -v n=$((nodes_after - nodes_before)) -v w="$(field "$out" writes)" \
+      'BEGIN { printf "%.0f", (c + n) / w }')"
 }
 
 median() { sort -g | awk '{ v[NR] = $1 } END { if (NR == 0) print 0; else print v[int((NR + 1) / 2)] }'; }
 
-printf '\n%-36s %9s %8s %8s %9s %8s %8s %6s %7s\n' "100 B upsert" "local w/s" "p50 us" "p99 us" \
-  "dqlite/s" "p50 us" "p99 us" "ratio" "busy"
+printf '\n%-36s %9s %8s %8s %7s %9s %8s %8s %7s %6s %7s\n' "100 B upsert" "local w/s" "p50 us" "p99 us" \
+  "cpu/w" "dqlite/s" "p50 us" "p99 us" "cpu/w" "ratio" "busy"
 # Runs both sides RUNS times, alternating, each run on new databases, and
 # prints one table row of medians.
 row_no=0
 row() {  # name, then dqlite_bench write options for both sides
-  local name=$1 i a b c d out
+  local name=$1 i a b c d e out
   shift
   row_no=$((row_no + 1))
-  local -a lo=() l5=() l9=() qo=() q5=() q9=() qb=()
+  local -a lo=() l5=() l9=() lc=() qo=() q5=() q9=() qb=() qc=()
   for ((i = 0; i < runs; i++)); do
     out=$(measure local "row$row_no-run$i" "$@") || exit 1
-    read -r a b c d <<<"$out"
-    lo+=("$a"); l5+=("$b"); l9+=("$c")
+    read -r a b c d e <<<"$out"
+    lo+=("$a"); l5+=("$b"); l9+=("$c"); lc+=("$e")
     out=$(measure dqlite "row$row_no-run$i" "$@") || exit 1
-    read -r a b c d <<<"$out"
-    qo+=("$a"); q5+=("$b"); q9+=("$c"); qb+=("$d")
+    read -r a b c d e <<<"$out"
+    qo+=("$a"); q5+=("$b"); q9+=("$c"); qb+=("$d"); qc+=("$e")
   done
   local m=() v
-  for v in lo l5 l9 qo q5 q9 qb; do
+  for v in lo l5 l9 lc qo q5 q9 qc qb; do
     m+=("$(eval "printf '%s\\n' \"\${${v}[@]}\"" | median)")
   done
-  printf '%-36s %9.0f %8.0f %8.0f %9.0f %8.0f %8.0f %6s %7.0f\n' "$name" "${m[0]}" "${m[1]}" "${m[2]}" "${m[3]}" \
-    "${m[4]}" "${m[5]}" "$(awk -v a="${m[3]}" -v b="${m[0]}" 'BEGIN { printf "%.2f", (b > 0 ? a / b : 0) }')" "${m[6]}"
+  printf '%-36s %9.0f %8.0f %8.0f %7.0f %9.0f %8.0f %8.0f %7.0f %6s %7.0f\n' "$name" "${m[@]:0:8}" \
+    "$(awk -v a="${m[4]}" -v b="${m[0]}" 'BEGIN { printf "%.2f", (b > 0 ? a / b : 0) }')" "${m[8]}"
 }
 
 row "1 conn" --connections 1
@@ -139,6 +154,7 @@ row "$connections conn over $connections databases" --connections "$connections"
 row "$connections conn, 1 database, no gate" --connections "$connections" --no-gate
 
 echo
-echo "dqlite-bench: ratio = dqlite writes/s over local; busy = writes the leader refused as busy and that were sent again"
+echo "dqlite-bench: cpu/w = processor time per write in us (the writing process, and on dqlite all nodes);" \
+  "ratio = dqlite writes/s over local; busy = refusals as busy that were sent again"
 "$bench" members "$entry" | sed 's/^/dqlite-bench: at the end, /'
 echo "dqlite-bench: load average at end: $(cut -d' ' -f1-3 /proc/loadavg); one 4 KiB O_DSYNC write: $(disk_sync_ms) ms"

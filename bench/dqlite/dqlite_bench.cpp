@@ -21,7 +21,9 @@
 // write in flight: connection I writes to database I mod D, cycling over 64
 // keys of its own ("c<I>-k<J>", as a BLOB like the meta table's id) with a
 // 100-byte value that starts with the write's sequence number. It prints one
-// line of JSON: writes, writes_per_sec, p50_us, p99_us, busy_retries. On
+// line of JSON: writes, writes_per_sec, p50_us, p99_us, busy_retries and
+// cpu_us, the processor time of this process while it wrote (the nodes'
+// time is theirs: bench/dqlite-bench.sh adds it from /proc). On
 // dqlite, each connection asks the server it is given for the leader,
 // connects there, opens its database and prepares the upsert once. On the
 // local side each connection has its own SQLite connection. On both sides a
@@ -55,6 +57,7 @@ extern "C" {  // dqlite.h declares no C linkage of its own
 #include <netinet/tcp.h>
 #include <signal.h>
 #include <sqlite3.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -727,6 +730,12 @@ int write(const Target& t, const WriteOptions& o) {
   std::vector<std::thread> threads;
   Gate gates[64];
   if (o.databases > 64) fail("write: at most 64 databases");
+  const auto cpuUs = [] {
+    rusage u{};
+    getrusage(RUSAGE_SELF, &u);
+    return (u.ru_utime.tv_sec + u.ru_stime.tv_sec) * 1000000LL + u.ru_utime.tv_usec + u.ru_stime.tv_usec;
+  };
+  const auto cpuAtStart = cpuUs();
   const auto start = Clock::now();
   const auto until = start + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(o.seconds));
   for (int i = 0; i < o.connections; ++i) {
@@ -740,6 +749,7 @@ int write(const Target& t, const WriteOptions& o) {
   }
   for (auto& th : threads) th.join();
   const double elapsed = std::chrono::duration<double>(Clock::now() - start).count();
+  const auto cpu = cpuUs() - cpuAtStart;
 
   for (std::size_t i = 0; i < workers.size(); ++i) {
     if (!workers[i].error.empty()) fail("connection " + std::to_string(i) + ": " + workers[i].error);
@@ -773,9 +783,10 @@ int write(const Target& t, const WriteOptions& o) {
   const auto pct = [&](double p) { return all[std::min(all.size() - 1, static_cast<std::size_t>(p * all.size()))]; };
   std::printf(
       "{\"side\":\"%s\",\"connections\":%d,\"databases\":%d,\"writes\":%llu,\"writes_per_sec\":%.1f,"
-      "\"p50_us\":%.0f,\"p99_us\":%.0f,\"busy_retries\":%llu,\"gate\":%s,\"checked\":true}\n",
+      "\"p50_us\":%.0f,\"p99_us\":%.0f,\"busy_retries\":%llu,\"cpu_us\":%lld,\"gate\":%s,\"checked\":true}\n",
       t.dqlite ? "dqlite" : "local", o.connections, o.databases, static_cast<unsigned long long>(writes),
-      writes / elapsed, pct(0.50), pct(0.99), static_cast<unsigned long long>(busy), o.gate ? "true" : "false");
+      writes / elapsed, pct(0.50), pct(0.99), static_cast<unsigned long long>(busy), static_cast<long long>(cpu),
+      o.gate ? "true" : "false");
   return 0;
 }
 
