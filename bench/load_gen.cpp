@@ -11,6 +11,13 @@
 // little CPU. --mode client runs each connection on a thread of its own
 // through the client library instead: what a client program sees, at the
 // price of one thread per connection competing for the cores.
+//
+//   load_gen --mode client --tls --ca ca.pem --command ping      (over TLS)
+//   load_gen --mode client --tls --ca ca.pem --reconnect          (handshakes)
+//
+// TLS runs in client mode only. --reconnect opens a new connection for
+// every request (ping only), so that the figures are those of connecting
+// (and, with TLS, of the handshake).
 
 #include <CLI/CLI.hpp>
 
@@ -45,6 +52,7 @@ struct Settings {
   unsigned loopThreads = 1;
   bool redis = false;
   bool json = false;
+  bool reconnect = false;
   loadgen::Params params;
 
   std::string dbName(unsigned connection) const {
@@ -180,7 +188,12 @@ void runClients(const Settings& s, const loadgen::Workload& w, std::vector<Strea
         const auto start = Clock::now();
         if (start >= deadline) break;
         try {
-          clients[i]->run(*cmds[i][n % cmds[i].size()]);
+          if (s.reconnect) {
+            cvdb::Client fresh(s.client);
+            fresh.run(*cmds[i][n % cmds[i].size()]);
+          } else {
+            clients[i]->run(*cmds[i][n % cmds[i].size()]);
+          }
         } catch (const std::exception& e) {
           if (r.errors++ == 0) r.firstError = e.what();
           if (!clients[i]->isOpen()) break;
@@ -235,7 +248,23 @@ int main(int argc, char** argv) {
   app.add_option("--loop-threads", s.loopThreads, "Event loops in loop mode")->capture_default_str();
   app.add_flag("--redis", s.redis, "The server is Redis: run the command's Redis counterpart");
   app.add_flag("--json", s.json, "One JSON object as the result");
+  bool tls = false;
+  cvdb::TlsOptions tlsOptions;
+  app.add_flag("--tls", tls, "Connect over TLS (client mode only)");
+  app.add_option("--ca", tlsOptions.caFile, "CA certificates that verify the server (with --tls)");
+  app.add_option("--cert", tlsOptions.certFile, "Client certificate (with --tls)");
+  app.add_option("--key", tlsOptions.keyFile, "Key of the client certificate (with --tls)");
+  app.add_flag("--reconnect", s.reconnect, "A new connection for every request (client mode, ping only)");
   CLI11_PARSE(app, argc, argv);
+  if (tls) s.client.tls = tlsOptions;
+  if ((tls || s.reconnect) && (s.mode != "client" || s.redis)) {
+    std::fprintf(stderr, "load_gen: --tls and --reconnect need --mode client\n");
+    return 2;
+  }
+  if (s.reconnect && s.command != "ping") {
+    std::fprintf(stderr, "load_gen: --reconnect runs ping only\n");
+    return 2;
+  }
   s.connections = std::max(1u, s.connections);
   s.databases = std::max(1u, s.databases);
 
@@ -304,7 +333,7 @@ int main(int argc, char** argv) {
   }
   std::sort(all.begin(), all.end());
   const double opsPerSec = static_cast<double>(all.size()) / elapsed;
-  const char* target = s.redis ? "redis" : "cvdb";
+  const char* target = s.redis ? "redis" : tls ? "cvdb-tls" : "cvdb";
   if (s.json) {
     std::printf(
         "{\"target\":\"%s\",\"command\":\"%s\",\"mode\":\"%s\",\"connections\":%u,\"databases\":%u,\"size\":%zu,"

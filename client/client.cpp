@@ -32,7 +32,8 @@ Ipc::UseInfo localUse(Ipc::UseInfo::State state) {
 
 Client::Client(ClientOptions options)
     : options_(std::move(options)),
-      socket_(std::make_unique<FrameSocket>(options_.host, options_.port, options_.connectTimeout)) {}
+      socket_(std::make_unique<FrameSocket>(options_.host, options_.port, options_.connectTimeout,
+                                            options_.tls ? &*options_.tls : nullptr)) {}
 
 Client::~Client() = default;
 

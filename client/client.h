@@ -5,6 +5,9 @@
 //   c.connect("Plant\\Line 2");
 //   json::Value layout = c.getCfg("layout");
 //
+//   cvdb::Client secure({.host = "db.example", .port = 45678,
+//                        .tls = cvdb::TlsOptions{.caFile = "/etc/corvina/ca.pem"}});
+//
 // Ownership: a Client owns its connection, opened by the constructor and
 // closed by close() or the destructor.
 // Thread safety: none; use one Client per thread.
@@ -41,6 +44,10 @@ struct ClientOptions {
   // Longest wait between two messages of a progress stream; 0 waits as long
   // as the operation takes.
   std::chrono::milliseconds progressTimeout{0};
+  // Set: the connection is TLS, and the server's certificate is verified
+  // against options.tls->caFile (or the system's trusted CAs) and the host
+  // name (client/tls_session.h). Unset: plain TCP.
+  std::optional<TlsOptions> tls;
 };
 
 // Percent (0 to 100) and text of one progress message.

@@ -60,7 +60,8 @@ UniqueFd connectOne(const addrinfo& ai, std::chrono::milliseconds timeout, int& 
 
 }  // namespace
 
-FrameSocket::FrameSocket(const std::string& host, std::uint16_t port, std::chrono::milliseconds connectTimeout) {
+FrameSocket::FrameSocket(const std::string& host, std::uint16_t port, std::chrono::milliseconds connectTimeout,
+                         const TlsOptions* tls) {
   addrinfo hints{};
   hints.ai_family = AF_UNSPEC;
   hints.ai_socktype = SOCK_STREAM;
@@ -74,11 +75,18 @@ FrameSocket::FrameSocket(const std::string& host, std::uint16_t port, std::chron
   if (!fd_.valid()) {
     throw ConnectFailed("cannot connect to " + host + ":" + service + ": " + errnoText(err));
   }
+  if (tls) tls_ = std::make_unique<TlsSession>(fd_.get(), host, *tls, connectTimeout);
 }
 
 FrameSocket::~FrameSocket() { close(); }
 
-void FrameSocket::close() noexcept { fd_.close(); }
+void FrameSocket::close() noexcept {
+  if (tls_) {
+    tls_->close();
+    tls_.reset();
+  }
+  fd_.close();
+}
 
 void FrameSocket::fail(const std::string& reason) {
   close();
@@ -97,6 +105,11 @@ void FrameSocket::waitFor(short events, std::chrono::milliseconds timeout) {
 
 void FrameSocket::sendRaw(const void* data, std::size_t size, std::chrono::milliseconds timeout) {
   if (!fd_.valid()) throw ConnectionEnded("the connection is closed", false);
+  if (tls_) {
+    // The socket stays open as in plain TCP.
+    tls_->write(data, size, timeout);
+    return;
+  }
   const auto* p = static_cast<const unsigned char*>(data);
   while (size > 0) {
     const ssize_t n = ::send(fd_.get(), p, size, MSG_NOSIGNAL);
@@ -127,6 +140,17 @@ void FrameSocket::send(const wire::OutFrame& frame, std::chrono::milliseconds ti
 }
 
 void FrameSocket::readExactly(unsigned char* out, std::size_t size, std::chrono::milliseconds timeout) {
+  while (size > 0 && tls_) {
+    std::size_t n = 0;
+    try {
+      n = tls_->read(out, size, timeout);
+    } catch (const ConnectionEnded& e) {
+      fail(e.reason());
+    }
+    if (n == 0) fail("the server closed the connection");
+    out += n;
+    size -= n;
+  }
   while (size > 0) {
     const ssize_t n = ::recv(fd_.get(), out, size, 0);
     if (n > 0) {

@@ -1,10 +1,12 @@
 #pragma once
 // One TCP connection to the server that sends and receives whole frames,
-// with blocking I/O bounded by timeouts.
+// with blocking I/O bounded by timeouts; in plain TCP, or over TLS when
+// given TLS options (client/tls_session.h).
 //
 // Ownership: owns its socket; closed by close() or the destructor.
 // Thread safety: none; one thread at a time.
-// Failures: ConnectFailed when the server cannot be reached;
+// Failures: ConnectFailed when the server cannot be reached (or, with TLS,
+// the handshake fails or the server's certificate is refused);
 // ConnectionEnded when the socket drops, a timeout passes or the server
 // sends a frame whose length is out of range. After a failed receive the
 // socket is closed; after a failed send it stays open for reading, since the
@@ -15,6 +17,7 @@
 #include <memory>
 #include <string>
 
+#include "client/tls_session.h"
 #include "framework/frame.h"
 #include "framework/unique_fd.h"
 #include "framework/wire.h"
@@ -32,8 +35,10 @@ class FrameSocket {
   };
 
   // Connects to host:port (a name or an IPv4/IPv6 address), trying every
-  // address the name resolves to within the timeout.
-  FrameSocket(const std::string& host, std::uint16_t port, std::chrono::milliseconds connectTimeout);
+  // address the name resolves to within the timeout; with tls, then
+  // completes a TLS handshake (within the timeout as well).
+  FrameSocket(const std::string& host, std::uint16_t port, std::chrono::milliseconds connectTimeout,
+              const TlsOptions* tls = nullptr);
   ~FrameSocket();
   FrameSocket(const FrameSocket&) = delete;
   FrameSocket& operator=(const FrameSocket&) = delete;
@@ -55,6 +60,7 @@ class FrameSocket {
   [[noreturn]] void fail(const std::string& reason);
 
   UniqueFd fd_;
+  std::unique_ptr<TlsSession> tls_;  // over fd_, when TLS
 };
 
 }  // namespace cvdb

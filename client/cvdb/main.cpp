@@ -25,6 +25,14 @@ int main(int argc, char** argv) {
   app.add_flag("--json", globals.json, "Machine-readable output");
   app.add_option("--timeout", globals.timeoutSeconds, "Seconds to wait for the server before giving up")
       ->capture_default_str();
+  app.add_flag("--tls", globals.tls,
+               "Connect over TLS; the server's certificate must name --host and chain to --ca (default: the "
+               "system's trusted CAs)");
+  app.add_option("--ca", globals.caFile, "CA certificates (PEM) that verify the server; implies --tls")
+      ->check(CLI::ExistingFile);
+  app.add_option("--cert", globals.certFile, "Client certificate (PEM) for servers that require one; implies --tls")
+      ->check(CLI::ExistingFile);
+  app.add_option("--key", globals.keyFile, "Private key (PEM, not encrypted) of --cert")->check(CLI::ExistingFile);
 
   Action action;
   const auto bound = addSubcommands(app, globals, action);
@@ -41,6 +49,13 @@ int main(int argc, char** argv) {
     options.port = globals.port;
     options.connectTimeout = std::chrono::seconds(std::min(globals.timeoutSeconds, 10u));
     options.ioTimeout = std::chrono::seconds(globals.timeoutSeconds);
+    if (globals.certFile.empty() != globals.keyFile.empty()) throw UsageError("--cert and --key go together");
+    if (globals.tls || !globals.caFile.empty() || !globals.certFile.empty()) {
+      cvdb::TlsOptions& tls = options.tls.emplace();
+      tls.caFile = globals.caFile;
+      tls.certFile = globals.certFile;
+      tls.keyFile = globals.keyFile;
+    }
     if (action.needsDb && !globals.db) throw UsageError("this command needs --db NAME");
     if (action.prepare) action.prepare();
     cvdb::Client client(options);

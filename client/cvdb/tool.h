@@ -38,6 +38,13 @@ struct Globals {
   std::uint32_t openMode = 0;
   bool json = false;
   unsigned timeoutSeconds = 60;
+  // TLS: on with --tls (or any of the files); the CA file verifies the
+  // server (empty: the system's trusted CAs), the certificate and key
+  // identify the client.
+  bool tls = false;
+  std::string caFile;
+  std::string certFile;
+  std::string keyFile;
 };
 
 // What a subcommand does once the command line is parsed.

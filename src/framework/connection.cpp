@@ -1,5 +1,6 @@
 // The connection's life: construction, the Socket face, the running
-// command's bookkeeping, ending (Bye, drain, finish) and the stall timer.
+// command's bookkeeping, the TLS handshake, ending (Bye, drain, finish) and
+// the stall timer.
 // Reading and framing are in connection_read.cpp, the write queue in
 // connection_write.cpp.
 
@@ -9,6 +10,7 @@
 #include <boost/asio/post.hpp>
 
 #include "framework/frame.h"
+#include "framework/tls_context.h"
 #include "framework/transport_core.h"
 #include "framework/wire.h"
 
@@ -45,14 +47,17 @@ wire::OutFrame Connection::textFrame(std::uint8_t tag, wire::FrameKind kind, con
 
 Connection::Connection(std::shared_ptr<ServerCore> core, StrandSocket socket)
     : core_(std::move(core)),
-      socket_(std::move(socket)),
-      stallTimer_(socket_.get_executor()),
-      closeTimer_(socket_.get_executor()),
-      peer_(describePeer(socket_)),
+      stream_(std::move(socket), core_->tls.get()),
+      stallTimer_(stream_.socket().get_executor()),
+      closeTimer_(stream_.socket().get_executor()),
+      peer_(describePeer(stream_.socket())),
       stage_(std::make_shared<unsigned char[]>(kStageSize)) {
-  // Writes are tried at once, which must never block the thread.
+  // Writes are tried at once, which must never block the thread. A TLS
+  // session writes through its own asynchronous operations only: a write
+  // that the socket takes in part would leave a record half sent.
+  if (stream_.tls()) return;
   boost::system::error_code ec;
-  socket_.non_blocking(true, ec);
+  stream_.socket().non_blocking(true, ec);
   writeAtOnce_ = !ec;
 }
 
@@ -73,7 +78,7 @@ Connection::~Connection() {
 
 template <typename F>
 void Connection::onStrand(F&& f, bool last) {
-  if (socket_.get_executor().running_in_this_thread()) {
+  if (stream_.socket().get_executor().running_in_this_thread()) {
     if (!finished_) f();
     return;
   }
@@ -83,9 +88,9 @@ void Connection::onStrand(F&& f, bool last) {
     if (!self->finished_) f();
   };
   if (last) {
-    asio::defer(socket_.get_executor(), std::move(task));
+    asio::defer(stream_.socket().get_executor(), std::move(task));
   } else {
-    asio::post(socket_.get_executor(), std::move(task));
+    asio::post(stream_.socket().get_executor(), std::move(task));
   }
 }
 
@@ -98,10 +103,36 @@ void Connection::start() {
     }
     open_ = false;
     finished_ = true;
-    socket_.close(ec);
+    stream_.socket().close(ec);
     return;
   }
-  onStrand([this] { startRead(); });
+  onStrand([this] {
+    if (stream_.tls()) {
+      startHandshake();
+    } else {
+      startRead();
+    }
+  });
+}
+
+void Connection::startHandshake() {
+  handshaking_ = true;
+  handshakeSince_ = Clock::now();
+  stream_.asyncHandshake([self = shared_from_this()](const boost::system::error_code& ec) { self->onHandshake(ec); });
+  armStallTimer();
+}
+
+void Connection::onHandshake(const boost::system::error_code& ec) {
+  handshaking_ = false;
+  // Closed meanwhile: by the stall timer (which has reported it) or a stop.
+  if (finished_) return;
+  if (ec) {
+    core_->report(shared_from_this(), "TLS handshake with " + peer_ +
+                                          " failed: " + tlsFailureText(ec, stream_.session()) + "; connection ended");
+    finish();
+    return;
+  }
+  startRead();
 }
 
 // ---------------------------------------------------------------- Socket
@@ -205,6 +236,11 @@ void Connection::fail(const std::string& text, const std::string& byeReason) {
 
 void Connection::beginClose(const std::string& reason) {
   if (closing_ || finished_) return;
+  // Before the handshake no frame can reach the peer.
+  if (handshaking_) {
+    finish();
+    return;
+  }
   closing_ = true;
   open_ = false;
   inBody_ = false;
@@ -242,7 +278,7 @@ void Connection::finish() {
   stallTimer_.cancel();
   closeTimer_.cancel();
   boost::system::error_code ignored;
-  socket_.close(ignored);
+  stream_.socket().close(ignored);
   // Frames that a write in flight gathers from go when it completes; a
   // read in flight holds its own share of its buffer.
   if (!writing_) out_.clear();
@@ -265,6 +301,7 @@ void Connection::finish() {
 void Connection::armStallTimer() {
   if (stallArmed_ || finished_ || closing_) return;
   std::optional<Clock::time_point> deadline;
+  if (handshaking_) deadline = handshakeSince_ + core_->options.stallTimeout;
   if (reading_ && partialFrame()) deadline = readSince_ + core_->options.stallTimeout;
   if (writing_) {
     const auto w = writeSince_ + core_->options.stallTimeout;
@@ -281,6 +318,12 @@ void Connection::onStallTimer(const boost::system::error_code& ec) {
   if (ec || finished_ || closing_) return;
   const auto now = Clock::now();
   const auto limit = core_->options.stallTimeout;
+  if (handshaking_ && now - handshakeSince_ >= limit) {
+    core_->report(shared_from_this(),
+                  "TLS handshake with " + peer_ + " did not complete within " + millis(limit) + "; connection ended");
+    finish();
+    return;
+  }
   if (reading_ && partialFrame() && now - readSince_ >= limit) {
     fail("Connection from " + peer_ + " sent part of a frame and nothing more for " + millis(limit) +
              "; connection ended",

@@ -1,7 +1,10 @@
 #pragma once
 // Internal to the transport: one client connection.
 //
-// Reads request frames, turns each into a command through the factory and
+// With TLS, first completes the handshake (within the stall timeout; a
+// peer that does not finish it is closed, and a failed handshake is
+// reported once with OpenSSL's reason). Then
+// reads request frames, turns each into a command through the factory and
 // runs it on an I/O thread outside the connection's strand (or answers it
 // at once when it has no processor), reading no further request until the
 // command is done; queues outgoing
@@ -36,9 +39,6 @@
 #include <atomic>
 #include <boost/asio/buffer.hpp>
 #include <boost/asio/io_context.hpp>
-#include <boost/asio/ip/tcp.hpp>
-#include <boost/asio/steady_timer.hpp>
-#include <boost/asio/strand.hpp>
 #include <chrono>
 #include <cstdint>
 #include <deque>
@@ -46,18 +46,15 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "framework/buffers.h"
 #include "framework/cmd.h"
+#include "framework/conn_stream.h"
 
 namespace Ipc::detail {
 
 class ServerCore;
-
-using Strand = boost::asio::strand<boost::asio::io_context::executor_type>;
-using StrandSocket = boost::asio::basic_stream_socket<boost::asio::ip::tcp, Strand>;
-using StrandTimer = boost::asio::basic_waitable_timer<std::chrono::steady_clock,
-                                                      boost::asio::wait_traits<std::chrono::steady_clock>, Strand>;
 
 class Connection final : public Socket, public std::enable_shared_from_this<Connection> {
  public:
@@ -123,6 +120,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   }
   void endCommand();
   void goOn();
+  // TLS only: the handshake, before the first read.
+  void startHandshake();
+  void onHandshake(const boost::system::error_code& ec);
   void startRead();
   void onRead(const boost::system::error_code& ec, std::size_t n);
   void peerGone();
@@ -137,6 +137,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   void enqueue(wire::OutFrame frame);
   void startWrite();
   std::size_t gather();
+  // TLS: the gathered buffers as one (copied into tlsOut_ unless the first
+  // is large enough to go alone), so that small frames share a record.
+  boost::asio::const_buffer coalesce(std::size_t count);
   void consumeWritten(std::uint64_t n);
   void byeWritten();
   // Once the connection is ending and no command runs (before its Bye is
@@ -174,7 +177,7 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   static wire::OutFrame textFrame(std::uint8_t tag, wire::FrameKind kind, const std::string& text);
 
   const std::shared_ptr<ServerCore> core_;
-  StrandSocket socket_;
+  ConnStream stream_;
   StrandTimer stallTimer_;
   StrandTimer closeTimer_;
   const std::string peer_;
@@ -202,7 +205,9 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   std::uint64_t frontSent_ = 0;  // bytes of out_.front() already written
   std::uint64_t outBytes_ = 0;   // bytes queued and not yet written
   std::array<boost::asio::const_buffer, 32> gather_;
+  std::vector<unsigned char> tlsOut_;  // coalesce's copy, unchanged while a write is in flight
 
+  bool handshaking_ = false;  // the TLS handshake is in flight
   bool reading_ = false;
   bool writing_ = false;
   bool busy_ = false;         // a command is running; no further request is read
@@ -215,6 +220,7 @@ class Connection final : public Socket, public std::enable_shared_from_this<Conn
   bool finished_ = false;    // the socket is closed
   bool stallArmed_ = false;
   bool writeAtOnce_ = false;  // the socket is in non-blocking mode
+  std::chrono::steady_clock::time_point handshakeSince_;
   std::chrono::steady_clock::time_point readSince_;
   std::chrono::steady_clock::time_point writeSince_;
 

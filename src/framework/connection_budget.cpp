@@ -34,7 +34,7 @@ void Connection::resumeAfterWait() {
   // calls this may be in the middle of the write queue's bookkeeping.
   std::lock_guard lock(postMutex_);
   if (!accepting_) return;
-  boost::asio::post(socket_.get_executor(), [self = shared_from_this()] {
+  boost::asio::post(stream_.socket().get_executor(), [self = shared_from_this()] {
     if (!self->finished_) self->onMemoryFreed();
   });
 }

@@ -5,6 +5,7 @@
 #include "framework/connection.h"
 
 #include <boost/asio/defer.hpp>
+#include <boost/asio/ssl/error.hpp>
 #include <cstring>
 
 #include "framework/request_decoder.h"
@@ -55,8 +56,8 @@ void Connection::startRead() {
 }
 
 void Connection::readInto(std::shared_ptr<const void> owner, unsigned char* data, std::size_t size) {
-  socket_.async_read_some(asio::buffer(data, size), [self = shared_from_this(), owner = std::move(owner)](
-                                                        const boost::system::error_code& ec, std::size_t n) {
+  stream_.asyncReadSome(asio::buffer(data, size), [self = shared_from_this(), owner = std::move(owner)](
+                                                      const boost::system::error_code& ec, std::size_t n) {
     // owner kept the bytes alive until here, whatever has become of the
     // connection's own share meanwhile.
     self->onRead(ec, n);
@@ -78,7 +79,9 @@ void Connection::onRead(const boost::system::error_code& ec, std::size_t n) {
   }
   if (ec) {
     peerDone_ = true;
-    if (ec == asio::error::eof) {
+    // A TLS peer that closes its socket without ending the session first
+    // (most do) has ended its stream all the same.
+    if (ec == asio::error::eof || ec == asio::ssl::error::stream_truncated) {
       goOn();
       return;
     }

@@ -4,6 +4,7 @@
 
 #include "framework/connection.h"
 
+#include <algorithm>
 #include <boost/asio/write.hpp>
 
 #include "framework/transport_core.h"
@@ -13,6 +14,10 @@ namespace {
 
 namespace asio = boost::asio;
 using Clock = std::chrono::steady_clock;
+
+// What one TLS write takes at most when frames are copied together: one
+// full record.
+constexpr std::size_t kTlsCoalesce = 16 * 1024;
 
 // A view of the first count buffers of an array, as an Asio buffer sequence.
 struct BufferSpan {
@@ -34,19 +39,25 @@ void Connection::enqueue(wire::OutFrame frame) {
 // Writes what is queued: first at once, without waiting (the usual case:
 // the socket takes a small answer whole, and no completion has to be
 // scheduled for it), then, for what the socket did not take, with an
-// asynchronous write.
+// asynchronous write. A TLS session always writes asynchronously, from one
+// buffer.
 void Connection::startWrite() {
   while (!writing_ && !finished_) {
     const std::size_t count = gather();
     if (count == 0) return;
     boost::system::error_code ec = asio::error::would_block;
-    const std::size_t n = writeAtOnce_ ? socket_.write_some(BufferSpan{gather_.data(), count}, ec) : 0;
+    const std::size_t n = writeAtOnce_ ? stream_.socket().write_some(BufferSpan{gather_.data(), count}, ec) : 0;
     if (ec == asio::error::would_block || ec == asio::error::try_again || (!ec && n == 0)) {
       writing_ = true;
       writeSince_ = Clock::now();
-      socket_.async_write_some(
-          BufferSpan{gather_.data(), count},
-          [self = shared_from_this()](const boost::system::error_code& e, std::size_t m) { self->onWrite(e, m); });
+      auto done = [self = shared_from_this()](const boost::system::error_code& e, std::size_t m) {
+        self->onWrite(e, m);
+      };
+      if (stream_.tls()) {
+        stream_.asyncWriteSome(coalesce(count), std::move(done));
+      } else {
+        stream_.asyncWriteSome(BufferSpan{gather_.data(), count}, std::move(done));
+      }
       armStallTimer();
       return;
     }
@@ -88,6 +99,16 @@ std::size_t Connection::gather() {
   return count;
 }
 
+asio::const_buffer Connection::coalesce(std::size_t count) {
+  if (count == 1 || gather_[0].size() >= kTlsCoalesce) return gather_[0];
+  tlsOut_.clear();
+  for (std::size_t i = 0; i < count && tlsOut_.size() < kTlsCoalesce; ++i) {
+    const auto* p = static_cast<const unsigned char*>(gather_[i].data());
+    tlsOut_.insert(tlsOut_.end(), p, p + std::min(gather_[i].size(), kTlsCoalesce - tlsOut_.size()));
+  }
+  return asio::buffer(tlsOut_);
+}
+
 void Connection::consumeWritten(std::uint64_t n) {
   outBytes_ -= n;
   core_->releaseMemory(n);
@@ -111,7 +132,9 @@ void Connection::byeWritten() {
   if (byeFlushed_) return;
   byeFlushed_ = true;
   boost::system::error_code ignored;
-  socket_.shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
+  // With TLS too: the Bye's records are written whole, and the peer that
+  // has read them needs no more than the end of the stream.
+  stream_.socket().shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
   if (peerDone_) {
     finish();
   } else {

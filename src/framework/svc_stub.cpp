@@ -36,7 +36,8 @@ class SvcStub::Impl {
     }
     acceptor_->start();
     Log::Lock entry(Log::Notice);
-    entry.logStreamLine() << "Listening on port " << acceptor_->port() << (ip4Only ? " (IPv4 only)" : "");
+    entry.logStreamLine() << "Listening on port " << acceptor_->port() << " (" << options.tls.modeName()
+                          << (ip4Only ? ", IPv4 only)" : ")");
   }
 
   ~Impl() {

@@ -1,9 +1,10 @@
 #pragma once
-// The command server: accepts TCP connections, reads request frames, builds
+// The command server: accepts TCP connections (plain, or TLS only when
+// Options::tls says so), reads request frames, builds
 // commands through the factory and hands them to their processor.
 //
 // Serving starts in the constructor (which throws std::runtime_error when the
-// port cannot be bound) and lasts until signalStop(); waitToFinish() then
+// port cannot be bound or the TLS files cannot be used) and lasts until signalStop(); waitToFinish() then
 // returns once every connection is closed and every command that was being
 // processed has ended.
 //
@@ -24,6 +25,7 @@
 
 #include "framework/cmd.h"
 #include "framework/frame.h"
+#include "framework/tls_files.h"
 
 namespace Ipc {
 
@@ -71,6 +73,9 @@ class SvcStub {
     // How long after a large amount of buffer memory has been released the
     // allocator is asked to return its free memory to the system (0: never).
     std::chrono::milliseconds trimDelay{1000};
+    // TLS of every connection (TlsFiles); plain TCP when empty. A client
+    // that has not completed its handshake within stallTimeout is closed.
+    TlsFiles tls;
   };
 
   // port 0 binds a free port (see port()). With forceIp4 false the server

@@ -6,6 +6,7 @@
 #include <thread>
 
 #include "framework/log.h"
+#include "framework/tls_context.h"
 
 namespace Ipc::detail {
 namespace {
@@ -24,6 +25,7 @@ unsigned ioThreadCount(unsigned asked) {
 
 ServerCore::ServerCore(const SvcStub::Options& opts, CmdFactory f, IpcErrorHandler onError)
     : options(opts),
+      tls(makeServerTlsContext(opts.tls)),
       factory(std::move(f)),
       threads(IoPool::Options{ioThreadCount(opts.ioThreads), opts.maxThreads, opts.spareIdle, opts.blockedAfter},
               [this](const std::string& text) { report(nullptr, text); }),

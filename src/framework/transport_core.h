@@ -10,6 +10,7 @@
 
 #include <atomic>
 #include <boost/asio/io_context.hpp>
+#include <boost/asio/ssl/context.hpp>
 #include <condition_variable>
 #include <cstddef>
 #include <limits>
@@ -29,12 +30,16 @@ class Connection;
 
 class ServerCore {
  public:
+  // Throws std::runtime_error when the TLS files cannot be used.
   ServerCore(const SvcStub::Options& options, CmdFactory factory, IpcErrorHandler onError);
   ServerCore(const ServerCore&) = delete;
   ServerCore& operator=(const ServerCore&) = delete;
 
   boost::asio::io_context io;
   const SvcStub::Options options;
+  // The OpenSSL context of every connection when options.tls is on; null
+  // for plain TCP.
+  const std::unique_ptr<boost::asio::ssl::context> tls;
   const CmdFactory factory;
   // The threads that run io, and the commands.
   IoPool threads;

@@ -10,6 +10,7 @@
 #include "engine/db_instances.h"
 #include "engine/instance_for_maintenance.h"
 #include "framework/log.h"
+#include "framework/tls_files.h"
 #include "ipc/listener.h"
 #include "maintenance/restore_journal.h"
 #include "service/metrics_page.h"
@@ -34,6 +35,19 @@ void logMaintenanceFolders(const DB::Paths& paths) {
   auto& line = entry.logStreamLine();
   line << "Backup and restore are confined to \"" << paths.backupFolder() << '"';
   for (const std::string& folder : paths.maintenanceFolders()) line << ", \"" << folder << '"';
+}
+
+// Whether the client port can be served as the settings ask: a TLS setting
+// that cannot be used stops the start rather than leave the port in plain
+// TCP. Empty when it can; else the reason, naming the setting or file.
+std::string tlsProblem(const DBConfig& config) {
+  if (!config.TlsProblem.empty()) return config.TlsProblem;
+  try {
+    Ipc::checkTlsFiles(config.tlsFiles());
+  } catch (const std::exception& e) {
+    return e.what();
+  }
+  return {};
 }
 
 void debugLine(const char* text) {
@@ -61,16 +75,23 @@ int DBSvc::checkConfig() {
     std::cout << (i == 0 ? "\"" : ", \"") << config.MaintenanceFolders[i] << '"';
   }
   std::cout << '\n';
+  const std::string tls = tlsProblem(config);
+  if (!tls.empty()) std::cout << "The server would not start: " << tls << '\n';
   if (!problem.empty()) {
     std::cout << "Not taken whole: " << problem << '\n';
     return 1;
   }
+  if (!tls.empty()) return 1;
   std::cout << "The configuration was read whole.\n";
   return 0;
 }
 
 bool DBSvc::prepareSvc() {
-  DBConfig::inst();
+  const DBConfig& config = DBConfig::inst();
+  if (const std::string problem = tlsProblem(config); !problem.empty()) {
+    Log::Lock(Log::Error).logStreamLine() << "Cannot serve clients over TLS: " << problem;
+    return false;
+  }
   return true;
 }
 
@@ -98,6 +119,7 @@ void DBSvc::runSvc() {
         [pool, started](std::stop_token stop) { DB::removeStaleTempFiles(pool->env(), pool->paths(), started, stop); });
     Ipc::SvcStub::Options transport;
     transport.memoryBudget = config.MaxBufferedMiB << 20;  // 0 stays 0: no limit
+    transport.tls = config.tlsFiles();
     std::shared_ptr<Ipc::DB::Listener> created =
         Ipc::DB::createListener(config.ServerPort, config.ForceIP4, pool, transport);
     Ipc::SvcStub& server = Ipc::DB::serverOf(*created);

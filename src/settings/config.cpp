@@ -107,6 +107,25 @@ void readKeys(const json::Object& obj, DBConfig& c) {
   if (const auto v = obj.get("MetricsAddress"); !v.empty()) c.MetricsAddress = v.asString();
 }
 
+// The TLS keys are read apart from the others, whatever became of those: a
+// type error elsewhere must not leave a server that is meant to speak TLS
+// in plain TCP. Their own problems go to TlsProblem, which stops the start.
+void readTlsKeys(const json::Object& obj, DBConfig& c) {
+  try {
+    if (const auto v = obj.get("TlsCertFile"); !v.empty()) c.TlsCertFile = v.asString();
+    if (const auto v = obj.get("TlsKeyFile"); !v.empty()) c.TlsKeyFile = v.asString();
+    if (const auto v = obj.get("TlsClientCAFile"); !v.empty()) c.TlsClientCAFile = v.asString();
+  } catch (const json::Exc& e) {
+    c.TlsProblem = std::string("a TLS key has the wrong type: ") + e.what();
+    return;
+  }
+  if (c.TlsCertFile.empty() != c.TlsKeyFile.empty()) {
+    c.TlsProblem = "TlsCertFile and TlsKeyFile must be set together";
+  } else if (!c.TlsClientCAFile.empty() && c.TlsCertFile.empty()) {
+    c.TlsProblem = "TlsClientCAFile needs TlsCertFile and TlsKeyFile";
+  }
+}
+
 const DBConfig& loadedRecord() {
   static const DBConfig record = DBConfig::load(DBConfig::defaultRoot(), sys::Env::posix());
   return record;
@@ -135,7 +154,10 @@ DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env, std::stri
     std::string text;
     if (readConfigFile(env, defaultRoot + kConfigFileName, text)) {
       const json::Object obj = json::strToObject(text);
-      if (obj.size() > 0) readKeys(obj, c);
+      if (obj.size() > 0) {
+        readTlsKeys(obj, c);
+        readKeys(obj, c);
+      }
     } else if (problem) {
       *problem = "no readable " + defaultRoot + kConfigFileName + ": every setting is its default";
     }
@@ -171,7 +193,17 @@ std::string DBConfig::printout() const {
       << "\tmaximum wait time maintenance operation: " << MaxWaitMaintenanceOpSecs << '\n'
       << "\tdb engine event logging: " << onOff(EnableEngineLogging) << '\n'
       << "\tmaximum buffered memory (MiB): "
-      << (MaxBufferedMiB == 0 ? std::string("unlimited") : std::to_string(MaxBufferedMiB)) << '\n';
+      << (MaxBufferedMiB == 0 ? std::string("unlimited") : std::to_string(MaxBufferedMiB)) << '\n'
+      << "\tclient connections: ";
+  const Ipc::TlsFiles tls = tlsFiles();
+  if (!TlsProblem.empty()) {
+    out << "not usable: " << TlsProblem;
+  } else {
+    out << tls.modeName();
+    if (tls.enabled()) out << ", certificate \"" << TlsCertFile << "\", key \"" << TlsKeyFile << '"';
+    if (tls.mutual()) out << ", client CA \"" << TlsClientCAFile << '"';
+  }
+  out << '\n';
   return out.str();
 }
 

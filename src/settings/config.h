@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "framework/env.h"
+#include "framework/tls_files.h"
 
 class DBConfig {
  public:
@@ -41,6 +42,17 @@ class DBConfig {
   // The HTTP port of /metrics and /healthz (0: none), and its address.
   std::uint16_t MetricsPort = 0;
   std::string MetricsAddress = "127.0.0.1";
+  // TLS of the client port: with the certificate and key set, TLS only;
+  // with the client CA too, mutual TLS. All empty: plain TCP.
+  std::string TlsCertFile;
+  std::string TlsKeyFile;
+  std::string TlsClientCAFile;
+  // Why the TLS keys cannot be used as given (a key of the wrong type, a
+  // certificate without its key, ...); empty when they can. The server does
+  // not start with a problem here rather than serve in plain TCP.
+  std::string TlsProblem;
+
+  Ipc::TlsFiles tlsFiles() const { return {TlsCertFile, TlsKeyFile, TlsClientCAFile}; }
 
   // The process-wide record; loads and prints it on the first call.
   static const DBConfig& inst();
@@ -57,7 +69,7 @@ class DBConfig {
   // joined with "db", followed by "/".
   static std::string defaultRoot();
 
-  // The sixteen-line settings printout, without the log entry around it.
+  // The seventeen-line settings printout, without the log entry around it.
   std::string printout() const;
 
   // For tests: makes inst() return the given record while the object lives.

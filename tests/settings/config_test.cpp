@@ -67,7 +67,8 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
                                "\trecycle log file size: 10485760\n"
                                "\tmaximum wait time maintenance operation: 10\n"
                                "\tdb engine event logging: disabled\n"
-                               "\tmaximum buffered memory (MiB): 256\n";
+                               "\tmaximum buffered memory (MiB): 256\n"
+                               "\tclient connections: plain TCP\n";
   const auto entries = log.entries();
   ASSERT_EQ(entries.size(), 1u);
   EXPECT_EQ(entries[0].priority, Log::Notice);
@@ -116,6 +117,40 @@ TEST(Config, WrongTypeStopsReadingInKeyOrderNotFileOrder) {
   EXPECT_EQ(d.MaxActiveClients, 9u);
   EXPECT_EQ(d.DBFileName, "cvdb.edb");
   EXPECT_EQ(log.count(Log::Error, "Wrong type: integer. Expected type: string"), 1u);
+}
+
+// The TLS keys are read whatever became of the others, and what cannot be
+// served as asked is a problem that stops the start, never plain TCP.
+TEST(Config, TlsKeysGiveTheModeOrAProblem) {
+  struct Case {
+    const char* text;
+    const char* mode;     // printed after "client connections: "
+    const char* problem;  // TlsProblem, empty when none
+  };
+  for (const Case& c : {
+           Case{R"({"TlsCertFile": "", "TlsKeyFile": ""})", "plain TCP", ""},
+           Case{R"({"TlsCertFile": "/c.pem", "TlsKeyFile": "/k.pem"})", "TLS, certificate \"/c.pem\", key \"/k.pem\"",
+                ""},
+           Case{R"({"TlsCertFile": "/c.pem", "TlsKeyFile": "/k.pem", "TlsClientCAFile": "/ca.pem"})",
+                "mutual TLS, certificate \"/c.pem\", key \"/k.pem\", client CA \"/ca.pem\"", ""},
+           // After a type error that stops the other keys.
+           Case{R"({"ServerPort": "x", "TlsCertFile": "/c.pem", "TlsKeyFile": "/k.pem"})",
+                "TLS, certificate \"/c.pem\", key \"/k.pem\"", ""},
+           Case{R"({"TlsKeyFile": "/k.pem"})", "not usable: TlsCertFile and TlsKeyFile must be set together",
+                "TlsCertFile and TlsKeyFile must be set together"},
+           Case{R"({"TlsClientCAFile": "/ca.pem"})", "not usable: TlsClientCAFile needs TlsCertFile and TlsKeyFile",
+                "TlsClientCAFile needs TlsCertFile and TlsKeyFile"},
+           Case{R"({"TlsCertFile": "/c.pem", "TlsKeyFile": true})",
+                "not usable: a TLS key has the wrong type: JSON error: Wrong type: boolean. Expected type: string",
+                "a TLS key has the wrong type: JSON error: Wrong type: boolean. Expected type: string"},
+       }) {
+    SCOPED_TRACE(c.text);
+    LogCapture log;
+    const DBConfig config = loadWith(c.text);
+    EXPECT_EQ(config.TlsProblem, c.problem);
+    EXPECT_NE(config.printout().find(std::string("\tclient connections: ") + c.mode + "\n"), std::string::npos)
+        << config.printout();
+  }
 }
 
 TEST(Config, LooselyTypedKeysNeverStopReadingAndSwitchesTakeOnlyTheLiteralTrue) {
