@@ -77,17 +77,24 @@ int DBSvc::checkConfig() {
   std::cout << '\n';
   const std::string tls = tlsProblem(config);
   if (!tls.empty()) std::cout << "The server would not start: " << tls << '\n';
+  if (!config.MaintenanceFoldersProblem.empty()) {
+    std::cout << "The server would not start: " << config.MaintenanceFoldersProblem << '\n';
+  }
   if (!problem.empty()) {
     std::cout << "Not taken whole: " << problem << '\n';
     return 1;
   }
-  if (!tls.empty()) return 1;
+  if (!tls.empty() || !config.MaintenanceFoldersProblem.empty()) return 1;
   std::cout << "The configuration was read whole.\n";
   return 0;
 }
 
 bool DBSvc::prepareSvc() {
   const DBConfig& config = DBConfig::inst();
+  if (!config.MaintenanceFoldersProblem.empty()) {
+    Log::Lock(Log::Error).logStreamLine() << "Cannot confine backup and restore: " << config.MaintenanceFoldersProblem;
+    return false;
+  }
   if (const std::string problem = tlsProblem(config); !problem.empty()) {
     Log::Lock(Log::Error).logStreamLine() << "Cannot serve clients over TLS: " << problem;
     return false;

@@ -93,16 +93,6 @@ void readKeys(const json::Object& obj, DBConfig& c) {
   if (const auto v = obj.get("MaxBufferedMiB"); !v.empty()) {
     c.MaxBufferedMiB = limited(v.asInteger(), kMaxBufferedMiBLimit);
   }
-  if (const auto v = obj.get("MaintenanceFolders"); !v.empty()) {
-    if (!v.isArray())
-      throw json::Exc(std::string("MaintenanceFolders: expected an array of folders, got ") + v.typeName());
-    std::vector<std::string> folders;
-    for (std::size_t i = 0; i < json_array_size(v.get()); ++i) {
-      const std::string folder = json::Value::borrow(json_array_get(v.get(), i)).asString();
-      if (!folder.empty()) folders.push_back(normaliseFolder(folder));
-    }
-    c.MaintenanceFolders = std::move(folders);
-  }
   if (const auto v = obj.get("MetricsPort"); !v.empty()) c.MetricsPort = static_cast<std::uint16_t>(v.asInteger());
   if (const auto v = obj.get("MetricsAddress"); !v.empty()) c.MetricsAddress = v.asString();
 }
@@ -124,6 +114,30 @@ void readTlsKeys(const json::Object& obj, DBConfig& c) {
   } else if (!c.TlsClientCAFile.empty() && c.TlsCertFile.empty()) {
     c.TlsProblem = "TlsClientCAFile needs TlsCertFile and TlsKeyFile";
   }
+}
+
+// MaintenanceFolders is read apart from the other keys too: a type error
+// elsewhere must not leave a server that is meant to confine backup and
+// restore accepting any path. A value that is not an array of texts is a
+// problem that stops the start (MaintenanceFoldersProblem).
+void readMaintenanceFolders(const json::Object& obj, DBConfig& c) {
+  const auto v = obj.get("MaintenanceFolders");
+  if (v.empty()) return;
+  if (!v.isArray()) {
+    c.MaintenanceFoldersProblem = std::string("MaintenanceFolders: expected an array of folders, got ") + v.typeName();
+    return;
+  }
+  std::vector<std::string> folders;
+  for (std::size_t i = 0; i < json_array_size(v.get()); ++i) {
+    const auto entry = json::Value::borrow(json_array_get(v.get(), i));
+    if (!entry.isString()) {
+      c.MaintenanceFoldersProblem =
+          "MaintenanceFolders: entry " + std::to_string(i + 1) + " is " + entry.typeName() + ", not a folder";
+      return;
+    }
+    if (const std::string folder = entry.asString(); !folder.empty()) folders.push_back(normaliseFolder(folder));
+  }
+  c.MaintenanceFolders = std::move(folders);
 }
 
 const DBConfig& loadedRecord() {
@@ -156,6 +170,7 @@ DBConfig DBConfig::load(const std::string& defaultRoot, sys::Env& env, std::stri
       const json::Object obj = json::strToObject(text);
       if (obj.size() > 0) {
         readTlsKeys(obj, c);
+        readMaintenanceFolders(obj, c);
         readKeys(obj, c);
       }
     } else if (problem) {

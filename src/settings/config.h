@@ -39,6 +39,10 @@ class DBConfig {
   // Folders that backup targets and restore sources must lie in (with the
   // backup folder, always allowed); empty allows any path.
   std::vector<std::string> MaintenanceFolders;
+  // Why MaintenanceFolders cannot be used as given (not an array of
+  // folders); empty when it can. The server does not start with a problem
+  // here rather than accept any path.
+  std::string MaintenanceFoldersProblem;
   // The HTTP port of /metrics and /healthz (0: none), and its address.
   std::uint16_t MetricsPort = 0;
   std::string MetricsAddress = "127.0.0.1";

@@ -292,3 +292,16 @@ TEST(CvdbTool, AServerWithoutMaintenanceFoldersSaysThatAnyPathIsAccepted) {
   ServerProcess server(kServer);
   EXPECT_TRUE(server.waitForLogLine("Backup and restore accept any path on the server: MaintenanceFolders is not set"));
 }
+
+// A MaintenanceFolders that cannot be used stops the start instead of
+// leaving every path open.
+TEST(CvdbTool, AnUnusableMaintenanceFoldersStopsTheStart) {
+  testing_support::ServerOptions o;
+  o.configJson = R"({"ServerPort": 0, "MaintenanceFolders": "/srv/backups"})";
+  o.waitUntilListening = false;
+  ServerProcess server(kServer, o);
+  EXPECT_EQ(server.wait(), 1);
+  EXPECT_TRUE(server.waitForLogLine(
+      "Cannot confine backup and restore: MaintenanceFolders: expected an array of folders, got string"));
+  EXPECT_EQ(server.countLogLines("Listening on port"), 0u);
+}

@@ -244,9 +244,16 @@ TEST(Config, TextsArePaddedCutOrNormalised) {
   // Maintenance folders are normalised like the others; empty entries go.
   const DBConfig m = loadWith(R"({"MaintenanceFolders": ["\\srv\\bak", "/mnt/x/", ""]})");
   EXPECT_EQ(m.MaintenanceFolders, (std::vector<std::string>{"/srv/bak/", "/mnt/x/"}));
-  LogCapture log;
-  EXPECT_TRUE(loadWith(R"({"MaintenanceFolders": "/srv/bak"})").MaintenanceFolders.empty());
-  EXPECT_EQ(log.count("MaintenanceFolders: expected an array of folders, got string"), 1u);
+  // A value that cannot be used is a problem that stops the start, never
+  // a quiet "any path"; a type error in another key does not lose it.
+  EXPECT_TRUE(m.MaintenanceFoldersProblem.empty());
+  const DBConfig notArray = loadWith(R"({"MaintenanceFolders": "/srv/bak"})");
+  EXPECT_TRUE(notArray.MaintenanceFolders.empty());
+  EXPECT_EQ(notArray.MaintenanceFoldersProblem, "MaintenanceFolders: expected an array of folders, got string");
+  EXPECT_EQ(loadWith(R"({"MaintenanceFolders": ["/a", 7]})").MaintenanceFoldersProblem,
+            "MaintenanceFolders: entry 2 is integer, not a folder");
+  const DBConfig afterTypeError = loadWith(R"({"ServerPort": "x", "MaintenanceFolders": ["/srv/bak"]})");
+  EXPECT_EQ(afterTypeError.MaintenanceFolders, (std::vector<std::string>{"/srv/bak/"}));
 }
 
 TEST(NetworkPath, RemoteFileSystemsAreRecognised) {
