@@ -82,6 +82,15 @@ TEST(Metrics, HealthAndCountersMoveWithTheClients) {
     EXPECT_EQ(metric(during, "cvdb_request_duration_seconds_bucket{command=\"SetCfgPart\",le=\"+Inf\"}"), 3);
     EXPECT_GT(metric(during, "cvdb_received_bytes_total"), metric(before, "cvdb_received_bytes_total"));
     EXPECT_EQ(metric(during, "cvdb_buffered_limit_bytes"), 256.0 * 1024 * 1024);
+    // A part read twice: one miss that is kept, one hit.
+    for (int i = 0; i < 2; ++i) c->getCfg("k0");
+    const std::string read = get(port, "/metrics");
+    EXPECT_EQ(metric(read, "cvdb_read_cache_misses_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_hits_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_insertions_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_entries"), 1) << read;
+    EXPECT_GT(metric(read, "cvdb_read_cache_bytes"), 0) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_limit_bytes"), 64.0 * 1024 * 1024) << read;
     // A request that fails ends its connection and counts as a failure.
     EXPECT_EQ(endedBy([&] { c->getData("..", "x"); }), kTerminating);
   }
