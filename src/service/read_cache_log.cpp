@@ -13,14 +13,19 @@ std::string readCacheLine(const DB::ReadCache::Stats& now, const DB::ReadCache::
   std::ostringstream line;
   line << "Read cache: " << hits << " hits, " << misses << " misses";
   if (hits + misses > 0) {
-    line << " (" << std::fixed << std::setprecision(1) << 100.0 * static_cast<double>(hits) / (hits + misses)
-         << "% hits)";
+    line << " (" << std::fixed << std::setprecision(1)
+         << 100.0 * static_cast<double>(hits) / static_cast<double>(hits + misses) << "% hits)";
   }
   line << "; " << now.insertions - before.insertions << " kept, " << now.evictions - before.evictions
-       << " evicted for room, " << now.invalidations - before.invalidations << " dropped by writes, "
+       << " evicted for room, " << now.invalidations - before.invalidations << " dropped by writes or closes, "
        << now.refused - before.refused << " not kept (written meanwhile); " << now.entries << " entries, "
-       << std::setprecision(1) << static_cast<double>(now.bytes) / (1 << 20) << " of " << now.capacity / (1 << 20)
-       << " MiB";
+       << std::setprecision(1);
+  if (now.bytes < (1 << 20)) {
+    line << static_cast<double>(now.bytes) / (1 << 10) << " KiB";
+  } else {
+    line << static_cast<double>(now.bytes) / (1 << 20) << " MiB";
+  }
+  line << " of " << now.capacity / (1 << 20) << " MiB";
   return line.str();
 }
 
