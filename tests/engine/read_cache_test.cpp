@@ -1,17 +1,14 @@
 // The read cache on its own: hits share the kept value, the byte budget
 // with least-recently-used eviction and the per-entry cap, a budget of 0,
 // and the generations that keep a read which began before a write from
-// being kept after it, checked alone and under many threads.
+// being kept after it. Readers and writers at once run through the real
+// server (tests/e2e/cached_reads_e2e_test.cpp).
 
 #include "engine/read_cache.h"
 
 #include <gtest/gtest.h>
 
-#include <array>
-#include <atomic>
 #include <string>
-#include <thread>
-#include <vector>
 
 namespace {
 
@@ -138,62 +135,6 @@ TEST(ReadCache, AReadThatBeganBeforeAWriteIsNotKeptAfterIt) {
   ReadCache::Ticket none;
   cache.insert(kText, none, "db", "k", text("x"), 1);
   EXPECT_EQ(cached(cache, "db", "k"), "(none)");
-}
-
-// Writers and readers on a few keys, the "engine" an array of committed
-// sequence numbers. A writer commits n, invalidates, then acknowledges n;
-// a reader notes the last acknowledged number before it reads and must
-// get at least that, hit or miss. A small budget keeps evictions going.
-TEST(ReadCache, NoReadIsOlderThanTheLastAcknowledgedWriteUnderConcurrency) {
-  constexpr int kKeys = 4;
-  constexpr int kWrites = 3000;
-  ReadCache cache(6 * (ReadCache::kEntryOverhead + 64));
-  std::array<std::atomic<int>, kKeys> committed{};
-  std::array<std::atomic<int>, kKeys> acknowledged{};
-  std::atomic<bool> done{false};
-  std::atomic<int> stale{0};
-  const std::array<std::string, kKeys> keys{"a", "b", "c", "d"};
-
-  std::vector<std::thread> threads;
-  for (int w = 0; w < 2; ++w) {
-    threads.emplace_back([&, w] {
-      for (int n = 1; n <= kWrites; ++n) {
-        const int k = (n + w) % 2 + 2 * w;  // writer 0 owns keys 0-1, writer 1 keys 2-3
-        const int seq = committed[k].load() + 1;
-        committed[k].store(seq);
-        cache.invalidate("db", keys[k]);
-        acknowledged[k].store(seq);
-      }
-    });
-  }
-  for (int r = 0; r < 4; ++r) {
-    threads.emplace_back([&, r] {
-      for (int i = 0; !done.load(); ++i) {
-        const int k = (i + r) % kKeys;
-        const int floor = acknowledged[k].load();
-        ReadCache::Ticket ticket;
-        auto value = cache.find(kNumber, "db", keys[k], ticket);
-        if (!value) {
-          value = std::make_shared<const int>(committed[k].load());
-          if (i % 3 == 0) std::this_thread::yield();  // widen the window
-          cache.insert(kNumber, ticket, "db", keys[k], value, 16);
-        }
-        if (*value < floor) ++stale;
-      }
-    });
-  }
-  threads[0].join();
-  threads[1].join();
-  done = true;
-  for (std::size_t i = 2; i < threads.size(); ++i) threads[i].join();
-  EXPECT_EQ(stale.load(), 0);
-  for (int k = 0; k < kKeys; ++k) {
-    ReadCache::Ticket ticket;
-    const auto last = cache.find(kNumber, "db", keys[k], ticket);
-    if (last) {
-      EXPECT_EQ(*last, kWrites / 2) << keys[k];
-    }
-  }
 }
 
 }  // namespace
