@@ -12,6 +12,8 @@
 #   SECONDS_PER_RUN=5  length of each run
 #   ONLY="kv files packs"  groups to run
 #   FOLDER_PACKS=10000 packs in the folder that the listing reads
+#   SERVER_CONFIG=     more keys of cvdbserver's config.json, e.g.
+#                      '"ReadCacheMiB": 0' to measure without the read cache
 #
 # Needs the build's cvdbserver and load_gen (-DCVDB_BUILD_BENCH=ON); installs
 # redis-server and redis-tools from Debian when they are missing. Both
@@ -24,6 +26,7 @@ runs=${RUNS:-3}
 seconds=${SECONDS_PER_RUN:-5}
 only=${ONLY:-kv files packs}
 folder_packs=${FOLDER_PACKS:-10000}
+server_config=${SERVER_CONFIG:-}
 server_bin=$build/src/service/cvdbserver
 load_gen=$build/bench/load_gen
 for tool in "$server_bin" "$load_gen"; do
@@ -47,10 +50,11 @@ trap cleanup EXIT
 trap 'exit 130' INT TERM
 
 echo "compare-redis: $(nproc) cores, $runs run(s) of ${seconds} s each; load average at start: $(cut -d' ' -f1-3 /proc/loadavg)"
+[[ -z $server_config ]] || echo "compare-redis: cvdbserver settings added: $server_config"
 
 # cvdbserver on a free port, its databases in the temporary folder.
 mkdir -p "$work/home/db" "$work/log"
-echo '{"ServerPort": 0, "ForceIP4": true}' >"$work/home/db/config.json"
+echo "{\"ServerPort\": 0, \"ForceIP4\": true${server_config:+, $server_config}}" >"$work/home/db/config.json"
 "$server_bin" --home "$work/home" --log-dir "$work/log" --console >"$work/server.out" 2>&1 &
 server_pid=$!
 port=

@@ -45,6 +45,7 @@ PoolSettings PoolSettings::from(const DBConfig& config) {
   s.maxClientsPerDB = config.MaxActiveClientsPerDB;
   s.maxWaitMaintenanceSecs = config.MaxWaitMaintenanceOpSecs;
   s.filesPrefix = config.DBFilesPrefix;
+  s.readCacheBytes = config.ReadCacheMiB << 20;
   return s;
 }
 
@@ -58,7 +59,8 @@ DBInstances::DBInstances(Token, PoolSettings settings, Paths paths, sys::Env& en
     : settings_(settings),
       paths_(std::move(paths)),
       env_(env),
-      slots_(std::make_shared<engine::InstanceSlots>(settings.maxActiveDBs)) {}
+      slots_(std::make_shared<engine::InstanceSlots>(settings.maxActiveDBs)),
+      readCache_(settings.readCacheBytes) {}
 
 DBInstances::~DBInstances() {
   // Reached when the service did not stop the pool (a test, an early exit);
@@ -101,6 +103,9 @@ void DBInstances::closeInstance(InstanceRec& record) noexcept {
     Log::Lock(Log::Debug).logStreamLine() << "DBInstances: closing instance for I:" << record.instance->id();
   }
   record.instance->term();
+  // Whatever opens the database next (a restored file, or the same file
+  // after another program had it) is read anew.
+  readCache_.dropDatabase(record.instance->settings().key);
   record.instance.reset();
 }
 

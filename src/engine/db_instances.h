@@ -51,6 +51,7 @@
 #include <unordered_map>
 
 #include "engine/instance.h"
+#include "engine/read_cache.h"
 #include "engine/session.h"
 #include "framework/env.h"
 #include "framework/thread_annotations.h"
@@ -72,6 +73,8 @@ struct PoolSettings {
   std::chrono::milliseconds busyTimeout{10000};
   // Printed at the start; the engine has no use for it.
   std::string filesPrefix = "cvd";
+  // The byte budget of the read cache of every database (0: none).
+  std::uint64_t readCacheBytes = std::uint64_t{64} << 20;
 
   static PoolSettings from(const DBConfig& config);
 };
@@ -143,6 +146,12 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   // Instances of this pool not yet terminated.
   std::uint64_t liveInstances() const noexcept { return slots_->live(); }
 
+  // The cache of point reads of every database (read_cache.h). A database's
+  // entries go whenever its instance closes (dormant, restored, discarded,
+  // stopped), so that a replaced file is never answered from memory.
+  ReadCache& readCache() noexcept { return readCache_; }
+  const ReadCache& readCache() const noexcept { return readCache_; }
+
   // The lock between the data-file writes of one database and the removal
   // of its unused data ids: a write into an id holds dataLock(key, id)
   // shared from its first file operation to its last, and the removal of
@@ -186,6 +195,7 @@ class DBInstances : public std::enable_shared_from_this<DBInstances> {
   sys::Env& env_;
   const std::shared_ptr<engine::InstanceSlots> slots_;
   std::stop_source stopping_;
+  ReadCache readCache_;
 
   struct DataLocks {
     std::shared_mutex stripes[kDataLockStripes];

@@ -69,14 +69,9 @@ void Listener::process(DBNames& cmd) {
 }
 
 void Listener::process(GetCfgPart& cmd) {
-  const MemBuffer stored = dbOfConn(cmd).loadMetaBlob(cmd.key());
-  if (stored.empty()) {
-    cmd.setResp(json::Value());
-    return;
-  }
   // Keys are shared with pack contents: bytes that are not a JSON object
   // make the parser throw, which ends this connection and nothing else.
-  cmd.setResp(json::strToObject(reinterpret_cast<const char*>(stored.data()), stored.size()));
+  cmd.setResp(dbOfConn(cmd).cfgPartText(cmd.key()));
 }
 
 void Listener::process(SetCfgPart& cmd) {

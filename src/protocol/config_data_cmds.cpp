@@ -40,7 +40,15 @@ void GetCfgPart::readRequest(wire::Reader& in) {
 
 void GetCfgPart::writeRequest(wire::Writer& out) const { out.str(key_); }
 
-void GetCfgPart::writeAnswer(wire::Writer& out) const { wirefmt::writeJson(out, resp_); }
+void GetCfgPart::writeAnswer(wire::Writer& out) const {
+  if (!text_) {
+    wirefmt::writeJson(out, resp_);
+    return;
+  }
+  // The json? field of wirefmt::writeJson from the text it would dump.
+  out.boolean(!text_->empty());
+  if (!text_->empty()) out.str(*text_);
+}
 
 void GetCfgPart::readAnswer(wire::Reader& in) {
   resp_ = wirefmt::readJson(in);

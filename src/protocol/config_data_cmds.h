@@ -3,6 +3,7 @@
 // configuration parts and data files, and the database list.
 
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -56,7 +57,18 @@ class GetCfgPart final : public DbCmd<GetCfgPart> {
   void setRequest(std::string key) { key_ = std::move(key); }
 
   // The stored object, or an empty value when there is none.
-  void setResp(json::Value v) { resp_ = std::move(v); }
+  void setResp(json::Value v) {
+    resp_ = std::move(v);
+    text_.reset();
+  }
+  // The server's answer as the object's compact text, shared with the
+  // store's read cache: written as it is, with no parse or dump on the
+  // way ("" when there is no part).
+  void setResp(std::shared_ptr<const std::string> text) {
+    resp_ = json::Value();
+    text_ = std::move(text);
+  }
+  // The client's answer (readAnswer), or what setResp(json::Value) set.
   const json::Value& respCfg() const noexcept { return resp_; }
 
   void readRequest(wire::Reader& in) override;
@@ -67,6 +79,7 @@ class GetCfgPart final : public DbCmd<GetCfgPart> {
  private:
   std::string key_;
   json::Value resp_;
+  std::shared_ptr<const std::string> text_;
 };
 
 // Tag 5: writes or deletes one configuration part.

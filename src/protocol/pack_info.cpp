@@ -109,6 +109,20 @@ bool UseInfos::hasOtherKeys() const noexcept {
   return n > (json_object_get(storedList_.get(), kEntriesKey) != nullptr ? 1u : 0u);
 }
 
+void UseInfos::dropOlderThan(std::int64_t oldest) {
+  std::size_t kept = 0;
+  for (std::size_t i = 0; i < entries_.size(); ++i) {
+    if (entries_[i].time < oldest) continue;
+    if (kept != i) {
+      entries_[kept] = std::move(entries_[i]);
+      stored_[kept] = std::move(stored_[i]);
+    }
+    ++kept;
+  }
+  entries_.resize(kept);
+  stored_.resize(kept);
+}
+
 const UseInfo* UseInfos::find(const std::string& host, std::uint32_t process, UseInfo::State state) const {
   for (const UseInfo& u : entries_) {
     if (u.state == state && u.process == process && u.host == host) return &u;

@@ -90,6 +90,9 @@ class UseInfos {
   // Removes the entry that e points to (from find or findUploadInf);
   // returns false if e is not an entry of this list.
   bool remove(const UseInfo* e);
+  // Drops the entries stamped before oldest: what a read of the stored
+  // list with the limit that oldestUseKept turned into oldest drops.
+  void dropOlderThan(std::int64_t oldest);
   void append(UseInfo entry) {
     entries_.push_back(std::move(entry));
     stored_.emplace_back();

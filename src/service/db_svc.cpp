@@ -4,6 +4,7 @@
 
 #include <iostream>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <vector>
 
@@ -14,6 +15,7 @@
 #include "ipc/listener.h"
 #include "maintenance/restore_journal.h"
 #include "service/metrics_page.h"
+#include "service/read_cache_log.h"
 #include "settings/config.h"
 #include "store/stale_files.h"
 
@@ -124,6 +126,8 @@ void DBSvc::runSvc() {
     const auto started = pool->env().now();
     std::jthread sweeper(
         [pool, started](std::stop_token stop) { DB::removeStaleTempFiles(pool->env(), pool->paths(), started, stop); });
+    // Destroyed before the pool stops, logging the cache's totals.
+    std::optional<ReadCacheLog> cacheLog(std::in_place, pool->readCache(), pool->env());
     Ipc::SvcStub::Options transport;
     transport.memoryBudget = config.MaxBufferedMiB << 20;  // 0 stays 0: no limit
     transport.tls = config.tlsFiles();
@@ -152,6 +156,7 @@ void DBSvc::runSvc() {
     sweeper.request_stop();
     sweeper.join();
     unrecovered.clear();
+    cacheLog.reset();
     pool->stop();
     debugLine("Svc stopped");
   } catch (const std::exception& e) {

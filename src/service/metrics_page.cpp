@@ -50,6 +50,20 @@ std::string metricsPage(Ipc::DB::Listener& listener, const DB::DBInstances& pool
   gauge(out, "cvdb_commit_grouped_requests_total", "Write requests carried by those groups.", commits.requests,
         "counter");
   gauge(out, "cvdb_commit_group_largest", "The most write requests that shared one commit.", commits.largest);
+  const DB::ReadCache::Stats cache = pool.readCache().stats();
+  gauge(out, "cvdb_read_cache_hits_total", "Configuration-part and pack-record reads answered from memory.", cache.hits,
+        "counter");
+  gauge(out, "cvdb_read_cache_misses_total", "Such reads that went to the database.", cache.misses, "counter");
+  gauge(out, "cvdb_read_cache_insertions_total", "Values kept after a miss.", cache.insertions, "counter");
+  gauge(out, "cvdb_read_cache_evictions_total", "Values dropped for room (least recently used first).", cache.evictions,
+        "counter");
+  gauge(out, "cvdb_read_cache_invalidations_total", "Values dropped by writes, restores and closed databases.",
+        cache.invalidations, "counter");
+  gauge(out, "cvdb_read_cache_refused_total", "Values not kept because a write of the key came during the read.",
+        cache.refused, "counter");
+  gauge(out, "cvdb_read_cache_entries", "Values kept.", cache.entries);
+  gauge(out, "cvdb_read_cache_bytes", "Memory the kept values take (estimate).", cache.bytes);
+  gauge(out, "cvdb_read_cache_limit_bytes", "The cache's budget (ReadCacheMiB; 0: off).", cache.capacity);
   listener.stats().write(out);
   return out.str();
 }

@@ -1,7 +1,8 @@
 #pragma once
 // The /metrics page of the server (Prometheus text format): the
 // commands' counts and times, the connections, the memory budget, the
-// bytes on the wire, and the open databases against their limit.
+// bytes on the wire, the open databases against their limit, and the read
+// cache's hit rate.
 
 #include <string>
 

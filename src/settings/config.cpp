@@ -22,6 +22,7 @@ constexpr std::size_t kPrefixLength = 3;
 // 1 TiB: beyond any machine the server runs on, and far from overflowing
 // when turned into bytes.
 constexpr std::uint64_t kMaxBufferedMiBLimit = std::uint64_t{1} << 20;
+constexpr std::uint64_t kReadCacheMiBLimit = std::uint64_t{1} << 20;
 
 // Set while a test installs its own record; inst() must stay a single load
 // on the hot path, hence an atomic pointer rather than a lock.
@@ -92,6 +93,9 @@ void readKeys(const json::Object& obj, DBConfig& c) {
   if (const auto v = obj.get("EnableEngineLogging"); !v.empty()) c.EnableEngineLogging = v.isTrue();
   if (const auto v = obj.get("MaxBufferedMiB"); !v.empty()) {
     c.MaxBufferedMiB = limited(v.asInteger(), kMaxBufferedMiBLimit);
+  }
+  if (const auto v = obj.get("ReadCacheMiB"); !v.empty()) {
+    c.ReadCacheMiB = limited(v.asInteger(), kReadCacheMiBLimit);
   }
   if (const auto v = obj.get("MetricsPort"); !v.empty()) c.MetricsPort = static_cast<std::uint16_t>(v.asInteger());
   if (const auto v = obj.get("MetricsAddress"); !v.empty()) c.MetricsAddress = v.asString();
@@ -209,6 +213,7 @@ std::string DBConfig::printout() const {
       << "\tdb engine event logging: " << onOff(EnableEngineLogging) << '\n'
       << "\tmaximum buffered memory (MiB): "
       << (MaxBufferedMiB == 0 ? std::string("unlimited") : std::to_string(MaxBufferedMiB)) << '\n'
+      << "\tread cache (MiB): " << (ReadCacheMiB == 0 ? std::string("off") : std::to_string(ReadCacheMiB)) << '\n'
       << "\tclient connections: ";
   const Ipc::TlsFiles tls = tlsFiles();
   if (!TlsProblem.empty()) {

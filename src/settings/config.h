@@ -36,6 +36,9 @@ class DBConfig {
   // Memory that connections may hold in buffers, all together, in MiB
   // (answers queued for clients, large requests); 0: no limit.
   std::uint64_t MaxBufferedMiB = 256;
+  // The byte budget, in MiB, of what the server keeps of configuration
+  // parts and pack records read (every database together); 0: nothing.
+  std::uint64_t ReadCacheMiB = 64;
   // Folders that backup targets and restore sources must lie in (with the
   // backup folder, always allowed); empty allows any path.
   std::vector<std::string> MaintenanceFolders;

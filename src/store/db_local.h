@@ -91,7 +91,16 @@ class DBLocal {
   // ---- Named values (table "meta") --------------------------------------
   // The value of key; empty when there is no row or the value is empty.
   MemBuffer loadMetaBlob(const std::string& key);
+  // The configuration part of key as a read of it answers: its compact
+  // JSON text, "" when there is none. Served from the pool's read cache
+  // when nothing wrote the key since it was kept (store/cached_reads.h).
+  // Throws json::Exc when the stored bytes are not a JSON object (a pack
+  // content under the key); that is never kept.
+  using CfgText = std::shared_ptr<const std::string>;
+  CfgText cfgPartText(const std::string& key);
   // Inserts or replaces the value of key (in a transaction with retry).
+  // Every write of either table drops the key's cached reads before it
+  // returns, also when it fails.
   // A key longer than 255 bytes, or a value longer than the engine's
   // length limit, fails with the engine's error.
   void saveMetaBlob(const void* data, std::uint64_t length, const std::string& key);
@@ -139,7 +148,9 @@ class DBLocal {
   // The records of folder (of every folder when it is empty), ordered by
   // folder, then status, then id.
   Ipc::PackInfosPtr infos(const std::string& folder);
-  // The record of id; null when there is none.
+  // The record of id; null when there is none. Served from the pool's read
+  // cache when nothing wrote the pack since it was kept; the use list's
+  // time limit applies all the same.
   Ipc::PackInfoPtr infoFor(const std::string& id);
   // Applies a record that may be partial: a complete one creates a missing
   // pack; otherwise the fields present are changed and every other stored
@@ -196,8 +207,9 @@ class DBLocal {
 
  private:
   // The record of a row of the pack statements (columns id, folder,
-  // status, blob). Throws json::Exc when the stored object is not JSON.
-  Ipc::PackInfo readInfo(const engine::Statement& row) const;
+  // status, blob), its use list read with useLimit (0: whole). Throws
+  // json::Exc when the stored object is not JSON.
+  Ipc::PackInfo readInfo(const engine::Statement& row, std::uint64_t useLimit = Ipc::kUseLimitSeconds) const;
   // The write that every pack writer shares, inside the caller's
   // transaction. useUpdate: the caller is a fetch with a use entry, which
   // wants the complete record back. Returns null only for a CloseEdit on a

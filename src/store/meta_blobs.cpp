@@ -6,8 +6,11 @@
 
 #include "engine/blob_io.h"
 #include "engine/db_exc.h"
+#include "engine/db_instances.h"
 #include "engine/engine_errors.h"
+#include "framework/json.h"
 #include "framework/log.h"
+#include "store/cached_reads.h"
 #include "store/db_local.h"
 #include "store/schema.h"
 
@@ -94,7 +97,29 @@ MemBuffer DBLocal::loadMetaBlob(const std::string& key) {
   return value;
 }
 
+DBLocal::CfgText DBLocal::cfgPartText(const std::string& key) {
+  session();  // a closed store refuses, hit or not
+  ReadCache& cache = pool_->readCache();
+  ReadCache::Ticket ticket;
+  if (CfgText hit = cache.find(kCachedCfgParts, name_, key, ticket)) {
+    if (g_LogVerbose) {
+      Log::Lock(Log::Debug).logStreamLine()
+          << "DB:cfgPartText S:" << sessionId() << " Cached part for key " << key << " size: " << hit->size();
+    }
+    return hit;
+  }
+  const MemBuffer stored = loadMetaBlob(key);
+  // Keys are shared with pack contents: bytes that are not a JSON object
+  // throw here (json::Exc), and nothing is kept.
+  auto text = std::make_shared<const std::string>(
+      stored.empty() ? std::string()
+                     : json::strToObject(reinterpret_cast<const char*>(stored.data()), stored.size()).dump());
+  cache.insert(kCachedCfgParts, ticket, name_, key, text, text->size());
+  return text;
+}
+
 void DBLocal::saveMetaBlob(const void* data, std::uint64_t length, const std::string& key) {
+  const InvalidateOnExit written(pool_->readCache(), name_, key);
   write(length, [&] { putMeta(key, data, length); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine()
@@ -103,6 +128,7 @@ void DBLocal::saveMetaBlob(const void* data, std::uint64_t length, const std::st
 }
 
 bool DBLocal::removeMetaBlob(const std::string& key) {
+  const InvalidateOnExit written(pool_->readCache(), name_, key);
   const bool deleted = write(key.size(), [&] { return deleteMeta(key); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:removeMetaBlob S:" << sessionId() << ' '

@@ -5,7 +5,9 @@
 #include <string_view>
 
 #include "engine/db_exc.h"
+#include "engine/db_instances.h"
 #include "framework/log.h"
+#include "store/cached_reads.h"
 #include "store/db_local.h"
 #include "store/pack_sql.h"
 #include "store/stored_record_reader.h"
@@ -27,13 +29,31 @@ void logInfoFor(std::uint64_t session, const std::string& id, const Ipc::PackInf
   }
 }
 
+// The record as the cache keeps it: the use entries alone, without the
+// stored JSON of each (which only a write needs), so that copies made by
+// concurrent readers share nothing but immutable bytes.
+Ipc::PackInfo keptRecord(Ipc::PackInfo record) {
+  Ipc::UseInfos uses;
+  for (const Ipc::UseInfo& u : record.uses) uses.append(u);
+  record.uses = std::move(uses);
+  return record;
+}
+
 bool isCloseEdit(const Ipc::PackInfo& request) {
   return !request.uses.empty() && request.uses.front().state == Ipc::UseInfo::CloseEdit;
 }
 
 }  // namespace
 
-Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) const {
+std::uint64_t cachedBytes(const std::optional<Ipc::PackInfo>& record) noexcept {
+  if (!record) return 0;
+  std::uint64_t bytes = sizeof(Ipc::PackInfo) + record->id().size() + record->folder().size() + record->name.size() +
+                        record->owner.size();
+  for (const Ipc::UseInfo& u : record->uses) bytes += sizeof(Ipc::UseInfo) + u.host.size() + u.user.size();
+  return bytes;
+}
+
+Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row, std::uint64_t useLimit) const {
   Ipc::PackInfo info(std::string(row.columnBytes(0)));
   info.setFolder(std::string(row.columnBytes(1)));
   info.setStatus(static_cast<std::int32_t>(row.columnInt64(2)));
@@ -41,7 +61,7 @@ Ipc::PackInfo DBLocal::readInfo(const engine::Statement& row) const {
   // Every writer stores an object with the row; an empty value (a row
   // written by hand) reads as a record without further fields. The text is
   // streamed into the record's fields, with no JSON tree in between.
-  if (!blob.empty()) Ipc::readStoredPackInfo(blob, Ipc::kUseLimitSeconds, env_.nowSeconds(), info);
+  if (!blob.empty()) Ipc::readStoredPackInfo(blob, useLimit, useLimit == 0 ? 0 : env_.nowSeconds(), info);
   return info;
 }
 
@@ -60,10 +80,27 @@ Ipc::PackInfosPtr DBLocal::infos(const std::string& folder) {
 }
 
 Ipc::PackInfoPtr DBLocal::infoFor(const std::string& id) {
-  auto row = session().prepare(pack_sql::kSelectInfo);
-  row.bindBlob(1, id);
+  session();  // a closed store refuses, hit or not
+  ReadCache& cache = pool_->readCache();
+  ReadCache::Ticket ticket;
+  auto stored = cache.find(kCachedPackRecords, name_, id, ticket);
+  if (!stored) {
+    std::optional<Ipc::PackInfo> record;
+    {
+      auto row = session().prepare(pack_sql::kSelectInfo);
+      row.bindBlob(1, id);
+      // The whole use list: the time limit applies below, on every read.
+      if (row.step()) record = keptRecord(readInfo(row, 0));
+    }
+    const std::uint64_t bytes = cachedBytes(record);
+    stored = std::make_shared<const std::optional<Ipc::PackInfo>>(std::move(record));
+    cache.insert(kCachedPackRecords, ticket, name_, id, stored, bytes);
+  }
   Ipc::PackInfoPtr info;
-  if (row.step()) info = std::make_shared<Ipc::PackInfo>(readInfo(row));
+  if (*stored) {
+    info = std::make_shared<Ipc::PackInfo>(**stored);
+    info->uses.dropOlderThan(Ipc::oldestUseKept(Ipc::kUseLimitSeconds, env_.nowSeconds()));
+  }
   if (g_LogVerbose) logInfoFor(sessionId(), id, info);
   return info;
 }
@@ -122,6 +159,7 @@ Ipc::PackInfoPtr DBLocal::upsertInfo(const Ipc::PackInfo& request, bool useUpdat
 }
 
 Ipc::PackInfoPtr DBLocal::updateInfo(const Ipc::PackInfo& request) {
+  const InvalidateOnExit written(pool_->readCache(), name_, request.id());
   Ipc::PackInfoPtr result = write(kRecordBytes, [&] { return upsertInfo(request, false); });
   if (g_LogVerbose) {
     Log::Lock(Log::Debug).logStreamLine() << "DB:updateInfo S:" << sessionId() << " Info for " << request.id()
@@ -131,6 +169,7 @@ Ipc::PackInfoPtr DBLocal::updateInfo(const Ipc::PackInfo& request) {
 }
 
 void DBLocal::savePackMeta(const Ipc::PackInfo& request, const void* content, std::uint64_t length) {
+  const InvalidateOnExit written(pool_->readCache(), name_, request.id());
   const bool stored = write(kRecordBytes + length, [&] {
     // No record means a CloseEdit for a missing pack: a content without a
     // record could be neither fetched nor erased.
@@ -166,6 +205,7 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
     return found;
   }
 
+  const InvalidateOnExit written(pool_->readCache(), name_, id);
   PackMeta changed = write(kRecordBytes, [&] {
     PackMeta m;
     m.info = upsertInfo(request, true);
@@ -181,6 +221,7 @@ DBLocal::PackMeta DBLocal::packMetadata(const Ipc::PackInfo& request) {
 }
 
 void DBLocal::removePack(const std::string& id) {
+  const InvalidateOnExit written(pool_->readCache(), name_, id);
   const bool removed = write(kRecordBytes, [&] {
     auto& s = session();
     {

@@ -98,6 +98,15 @@ TEST(Metrics, HealthAndCountersMoveWithTheClients) {
     EXPECT_EQ(metric(maintained, "cvdb_maintenance_last_success{command=\"Backup\"}"), 1) << maintained;
     EXPECT_GE(metric(maintained, "cvdb_maintenance_last_duration_seconds{command=\"Backup\"}"), 0);
     EXPECT_GE(metric(maintained, "cvdb_transaction_retries_total"), 0);
+    // A part read twice: one miss that is kept, one hit.
+    for (int i = 0; i < 2; ++i) c->getCfg("k0");
+    const std::string read = get(port, "/metrics");
+    EXPECT_EQ(metric(read, "cvdb_read_cache_misses_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_hits_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_insertions_total"), 1) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_entries"), 1) << read;
+    EXPECT_GT(metric(read, "cvdb_read_cache_bytes"), 0) << read;
+    EXPECT_EQ(metric(read, "cvdb_read_cache_limit_bytes"), 64.0 * 1024 * 1024) << read;
     // A request that fails ends its connection and counts as a failure.
     EXPECT_EQ(endedBy([&] { c->getData("..", "x"); }), kTerminating);
   }

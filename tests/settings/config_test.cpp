@@ -68,6 +68,7 @@ TEST(Config, MissingFileGivesDefaultsAndPrintsThemAsOneEntry) {
                                "\tmaximum wait time maintenance operation: 10\n"
                                "\tdb engine event logging: disabled\n"
                                "\tmaximum buffered memory (MiB): 256\n"
+                               "\tread cache (MiB): 64\n"
                                "\tclient connections: plain TCP\n";
   const auto entries = log.entries();
   ASSERT_EQ(entries.size(), 1u);
@@ -213,6 +214,14 @@ TEST(Config, NumbersAreLimitedAndTruncatedAsStored) {
   EXPECT_NE(off.printout().find("\tmaximum buffered memory (MiB): unlimited\n"), std::string::npos);
   EXPECT_EQ(loadWith(R"({"MaxBufferedMiB": -1})").MaxBufferedMiB, std::uint64_t{1} << 20);
   EXPECT_EQ(loadWith(R"({"MaxBufferedMiB": 64})").MaxBufferedMiB, 64u);
+
+  // The read cache: 64 MiB unless set, 0 switches it off, 1 TiB at most.
+  EXPECT_EQ(loadWith("{}").ReadCacheMiB, 64u);
+  EXPECT_NE(loadWith("{}").printout().find("\tread cache (MiB): 64\n"), std::string::npos);
+  const DBConfig noCache = loadWith(R"({"ReadCacheMiB": 0})");
+  EXPECT_EQ(noCache.ReadCacheMiB, 0u);
+  EXPECT_NE(noCache.printout().find("\tread cache (MiB): off\n"), std::string::npos);
+  EXPECT_EQ(loadWith(R"({"ReadCacheMiB": -1})").ReadCacheMiB, std::uint64_t{1} << 20);
 }
 
 TEST(Config, TextsArePaddedCutOrNormalised) {
