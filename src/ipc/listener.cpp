@@ -45,7 +45,11 @@ void Listener::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
       Log::Lock entry(Log::Error);
       entry.logStreamLine() << "Dispatching command " << cmd->name() << " failed with " << e.what();
     }
+    // Counted before the client learns of the failure: a scrape that
+    // follows the ended connection finds it.
+    stats_.record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
     cmd->onTransferError("Terminating client connection due to processing error");
+    return;
   }
   stats_->record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
 }
