@@ -47,7 +47,7 @@ void Listener::processCmd(std::shared_ptr<Ipc::CmdI> cmd) {
     }
     // Counted before the client learns of the failure: a scrape that
     // follows the ended connection finds it.
-    stats_.record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
+    stats_->record(cmd->tag(), cmd->name(), std::chrono::steady_clock::now() - started, failed);
     cmd->onTransferError("Terminating client connection due to processing error");
     return;
   }

@@ -65,11 +65,15 @@ TEST(ServerCommandLine, CheckConfigPrintsTheSettingsAndFailsOnWhatItCannotTake) 
   EXPECT_TRUE(has(good.output, "\tTCP listening port: 4000\n")) << good.output;
   EXPECT_TRUE(has(good.output, "\tmaintenance folders: \"/srv/bak/\"\n")) << good.output;
 
-  for (const char* bad : {R"({"ServerPort": "4000"})", "not json", R"({"MaintenanceFolders": "/srv"})"}) {
+  for (const char* bad : {R"({"ServerPort": "4000"})", "not json"}) {
     const auto r = check(bad);
     EXPECT_EQ(r.status, 1) << bad;
     EXPECT_TRUE(has(r.output, "Not taken whole: ")) << r.output;
   }
+  const auto unconfined = check(R"({"MaintenanceFolders": "/srv"})");
+  EXPECT_EQ(unconfined.status, 1);
+  EXPECT_TRUE(has(unconfined.output, "The server would not start: MaintenanceFolders: expected an array of folders"))
+      << unconfined.output;
 }
 
 TEST(ServerLifecycle, EitherSignalStopsItPromptlyAndCleanlyWithIdleClientsConnected) {
