@@ -62,7 +62,7 @@ class CommitQueueTest : public EngineTest {
   // saw before, so that order and visibility show in the result.
   Writer appender(const std::string& name, std::vector<std::string>& seen, std::size_t slot) {
     return Writer{openSession(instance_),
-                  [this, name, &seen, slot](engine::Session& s) {
+                  [name, &seen, slot](engine::Session& s) {
                     auto read = s.prepare("SELECT blob FROM blobs WHERE id = CAST('log' AS BLOB)");
                     seen[slot] = read.step() ? std::string(read.columnBytes(0)) : std::string();
                     read.reset();
